@@ -1,0 +1,71 @@
+#ifndef TAVOCONFIGSTORE_CONFIG_STORE_H_
+#define TAVOCONFIGSTORE_CONFIG_STORE_H_
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "TavoConfigStore/ConfigStoreException.h"
+#include "TavoConfigStore/ConfigStoreObjectId.h"
+#include "TavoConfigStore/Export.h"
+#include "TavoConfigStore/StoreObject.h"
+
+namespace TavoConfigStore {
+
+// The namespace every host component shares.
+extern CONFIGSTORE_EXPORT const std::string sGlobalNamespace;
+
+// The host's configuration store. Every operation reports failure by throwing
+// ConfigStoreException.
+//
+// Semantics common to both backends:
+//  - Objects come back in the order in which they were written. SetObject of
+//    an identifier that is stored already replaces the object whole, its
+//    sub-objects included, and the object moves to the end of that order.
+//  - An empty instance id is an ordinary identifier: it can be stored and
+//    fetched. In a filter, an empty part matches anything.
+//  - Inside a transaction the caller sees its own writes; AbortTransaction
+//    restores exactly the state at BeginTransaction. Begin while a transaction
+//    is open, and Commit without one, fail; Abort without one does nothing.
+//  - Outside a transaction each write is committed at once.
+class CONFIGSTORE_EXPORT ConfigStore {
+ public:
+  // The store for "nameSpace" (only sGlobalNamespace is served). This is the
+  // store installed with SetGlobalStore, or else the SQLite store at
+  // DefaultStorePath(); the SQLite connection is cached per thread and
+  // process, so calling this on every operation is cheap.
+  static std::shared_ptr<ConfigStore> GetStore(const std::string& nameSpace);
+
+  virtual ~ConfigStore();
+
+  // The object with that identifier, or null when there is none.
+  virtual std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) = 0;
+  // Writes a copy of the object with its values and sub-objects. "flags" is
+  // reserved and must be 0.
+  virtual void SetObject(const std::shared_ptr<ConfigStoreObject>& object, std::int32_t& flags) = 0;
+  virtual void DeleteObjects(const std::shared_ptr<FilterSpecObject>& filter) = 0;
+  // Every object the filter matches, in write order, read from one snapshot.
+  virtual std::vector<std::shared_ptr<ConfigStoreObject>> GetObjects(
+      const std::shared_ptr<FilterSpecObject>& filter) = 0;
+  virtual void BeginTransaction() = 0;
+  virtual void CommitTransaction() = 0;
+  virtual void AbortTransaction() = 0;
+};
+
+// Backends. Each call returns a new, independent connection.
+CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewSqliteStore(const std::string& path);
+CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewMemoryStore();
+
+// $TAVO_CONFIGSTORE_PATH, else $XDG_STATE_HOME/tavo/configstore.db, else
+// $HOME/.local/state/tavo/configstore.db. Missing directories are created
+// when the store is opened, not here.
+CONFIGSTORE_EXPORT std::string DefaultStorePath();
+
+// Makes GetStore return "store" for the whole process (null restores the
+// default SQLite store). Meant for tests and for hosts that embed the store.
+CONFIGSTORE_EXPORT void SetGlobalStore(std::shared_ptr<ConfigStore> store);
+
+}  // namespace TavoConfigStore
+
+#endif  // TAVOCONFIGSTORE_CONFIG_STORE_H_

@@ -1,0 +1,42 @@
+#ifndef TAVOCONFIGSTORE_CONFIG_STORE_EXCEPTION_H_
+#define TAVOCONFIGSTORE_CONFIG_STORE_EXCEPTION_H_
+
+#include <cstdint>
+#include <memory>
+#include <string>
+
+#include "TavoConfigStore/Export.h"
+#include "Velk/VelkException.h"
+
+namespace TavoConfigStore {
+
+// Every failure of the configuration store. The code is the backend's own
+// (SQLite's extended result code for the SQLite store); a copy keeps message
+// and code and shares the detail.
+class CONFIGSTORE_EXPORT ConfigStoreException : public Velk::Lib::VelkException {
+ public:
+  ConfigStoreException(std::string message, std::int32_t code,
+                       std::shared_ptr<const void> detail = nullptr);
+  ConfigStoreException(const ConfigStoreException&) = default;
+  ConfigStoreException& operator=(const ConfigStoreException&) = default;
+  ~ConfigStoreException() override;
+
+  std::int32_t Code() const noexcept { return code_; }
+
+ private:
+  std::int32_t code_;
+};
+
+// Codes raised by the store itself rather than passed on from SQLite.
+enum StoreErrorCode : std::int32_t {
+  kErrorUnknownNamespace = 1001,  // GetStore with a namespace it does not serve
+  kErrorNotAStore = 1002,         // a file that is not a store, or of an unknown schema version
+  kErrorCorruptObject = 1003,     // an object whose stored encoding cannot be read
+  kErrorNoTransaction = 1004,     // Commit or Abort with no open transaction
+  kErrorNestedTransaction = 1005, // Begin while a transaction is open
+  kErrorInjected = 1006,          // default code of a fault injected by a test
+};
+
+}  // namespace TavoConfigStore
+
+#endif  // TAVOCONFIGSTORE_CONFIG_STORE_EXCEPTION_H_

@@ -1,0 +1,114 @@
+// The in-memory backend: the store's semantics without a file, for tests.
+
+#include <map>
+#include <mutex>
+#include <optional>
+#include <tuple>
+
+#include "TavoConfigStore/CallProbe.h"
+#include "TavoConfigStore/ConfigStore.h"
+
+namespace TavoConfigStore {
+namespace {
+
+using IdKey = std::tuple<std::string, std::string, std::string, std::string>;
+
+IdKey KeyOf(const ConfigStoreObjectId& id) {
+  return {id.Key(), id.Group(), id.Component(), id.InstanceId()};
+}
+
+struct State {
+  std::uint64_t nextSeq = 1;
+  // Write order; objects are immutable copies, so a snapshot shares them.
+  std::map<std::uint64_t, std::shared_ptr<const ConfigStoreObject>> bySeq;
+  std::map<IdKey, std::uint64_t> index;
+};
+
+class MemoryStore final : public ConfigStore {
+ public:
+  std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
+    NotifyCall("GetObject");
+    std::lock_guard<std::mutex> lock(mu_);
+    auto it = state_.index.find(KeyOf(id));
+    if (it == state_.index.end()) return nullptr;
+    return state_.bySeq.at(it->second)->Clone();
+  }
+
+  void SetObject(const std::shared_ptr<ConfigStoreObject>& object, std::int32_t& /*flags*/) override {
+    NotifyCall("SetObject");
+    std::shared_ptr<const ConfigStoreObject> copy = object->Clone();
+    std::lock_guard<std::mutex> lock(mu_);
+    IdKey key = KeyOf(object->Id());
+    auto it = state_.index.find(key);
+    if (it != state_.index.end()) {
+      state_.bySeq.erase(it->second);
+      state_.index.erase(it);
+    }
+    const std::uint64_t seq = state_.nextSeq++;
+    state_.bySeq.emplace(seq, std::move(copy));
+    state_.index.emplace(std::move(key), seq);
+  }
+
+  void DeleteObjects(const std::shared_ptr<FilterSpecObject>& filter) override {
+    NotifyCall("DeleteObjects");
+    std::lock_guard<std::mutex> lock(mu_);
+    for (auto it = state_.bySeq.begin(); it != state_.bySeq.end();) {
+      if (filter->Matches(it->second->Id())) {
+        state_.index.erase(KeyOf(it->second->Id()));
+        it = state_.bySeq.erase(it);
+      } else {
+        ++it;
+      }
+    }
+  }
+
+  std::vector<std::shared_ptr<ConfigStoreObject>> GetObjects(
+      const std::shared_ptr<FilterSpecObject>& filter) override {
+    NotifyCall("GetObjects");
+    std::lock_guard<std::mutex> lock(mu_);
+    std::vector<std::shared_ptr<ConfigStoreObject>> out;
+    for (const auto& [seq, object] : state_.bySeq) {
+      if (filter->Matches(object->Id())) out.push_back(object->Clone());
+    }
+    return out;
+  }
+
+  void BeginTransaction() override {
+    NotifyCall("BeginTransaction");
+    std::lock_guard<std::mutex> lock(mu_);
+    if (saved_) {
+      throw ConfigStoreException("configuration store: a transaction is already open",
+                                 kErrorNestedTransaction);
+    }
+    saved_ = state_;
+  }
+
+  void CommitTransaction() override {
+    NotifyCall("CommitTransaction");
+    std::lock_guard<std::mutex> lock(mu_);
+    if (!saved_) {
+      throw ConfigStoreException("configuration store: no transaction to commit",
+                                 kErrorNoTransaction);
+    }
+    saved_.reset();
+  }
+
+  void AbortTransaction() override {
+    NotifyCall("AbortTransaction");
+    std::lock_guard<std::mutex> lock(mu_);
+    if (!saved_) return;
+    state_ = std::move(*saved_);
+    saved_.reset();
+  }
+
+ private:
+  std::mutex mu_;
+  State state_;
+  std::optional<State> saved_;  // the state at BeginTransaction, while one is open
+};
+
+}  // namespace
+
+std::shared_ptr<ConfigStore> NewMemoryStore() { return std::make_shared<MemoryStore>(); }
+
+}  // namespace TavoConfigStore
