@@ -33,9 +33,9 @@ std::string DigestOfDigests(std::vector<KeyedText>& records) {
 
 std::string PolicyText(KarstPolicyInfo& policy) {
   // "%s" stops at a NUL: name, policy_id and description count only up to it.
-  std::string text = Velk::Misc::StrPrintf("%s%s%s%ld", policy.name.c_str(),
-                                           policy.policy_id.c_str(),
-                                           policy.description.c_str(), policy.generation_number);
+  std::string text =
+      Velk::Misc::StrPrintf("%s%s%s%ld", policy.name.c_str(), policy.policy_id.c_str(),
+                            policy.description.c_str(), policy.generation_number);
   std::vector<KeyedText> blobs;
   blobs.reserve(policy.blobs.size());
   for (KarstPolicyBlob& blob : policy.blobs) {
@@ -66,10 +66,9 @@ std::string GetDatastoreDbHash() {
   std::vector<KeyedText> records;
   records.reserve(datastores.size());
   for (KarstDatastoreInfo& d : datastores) {
-    std::string text =
-        Velk::Misc::StrCat(d.url.data(), d.url.size(), d.datastore_namespace.data(),
-                           d.datastore_namespace.size(), d.drp_policy_id.data(),
-                           d.drp_policy_id.size());
+    std::string text = Velk::Misc::StrCat(d.url.data(), d.url.size(), d.datastore_namespace.data(),
+                                          d.datastore_namespace.size(), d.drp_policy_id.data(),
+                                          d.drp_policy_id.size());
     records.push_back({std::move(d.url), std::move(text)});
   }
   return DigestOfDigests(records);

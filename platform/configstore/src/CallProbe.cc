@@ -33,8 +33,7 @@ void NotifyCall(const char* operation) {
 }
 
 void FaultInjector::FailStoreError(const std::string& operation, int nth,
-                                   const std::string& message, std::int32_t code,
-                                   bool persistent) {
+                                   const std::string& message, std::int32_t code, bool persistent) {
   FailWith(
       operation, nth, [message, code] { throw ConfigStoreException(message, code); }, persistent);
 }

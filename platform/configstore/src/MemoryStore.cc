@@ -34,7 +34,8 @@ class MemoryStore final : public ConfigStore {
     return state_.bySeq.at(it->second)->Clone();
   }
 
-  void SetObject(const std::shared_ptr<ConfigStoreObject>& object, std::int32_t& /*flags*/) override {
+  void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
+                 std::int32_t& /*flags*/) override {
     NotifyCall("SetObject");
     std::shared_ptr<const ConfigStoreObject> copy = object->Clone();
     std::lock_guard<std::mutex> lock(mu_);

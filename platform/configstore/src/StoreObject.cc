@@ -55,8 +55,7 @@ bool StoreObject::GetValue(const char* name, long long* value) const {
 
 ConfigStoreObject::ConfigStoreObject(const ConfigStoreObjectId& id) : id_(id) {}
 
-ConfigStoreObject::ConfigStoreObject(const ConfigStoreObjectId& id,
-                                     std::vector<StoreValue> values,
+ConfigStoreObject::ConfigStoreObject(const ConfigStoreObjectId& id, std::vector<StoreValue> values,
                                      std::vector<SubObjectEntry> subObjects)
     : StoreObject(std::move(values)), id_(id), subObjects_(std::move(subObjects)) {}
 

@@ -32,8 +32,8 @@ std::string StrPrintf(const char* format, ...) {
   return out;
 }
 
-std::string StrCat(const char* a, std::size_t aLen, const char* b, std::size_t bLen,
-                   const char* c, std::size_t cLen) {
+std::string StrCat(const char* a, std::size_t aLen, const char* b, std::size_t bLen, const char* c,
+                   std::size_t cLen) {
   std::string out;
   out.reserve(aLen + bLen + cLen);
   out.append(a, aLen).append(b, bLen).append(c, cLen);

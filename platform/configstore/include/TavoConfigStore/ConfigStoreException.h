@@ -29,12 +29,12 @@ class CONFIGSTORE_EXPORT ConfigStoreException : public Velk::Lib::VelkException 
 
 // Codes raised by the store itself rather than passed on from SQLite.
 enum StoreErrorCode : std::int32_t {
-  kErrorUnknownNamespace = 1001,  // GetStore with a namespace it does not serve
-  kErrorNotAStore = 1002,         // a file that is not a store, or of an unknown schema version
-  kErrorCorruptObject = 1003,     // an object whose stored encoding cannot be read
-  kErrorNoTransaction = 1004,     // Commit or Abort with no open transaction
-  kErrorNestedTransaction = 1005, // Begin while a transaction is open
-  kErrorInjected = 1006,          // default code of a fault injected by a test
+  kErrorUnknownNamespace = 1001,   // GetStore with a namespace it does not serve
+  kErrorNotAStore = 1002,          // a file that is not a store, or of an unknown schema version
+  kErrorCorruptObject = 1003,      // an object whose stored encoding cannot be read
+  kErrorNoTransaction = 1004,      // Commit or Abort with no open transaction
+  kErrorNestedTransaction = 1005,  // Begin while a transaction is open
+  kErrorInjected = 1006,           // default code of a fault injected by a test
 };
 
 }  // namespace TavoConfigStore
