@@ -1,0 +1,65 @@
+#include "Help.h"
+
+#include <algorithm>
+
+#include "Args.h"
+
+#ifndef KARSTCTL_VERSION
+#error "KARSTCTL_VERSION must be defined by the build"
+#endif
+
+namespace karstctl {
+
+namespace {
+
+std::string Synopsis(const CommandSpec& spec) {
+  std::string out;
+  for (const auto& word : spec.words) out += (out.empty() ? "" : " ") + word;
+  for (const auto& operand : spec.operands) out += " " + operand;
+  return out;
+}
+
+}  // namespace
+
+std::string HelpText() {
+  std::size_t width = 0;
+  for (const auto& spec : CommandTable()) width = std::max(width, Synopsis(spec).size());
+  auto line = [width](std::string left, const std::string& right) {
+    left.resize(std::max(width + 2, left.size()), ' ');
+    return "  " + left + right + "\n";
+  };
+
+  std::string out =
+      "Usage: karstctl [--store PATH] COMMAND [ARGS]\n"
+      "\n"
+      "Reads and replaces the storage policy and datastore catalogues.\n"
+      "\n"
+      "Commands:\n";
+  for (const auto& spec : CommandTable()) out += line(Synopsis(spec), spec.summary);
+  out += "\nOptions:\n";
+  out += line("--store PATH", "the store file; by default $TAVO_CONFIGSTORE_PATH,");
+  out += line("", "else $XDG_STATE_HOME/tavo/configstore.db,");
+  out += line("", "else ~/.local/state/tavo/configstore.db");
+  out += line("--help", "print this help");
+  out += line("--version", "print the version");
+  out +=
+      "\n"
+      "FILE - reads standard input. Records, as read and printed:\n"
+      "  policy     {\"name\": S, \"policy_id\": S, \"description\": S, \"generation_number\": I,\n"
+      "              \"blobs\": [{\"datastore_namespace\": S, \"blob\": S}, ...]}\n"
+      "  datastore  {\"url\": S, \"datastore_namespace\": S, \"drp_policy_id\": S}\n"
+      "S is a string standing for its UTF-8 bytes, or {\"base64\": \"...\"} for any bytes;\n"
+      "output uses the base64 form only for bytes that are not valid UTF-8. I is a\n"
+      "signed 64-bit integer. A missing field is \"\", 0 or []; an unknown key is an error.\n"
+      "A blob is written raw with nothing added; finding none prints nothing.\n"
+      "\n"
+      "Exit status:\n"
+      "  0  success\n"
+      "  1  store error, or any other failure\n"
+      "  2  usage or input error; the input is checked whole before the store is touched\n";
+  return out;
+}
+
+std::string VersionText() { return std::string("karstctl ") + KARSTCTL_VERSION + "\n"; }
+
+}  // namespace karstctl
