@@ -11,8 +11,13 @@ namespace TavoKarst {
 // initial value and final XOR 0xFFFFFFFF. "crc" continues an earlier value.
 std::uint32_t Crc32(const void* data, std::size_t size, std::uint32_t crc = 0);
 
-// The table-driven reference path, one byte at a time; kept for tests.
+// The paths Crc32 chooses between, exposed so each can be tested: one table
+// look-up per byte; slicing-by-8 (portable); carry-less multiplication folding
+// (x86-64 with PCLMULQDQ and SSE4.1, chosen at run time when the CPU has it).
 std::uint32_t Crc32Bytewise(const void* data, std::size_t size, std::uint32_t crc = 0);
+std::uint32_t Crc32Portable(const void* data, std::size_t size, std::uint32_t crc = 0);
+std::uint32_t Crc32Clmul(const void* data, std::size_t size, std::uint32_t crc = 0);
+bool CpuHasClmul();
 
 // The digest of a text: "" for the empty text, otherwise its CRC-32 in
 // lower-case hex without leading zeros ("c" gives "6b9df6f").
