@@ -1,10 +1,441 @@
-// Placeholder until the SQLite backend lands.
+// The SQLite backend: one row per object, its identifier in four indexed BLOB
+// columns and its values and sub-objects encoded (ObjectCodec) in a fifth.
+//
+//   objects(seq INTEGER PRIMARY KEY, key BLOB, grp BLOB, component BLOB,
+//           instance BLOB, body BLOB), UNIQUE (key, grp, component, instance)
+//
+// "seq" is the rowid: a new row gets one above the largest present, so
+// ordering by seq is write order, and INSERT OR REPLACE moves a rewritten
+// object to the end.
+//
+// Durability: WAL with synchronous=FULL, which fsyncs the log at every
+// commit. synchronous=NORMAL would already keep a committed transaction
+// through a process kill (the log is in the OS page cache), but could lose the
+// last commits on power loss or an OS crash. Configuration writes are rare and
+// a setting that silently reverts after a power cut is worse than an fsync, so
+// the store pays for it; this is also SQLite's own default.
+//
+// A file of zero bytes is what SQLite sees as an empty database, so it is
+// treated as a new, empty store and gets the schema. Any other file that does
+// not carry our application id and schema version is refused untouched.
+
+#include <sqlite3.h>
+
+#include <array>
+#include <filesystem>
+#include <mutex>
+#include <string>
+#include <system_error>
+#include <utility>
+#include <vector>
+
+#include "ObjectCodec.h"
+#include "SqliteStoreTesting.h"
+#include "TavoConfigStore/CallProbe.h"
 #include "TavoConfigStore/ConfigStore.h"
 
 namespace TavoConfigStore {
+namespace {
+
+constexpr int kApplicationId = 0x5441564f;  // "TAVO"
+constexpr int kSchemaVersion = 1;
+// Other processes may hold the write lock for a while; wait rather than fail.
+constexpr int kBusyTimeoutMs = 10000;
+
+// A filter's shape: which identifier parts it constrains, one bit per part in
+// the order of the statement parameters ?1..?4.
+constexpr unsigned kAllParts = 0xf;
+constexpr std::size_t kShapes = 16;
+const char* const kColumns[] = {"key", "grp", "component", "instance"};
+
+unsigned ShapeOf(const ConfigStoreObjectId& id) {
+  return (id.Key().empty() ? 0u : 1u) | (id.Group().empty() ? 0u : 2u) |
+         (id.Component().empty() ? 0u : 4u) | (id.InstanceId().empty() ? 0u : 8u);
+}
+
+// Owns the connection, so that it is closed even when the store's
+// constructor throws after opening it.
+struct Connection {
+  sqlite3* db = nullptr;
+  ~Connection() {
+    if (db == nullptr) return;
+    while (sqlite3_stmt* s = sqlite3_next_stmt(db, nullptr)) sqlite3_finalize(s);
+    sqlite3_close(db);  // rolls back an open transaction
+  }
+};
+
+// Resets a statement on leaving scope: a statement left mid-result would keep
+// its read transaction, and with it a stale snapshot, open.
+class Resetter {
+ public:
+  explicit Resetter(sqlite3_stmt* s) : s_(s) {}
+  ~Resetter() { sqlite3_reset(s_); }
+  Resetter(const Resetter&) = delete;
+  Resetter& operator=(const Resetter&) = delete;
+
+ private:
+  sqlite3_stmt* s_;
+};
+
+// A statement used only while opening.
+struct OneShot {
+  sqlite3_stmt* s = nullptr;
+  ~OneShot() { sqlite3_finalize(s); }
+};
+
+class SqliteStore final : public ConfigStore {
+ public:
+  explicit SqliteStore(const std::string& path) : path_(path) {
+    const std::filesystem::path parent = std::filesystem::path(path).parent_path();
+    if (!parent.empty()) {
+      std::error_code ec;
+      std::filesystem::create_directories(parent, ec);
+      if (ec) {
+        throw ConfigStoreException(
+            Where() + ": cannot create directory " + parent.string() + ": " + ec.message(),
+            SQLITE_CANTOPEN);
+      }
+    }
+    const int rc =
+        sqlite3_open_v2(path.c_str(), &conn_.db,
+                        SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX, nullptr);
+    db_ = conn_.db;
+    if (rc != SQLITE_OK) {
+      if (conn_.db == nullptr) {
+        throw ConfigStoreException(Where() + ": cannot open: " + sqlite3_errstr(rc), rc);
+      }
+      Fail("cannot open");
+    }
+    sqlite3_extended_result_codes(db_, 1);
+    sqlite3_busy_timeout(db_, kBusyTimeoutMs);
+
+    begin_ = Prepare("BEGIN");
+    beginImmediate_ = Prepare("BEGIN IMMEDIATE");
+    commit_ = Prepare("COMMIT");
+    rollback_ = Prepare("ROLLBACK");
+
+    // Look first under a read lock, and only take the write lock when the
+    // schema has to be created; checking again under it settles a race with
+    // another process creating the same store.
+    Step(begin_, "reading the store header");
+    bool isNew;
+    try {
+      isNew = Inspect();
+    } catch (...) {
+      RollbackQuietly();
+      throw;
+    }
+    Step(commit_, "reading the store header");
+    if (isNew) {
+      Step(beginImmediate_, "creating the store");
+      try {
+        if (Inspect()) CreateSchema();
+      } catch (...) {
+        RollbackQuietly();
+        throw;
+      }
+      Step(commit_, "creating the store");
+    }
+    // Only now, once the file is known to be ours: switching to WAL rewrites
+    // the header. The mode is persistent, so this is a no-op after creation;
+    // should the file system refuse WAL, the store carries on in rollback mode.
+    ExecOnce("PRAGMA journal_mode=WAL", "setting the journal mode");
+    ExecOnce("PRAGMA synchronous=FULL", "setting the sync mode");
+
+    get_ = Prepare(
+        "SELECT body FROM objects WHERE key = ?1 AND grp = ?2 AND component = ?3 AND "
+        "instance = ?4");
+    put_ = Prepare(
+        "INSERT OR REPLACE INTO objects(key, grp, component, instance, body) "
+        "VALUES(?1, ?2, ?3, ?4, ?5)");
+  }
+
+  std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
+    NotifyCall("GetObject");
+    std::lock_guard<std::mutex> lock(mu_);
+    Resetter reset(get_);
+    BindId(get_, id, kAllParts);
+    const int rc = sqlite3_step(get_);
+    if (rc == SQLITE_DONE) return nullptr;
+    if (rc != SQLITE_ROW) Fail("reading an object");
+    return Decode(id, get_, 0);
+  }
+
+  void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
+                 std::int32_t& /*flags*/) override {
+    NotifyCall("SetObject");
+    if (!object) throw ConfigStoreException(Where() + ": SetObject of null", SQLITE_MISUSE);
+    std::string body;
+    codec::EncodeObject(*object, &body);
+    std::lock_guard<std::mutex> lock(mu_);
+    Resetter reset(put_);
+    BindId(put_, object->Id(), kAllParts);
+    Bind(put_, 5, body);
+    if (sqlite3_step(put_) != SQLITE_DONE) Fail("writing an object");
+  }
+
+  void DeleteObjects(const std::shared_ptr<FilterSpecObject>& filter) override {
+    NotifyCall("DeleteObjects");
+    if (!filter) throw ConfigStoreException(Where() + ": DeleteObjects of null", SQLITE_MISUSE);
+    std::lock_guard<std::mutex> lock(mu_);
+    const unsigned shape = ShapeOf(filter->Id());
+    sqlite3_stmt* s = FilterStatement(&deletes_, shape, "DELETE FROM objects", "");
+    Resetter reset(s);
+    BindId(s, filter->Id(), shape);
+    if (sqlite3_step(s) != SQLITE_DONE) Fail("deleting objects");
+  }
+
+  std::vector<std::shared_ptr<ConfigStoreObject>> GetObjects(
+      const std::shared_ptr<FilterSpecObject>& filter) override {
+    NotifyCall("GetObjects");
+    if (!filter) throw ConfigStoreException(Where() + ": GetObjects of null", SQLITE_MISUSE);
+    std::lock_guard<std::mutex> lock(mu_);
+    const unsigned shape = ShapeOf(filter->Id());
+    sqlite3_stmt* s =
+        FilterStatement(&selects_, shape, "SELECT key, grp, component, instance, body FROM objects",
+                        " ORDER BY seq");
+    // Outside a transaction, an explicit read transaction pins one snapshot
+    // for the whole listing.
+    const bool ownRead = sqlite3_get_autocommit(db_) != 0;
+    if (ownRead) Step(begin_, "starting a read");
+    std::vector<std::shared_ptr<ConfigStoreObject>> out;
+    try {
+      Resetter reset(s);
+      BindId(s, filter->Id(), shape);
+      int rc;
+      while ((rc = sqlite3_step(s)) == SQLITE_ROW) {
+        ConfigStoreObjectId id(Column(s, 0), Column(s, 1), Column(s, 2), Column(s, 3));
+        out.push_back(Decode(id, s, 4));
+      }
+      if (rc != SQLITE_DONE) Fail("listing objects");
+    } catch (...) {
+      if (ownRead) RollbackQuietly();
+      throw;
+    }
+    if (ownRead) Step(commit_, "ending a read");
+    return out;
+  }
+
+  void BeginTransaction() override {
+    NotifyCall("BeginTransaction");
+    std::lock_guard<std::mutex> lock(mu_);
+    if (inTransaction_) {
+      throw ConfigStoreException(Where() + ": a transaction is already open",
+                                 kErrorNestedTransaction);
+    }
+    // IMMEDIATE takes the write lock now, so a writer waits here (busy
+    // timeout) instead of failing on its first write with a stale snapshot.
+    Step(beginImmediate_, "starting a transaction");
+    inTransaction_ = true;
+  }
+
+  void CommitTransaction() override {
+    NotifyCall("CommitTransaction");
+    std::lock_guard<std::mutex> lock(mu_);
+    if (!inTransaction_) {
+      throw ConfigStoreException(Where() + ": no transaction to commit", kErrorNoTransaction);
+    }
+    if (sqlite3_get_autocommit(db_)) {
+      // SQLite rolled back by itself after an error (full disk, I/O error):
+      // the caller's writes are gone and must not be reported as committed.
+      inTransaction_ = false;
+      throw ConfigStoreException(
+          Where() + ": the transaction was rolled back after an earlier error; nothing committed",
+          SQLITE_ABORT_ROLLBACK);
+    }
+    Resetter reset(commit_);
+    if (sqlite3_step(commit_) != SQLITE_DONE) {
+      // A failed COMMIT may leave the transaction open (then Abort ends it).
+      inTransaction_ = sqlite3_get_autocommit(db_) == 0;
+      Fail("committing");
+    }
+    inTransaction_ = false;
+  }
+
+  void AbortTransaction() override {
+    NotifyCall("AbortTransaction");
+    std::lock_guard<std::mutex> lock(mu_);
+    if (!inTransaction_) return;
+    // SQLite may already have rolled back by itself; there is nothing left.
+    if (sqlite3_get_autocommit(db_)) {
+      inTransaction_ = false;
+      return;
+    }
+    Resetter reset(rollback_);
+    const int rc = sqlite3_step(rollback_);
+    inTransaction_ = sqlite3_get_autocommit(db_) == 0;
+    if (rc != SQLITE_DONE) Fail("rolling back");
+  }
+
+  sqlite3* Db() const { return db_; }
+
+ private:
+  std::string Where() const { return "configuration store " + path_; }
+
+  // Throws the connection's current error; call before the statement is reset.
+  [[noreturn]] void Fail(const std::string& what) const {
+    throw ConfigStoreException(Where() + ": " + what + ": " + sqlite3_errmsg(db_),
+                               sqlite3_extended_errcode(db_));
+  }
+
+  sqlite3_stmt* Prepare(const std::string& sql) {
+    sqlite3_stmt* s = nullptr;
+    if (sqlite3_prepare_v3(db_, sql.c_str(), static_cast<int>(sql.size()) + 1,
+                           SQLITE_PREPARE_PERSISTENT, &s, nullptr) != SQLITE_OK) {
+      Fail("preparing \"" + sql + "\"");
+    }
+    return s;
+  }
+
+  // Runs a statement that returns no rows (or whose rows do not matter).
+  void Step(sqlite3_stmt* s, const char* what) {
+    Resetter reset(s);
+    int rc;
+    while ((rc = sqlite3_step(s)) == SQLITE_ROW) {
+    }
+    if (rc != SQLITE_DONE) Fail(what);
+  }
+
+  void ExecOnce(const char* sql, const char* what) {
+    OneShot once;
+    if (sqlite3_prepare_v2(db_, sql, -1, &once.s, nullptr) != SQLITE_OK) Fail(what);
+    Step(once.s, what);
+  }
+
+  long long QueryInt(const char* sql, const char* what) {
+    OneShot once;
+    if (sqlite3_prepare_v2(db_, sql, -1, &once.s, nullptr) != SQLITE_OK) Fail(what);
+    const int rc = sqlite3_step(once.s);
+    if (rc != SQLITE_ROW) Fail(what);
+    return sqlite3_column_int64(once.s, 0);
+  }
+
+  void RollbackQuietly() {
+    if (sqlite3_get_autocommit(db_)) return;
+    sqlite3_step(rollback_);
+    sqlite3_reset(rollback_);
+  }
+
+  // True for a new database, false for one of our stores; throws for
+  // anything else. Runs inside a transaction so the three reads agree.
+  bool Inspect() {
+    // The first read of the file: a non-database fails here (SQLITE_NOTADB).
+    const long long appId = QueryInt("PRAGMA application_id", "reading the store header");
+    const long long version = QueryInt("PRAGMA user_version", "reading the store header");
+    const long long entries = QueryInt("SELECT count(*) FROM sqlite_master", "reading the schema");
+    if (appId == 0 && version == 0 && entries == 0) return true;
+    if (appId != kApplicationId) {
+      throw ConfigStoreException(
+          Where() + ": not a configuration store (a SQLite database of another application)",
+          kErrorNotAStore);
+    }
+    if (version != kSchemaVersion) {
+      throw ConfigStoreException(Where() + ": unknown schema version " + std::to_string(version) +
+                                     " (this library reads version " +
+                                     std::to_string(kSchemaVersion) + ")",
+                                 kErrorNotAStore);
+    }
+    if (QueryInt("SELECT count(*) FROM sqlite_master WHERE type = 'table' AND name = 'objects'",
+                 "reading the schema") != 1) {
+      throw ConfigStoreException(Where() + ": not a configuration store (no objects table)",
+                                 kErrorNotAStore);
+    }
+    return false;
+  }
+
+  void CreateSchema() {
+    ExecOnce(
+        "CREATE TABLE objects(seq INTEGER PRIMARY KEY, key BLOB NOT NULL, grp BLOB NOT NULL, "
+        "component BLOB NOT NULL, instance BLOB NOT NULL, body BLOB NOT NULL)",
+        "creating the schema");
+    ExecOnce("CREATE UNIQUE INDEX objects_id ON objects(key, grp, component, instance)",
+             "creating the schema");
+    ExecOnce(("PRAGMA application_id = " + std::to_string(kApplicationId)).c_str(),
+             "creating the schema");
+    ExecOnce(("PRAGMA user_version = " + std::to_string(kSchemaVersion)).c_str(),
+             "creating the schema");
+  }
+
+  // The statement for one filter shape, prepared on first use and kept.
+  sqlite3_stmt* FilterStatement(std::array<sqlite3_stmt*, kShapes>* cache, unsigned shape,
+                                const char* head, const char* tail) {
+    sqlite3_stmt*& s = (*cache)[shape];
+    if (s == nullptr) {
+      std::string sql = head;
+      const char* joint = " WHERE ";
+      for (unsigned part = 0; part < 4; ++part) {
+        if ((shape & (1u << part)) == 0) continue;
+        sql += joint;
+        sql += kColumns[part];
+        sql += " = ?" + std::to_string(part + 1);
+        joint = " AND ";
+      }
+      sql += tail;
+      s = Prepare(sql);
+    }
+    return s;
+  }
+
+  // As a BLOB with its length: every byte, NUL included, survives, and BLOB
+  // comparison is plain byte equality.
+  void Bind(sqlite3_stmt* s, int index, const std::string& bytes) {
+    if (sqlite3_bind_blob64(s, index, bytes.data(), bytes.size(), SQLITE_STATIC) != SQLITE_OK) {
+      Fail("binding a value");
+    }
+  }
+
+  void BindId(sqlite3_stmt* s, const ConfigStoreObjectId& id, unsigned shape) {
+    const std::string* parts[] = {&id.Key(), &id.Group(), &id.Component(), &id.InstanceId()};
+    for (unsigned part = 0; part < 4; ++part) {
+      if (shape & (1u << part)) Bind(s, static_cast<int>(part) + 1, *parts[part]);
+    }
+  }
+
+  static std::string Column(sqlite3_stmt* s, int column) {
+    // A zero-length BLOB comes back as a null pointer.
+    const void* data = sqlite3_column_blob(s, column);
+    const int size = sqlite3_column_bytes(s, column);
+    return data == nullptr ? std::string() : std::string(static_cast<const char*>(data), size);
+  }
+
+  std::shared_ptr<ConfigStoreObject> Decode(const ConfigStoreObjectId& id, sqlite3_stmt* s,
+                                            int column) {
+    const void* data = sqlite3_column_blob(s, column);
+    const int size = sqlite3_column_bytes(s, column);
+    try {
+      return codec::DecodeObject(id, static_cast<const unsigned char*>(data),
+                                 data == nullptr ? 0 : static_cast<std::size_t>(size));
+    } catch (const ConfigStoreException& e) {
+      throw ConfigStoreException(Where() + ": " + e.Message(), e.Code());
+    }
+  }
+
+  // NOMUTEX turns off SQLite's own locking; this keeps a store that is shared
+  // between threads anyway (SetGlobalStore) from corrupting the connection.
+  std::mutex mu_;
+  std::string path_;
+  Connection conn_;
+  sqlite3* db_ = nullptr;
+  bool inTransaction_ = false;  // between a successful Begin and Commit/Abort
+  sqlite3_stmt* begin_ = nullptr;
+  sqlite3_stmt* beginImmediate_ = nullptr;
+  sqlite3_stmt* commit_ = nullptr;
+  sqlite3_stmt* rollback_ = nullptr;
+  sqlite3_stmt* get_ = nullptr;
+  sqlite3_stmt* put_ = nullptr;
+  std::array<sqlite3_stmt*, kShapes> selects_{};
+  std::array<sqlite3_stmt*, kShapes> deletes_{};
+};
+
+}  // namespace
 
 std::shared_ptr<ConfigStore> NewSqliteStore(const std::string& path) {
-  throw ConfigStoreException("configuration store: SQLite backend not built (" + path + ")", 1);
+  return std::make_shared<SqliteStore>(path);
+}
+
+sqlite3* SqliteConnectionForTesting(ConfigStore& store) {
+  auto* sqlite = dynamic_cast<SqliteStore*>(&store);
+  return sqlite == nullptr ? nullptr : sqlite->Db();
 }
 
 }  // namespace TavoConfigStore
