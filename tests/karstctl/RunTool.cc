@@ -1,6 +1,7 @@
 #include "RunTool.h"
 
 #include <fcntl.h>
+#include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -13,6 +14,8 @@
 #ifndef KARSTCTL_BINARY
 #error "KARSTCTL_BINARY must name the built karstctl"
 #endif
+
+extern char** environ;
 
 namespace karstctl_test {
 
@@ -54,25 +57,35 @@ ToolResult RunTool(const std::string& scratch, const std::vector<std::string>& a
   for (auto& arg : argvStrings) argv.push_back(arg.data());
   argv.push_back(nullptr);
 
-  const pid_t pid = fork();
-  if (pid < 0) throw std::runtime_error("fork failed");
-  if (pid == 0) {
-    int in = open(inPath.c_str(), O_RDONLY);
-    int out = open(outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    int err = open(errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    if (in < 0 || out < 0 || err < 0 || dup2(in, 0) < 0 || dup2(out, 1) < 0 || dup2(err, 2) < 0) {
-      _exit(125);
-    }
-    for (const auto& [name, value] : env) {
-      if (value) {
-        setenv(name.c_str(), value->c_str(), 1);
-      } else {
-        unsetenv(name.c_str());
-      }
-    }
-    execv(argv[0], argv.data());
-    _exit(126);
+  // This process's environment with the changes applied.
+  std::vector<std::string> envStrings;
+  for (char** entry = environ; *entry != nullptr; ++entry) {
+    const std::string text = *entry;
+    const std::string name = text.substr(0, text.find('='));
+    bool changed = false;
+    for (const auto& change : env) changed = changed || change.first == name;
+    if (!changed) envStrings.push_back(text);
   }
+  for (const auto& [name, value] : env) {
+    if (value) envStrings.push_back(name + "=" + *value);
+  }
+  std::vector<char*> envp;
+  for (auto& entry : envStrings) envp.push_back(entry.data());
+  envp.push_back(nullptr);
+
+  // posix_spawn rather than fork: forking a sanitized test process is slow.
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_addopen(&actions, 0, inPath.c_str(), O_RDONLY, 0);
+  posix_spawn_file_actions_addopen(&actions, 1, outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC,
+                                   0600);
+  posix_spawn_file_actions_addopen(&actions, 2, errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC,
+                                   0600);
+  pid_t pid = 0;
+  const int spawned = posix_spawn(&pid, argv[0], &actions, nullptr, argv.data(), envp.data());
+  posix_spawn_file_actions_destroy(&actions);
+  if (spawned != 0) throw std::runtime_error("cannot run " + argvStrings[0]);
+
   int wstatus = 0;
   if (waitpid(pid, &wstatus, 0) != pid) throw std::runtime_error("waitpid failed");
   ToolResult result;
