@@ -25,6 +25,7 @@ install(FILES ${CMAKE_CURRENT_BINARY_DIR}/karstConfig.cmake
   ${CMAKE_CURRENT_BINARY_DIR}/karstConfigVersion.cmake
   DESTINATION ${KARST_CMAKE_DIR} COMPONENT development)
 
+file(RELATIVE_PATH KARST_PC_TO_PREFIX /${CMAKE_INSTALL_LIBDIR}/pkgconfig /)
 configure_file(cmake/karst.pc.in ${CMAKE_CURRENT_BINARY_DIR}/karst.pc @ONLY)
 install(FILES ${CMAKE_CURRENT_BINARY_DIR}/karst.pc
   DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig COMPONENT development)
