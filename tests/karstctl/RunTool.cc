@@ -45,11 +45,11 @@ void RemoveTree(const std::string& path) {
 }
 
 ToolResult RunTool(const std::string& scratch, const std::vector<std::string>& args,
-                   const std::string& input, const EnvChanges& env) {
+                   const std::string& input, const EnvChanges& env, const std::string& stdoutPath) {
   // Files rather than pipes: nothing can block however much either side
   // writes.
-  const std::string inPath = scratch + "/stdin", outPath = scratch + "/stdout",
-                    errPath = scratch + "/stderr";
+  const std::string inPath = scratch + "/stdin", errPath = scratch + "/stderr";
+  const std::string outPath = stdoutPath.empty() ? scratch + "/stdout" : stdoutPath;
   WriteFile(inPath, input);
   std::vector<std::string> argvStrings = {KARSTCTL_BINARY};
   argvStrings.insert(argvStrings.end(), args.begin(), args.end());
@@ -90,7 +90,7 @@ ToolResult RunTool(const std::string& scratch, const std::vector<std::string>& a
   if (waitpid(pid, &wstatus, 0) != pid) throw std::runtime_error("waitpid failed");
   ToolResult result;
   result.status = WIFEXITED(wstatus) ? WEXITSTATUS(wstatus) : 128 + WTERMSIG(wstatus);
-  result.out = ReadFile(outPath);
+  if (stdoutPath.empty()) result.out = ReadFile(outPath);
   result.err = ReadFile(errPath);
   return result;
 }

@@ -20,9 +20,11 @@ using EnvChanges = std::vector<std::pair<std::string, std::optional<std::string>
 
 // Runs the built karstctl with "args", feeding "input" on standard input,
 // and collects everything it writes. "scratch" is a directory for the
-// captured streams.
+// captured streams. A non-empty "stdoutPath" sends standard output there
+// instead of capturing it.
 ToolResult RunTool(const std::string& scratch, const std::vector<std::string>& args,
-                   const std::string& input = "", const EnvChanges& env = {});
+                   const std::string& input = "", const EnvChanges& env = {},
+                   const std::string& stdoutPath = "");
 
 // A fresh directory under $TMPDIR (or /tmp), and its removal.
 std::string MakeScratchDir();

@@ -158,5 +158,18 @@ TEST_F(ToolTest, StoreErrorsExitOneWithTheCodeAndMessage) {
   EXPECT_THAT(both.err, HasSubstr("<stdin>:1:2"));
 }
 
+TEST_F(ToolTest, OutputThatCannotBeWrittenIsAFailure) {
+  Ok({"import", "-"}, kGood);
+  for (const std::vector<std::string>& command : std::vector<std::vector<std::string>>{
+           {"export"}, {"blob", "corra-by-id", "p1"}, {"hash"}, {"--help"}}) {
+    std::vector<std::string> args = {"--store", store_};
+    args.insert(args.end(), command.begin(), command.end());
+    ToolResult result = RunTool(scratch_, args, "", {}, "/dev/full");
+    EXPECT_EQ(result.status, 1) << command[0];
+    EXPECT_TRUE(IsOneErrorLine(result.err));
+    EXPECT_THAT(result.err, HasSubstr("cannot write standard output"));
+  }
+}
+
 }  // namespace
 }  // namespace karstctl_test

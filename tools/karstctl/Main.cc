@@ -58,6 +58,8 @@ int Main(const std::vector<std::string>& args) {
     return Fail(kExitFailure, "store error " + std::to_string(e.Code()) + ": " + e.Message());
   } catch (const std::exception& e) {
     return Fail(kExitFailure, e.what());
+  } catch (...) {
+    return Fail(kExitFailure, "unexpected error");
   }
 }
 
