@@ -54,6 +54,7 @@ ToolResult RunTool(const std::string& scratch, const std::vector<std::string>& a
   std::vector<std::string> argvStrings = {KARSTCTL_BINARY};
   argvStrings.insert(argvStrings.end(), args.begin(), args.end());
   std::vector<char*> argv;
+  argv.reserve(argvStrings.size() + 1);
   for (auto& arg : argvStrings) argv.push_back(arg.data());
   argv.push_back(nullptr);
 
@@ -70,6 +71,7 @@ ToolResult RunTool(const std::string& scratch, const std::vector<std::string>& a
     if (value) envStrings.push_back(name + "=" + *value);
   }
   std::vector<char*> envp;
+  envp.reserve(envStrings.size() + 1);
   for (auto& entry : envStrings) envp.push_back(entry.data());
   envp.push_back(nullptr);
 

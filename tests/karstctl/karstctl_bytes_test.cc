@@ -1,6 +1,5 @@
 #include <string>
 
-#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include "Errors.h"
@@ -9,8 +8,6 @@
 
 namespace karstctl {
 namespace {
-
-using ::testing::HasSubstr;
 
 std::string Bytes(const char* data, std::size_t size) { return std::string(data, size); }
 

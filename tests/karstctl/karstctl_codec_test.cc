@@ -14,7 +14,6 @@ namespace karstctl {
 namespace {
 
 using TavoKarst::KarstDatastoreInfo;
-using TavoKarst::KarstPolicyBlob;
 using TavoKarst::KarstPolicyInfo;
 using ::testing::HasSubstr;
 

@@ -27,6 +27,13 @@ InputError UnknownKey(const std::string& path, const std::string& key) {
   return InputError(path + ": unknown key " + Json(key).dump());
 }
 
+std::string Member(const std::string& path, const std::string& key) {
+  std::string out = path;
+  out += '.';
+  out += key;
+  return out;
+}
+
 std::string Indexed(const std::string& path, std::size_t index) {
   return path + "[" + std::to_string(index) + "]";
 }
@@ -66,7 +73,7 @@ KarstPolicyBlob BlobFromJson(const Json& value, const std::string& path) {
   KarstPolicyBlob blob;
   for (const auto& item : value.items()) {
     const std::string& key = item.key();
-    const std::string field = path + "." + key;
+    const std::string field = Member(path, key);
     if (key == "datastore_namespace") {
       blob.datastore_namespace = DecodeBytes(item.value(), field);
     } else if (key == "blob") {
@@ -95,7 +102,7 @@ KarstPolicyInfo PolicyFromJson(const Json& value, const std::string& path) {
   KarstPolicyInfo policy;
   for (const auto& item : value.items()) {
     const std::string& key = item.key();
-    const std::string field = path + "." + key;
+    const std::string field = Member(path, key);
     if (key == "name") {
       policy.name = DecodeBytes(item.value(), field);
     } else if (key == "policy_id") {
@@ -129,7 +136,7 @@ KarstDatastoreInfo DatastoreFromJson(const Json& value, const std::string& path)
   KarstDatastoreInfo datastore;
   for (const auto& item : value.items()) {
     const std::string& key = item.key();
-    const std::string field = path + "." + key;
+    const std::string field = Member(path, key);
     if (key == "url") {
       datastore.url = DecodeBytes(item.value(), field);
     } else if (key == "datastore_namespace") {
