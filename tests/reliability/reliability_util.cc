@@ -46,7 +46,7 @@ std::string TagText(Tag tag, int count, int index) {
 }
 
 // Reads back what TagText wrote at the start of "text".
-bool ParseTag(const std::string& text, Tag* tag) {
+bool ParseTag(const std::string& text, Tag* tag, int* countOut) {
   long long round = 0;
   int writer = 0, count = 0, index = 0;
   if (std::sscanf(text.c_str(), "w=%d r=%lld n=%d i=%d", &writer, &round, &count, &index) != 4) {
@@ -54,15 +54,17 @@ bool ParseTag(const std::string& text, Tag* tag) {
   }
   tag->writer = writer;
   tag->round = round;
-  return true;
+  *countOut = count;
+  return count > 0;
 }
 
 int Mod(long long value, int m) { return static_cast<int>(((value % m) + m) % m); }
 
 }  // namespace
 
-std::vector<KarstPolicyInfo> PoliciesFor(Tag tag) {
-  const int n = 1 + Mod(tag.round * 7 + tag.writer * 3, 11);
+std::vector<KarstPolicyInfo> PoliciesFor(Tag tag, int count) {
+  const int n = count > 0 ? count : 1 + Mod(tag.round * 7 + tag.writer * 3, 11);
+  const std::string filler(n > 100 ? 1200 : 0, 'x');
   std::vector<KarstPolicyInfo> out(n);
   for (int i = 0; i < n; ++i) {
     const std::string text = TagText(tag, n, i);
@@ -72,13 +74,13 @@ std::vector<KarstPolicyInfo> PoliciesFor(Tag tag) {
     p.description = text;
     p.generation_number = tag.round;
     p.blobs.push_back(KarstPolicyBlob{std::string("corra\0", 6) + text + "\xff", "CORRA"});
-    p.blobs.push_back(KarstPolicyBlob{"blob\xfe" + text, "ns-" + std::to_string(i % 2)});
+    p.blobs.push_back(KarstPolicyBlob{"blob\xfe" + text + filler, "ns-" + std::to_string(i % 2)});
   }
   return out;
 }
 
-std::vector<KarstDatastoreInfo> DatastoresFor(Tag tag) {
-  const int m = 1 + Mod(tag.round * 5 + tag.writer, 7);
+std::vector<KarstDatastoreInfo> DatastoresFor(Tag tag, int count) {
+  const int m = count > 0 ? count : 1 + Mod(tag.round * 5 + tag.writer, 7);
   std::vector<KarstDatastoreInfo> out(m);
   for (int i = 0; i < m; ++i) {
     out[i].url = "ds-" + std::to_string(i);
@@ -105,7 +107,10 @@ Observed Classify(const std::vector<KarstPolicyInfo>& policies) {
   if (policies.empty()) return o;
   o.kind = Observed::kTorn;
   Tag tag;
-  if (ParseTag(policies.front().description, &tag) && policies == PoliciesFor(tag)) {
+  int n = 0;
+  // The length is checked first so a garbled count never builds a huge list.
+  if (ParseTag(policies.front().description, &tag, &n) &&
+      static_cast<std::size_t>(n) == policies.size() && policies == PoliciesFor(tag, n)) {
     o.kind = Observed::kWhole;
     o.tag = tag;
   }
@@ -117,7 +122,9 @@ Observed Classify(const std::vector<KarstDatastoreInfo>& datastores) {
   if (datastores.empty()) return o;
   o.kind = Observed::kTorn;
   Tag tag;
-  if (ParseTag(datastores.front().drp_policy_id, &tag) && datastores == DatastoresFor(tag)) {
+  int n = 0;
+  if (ParseTag(datastores.front().drp_policy_id, &tag, &n) &&
+      static_cast<std::size_t>(n) == datastores.size() && datastores == DatastoresFor(tag, n)) {
     o.kind = Observed::kWhole;
     o.tag = tag;
   }
