@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <cstdlib>
+#include <exception>
 #include <mutex>
 
 #include "TavoConfigStore/CallProbe.h"
@@ -29,12 +30,41 @@ struct CachedConnection {
   pid_t pid = 0;
   std::string path;
   std::shared_ptr<ConfigStore> store;
+  // The handles given out share one count, so the store sees the last go.
+  std::weak_ptr<ConfigStore> handles;
 };
+
+// A caller whose exception (std::bad_alloc, say) escapes between Begin and
+// Commit leaves the cached connection's transaction open: its write lock
+// would keep every other writer out, and its half-done writes would be what
+// this thread reads, until the thread happens to write again. So when the
+// last handle goes because an exception is unwinding past it, the open
+// transaction is abandoned: nobody is left who could end it. A handle that
+// is merely dropped (GetStore(ns)->BeginTransaction(), then a new GetStore
+// for each later call) keeps its transaction.
+std::shared_ptr<ConfigStore> NewHandle(CachedConnection& cache) {
+  const int unwinding = std::uncaught_exceptions();
+  std::shared_ptr<ConfigStore> store = cache.store;
+  const pid_t pid = cache.pid;
+  std::shared_ptr<ConfigStore> handle(store.get(), [store, pid, unwinding](ConfigStore*) {
+    if (std::uncaught_exceptions() <= unwinding || getpid() != pid) return;
+    try {
+      store->AbortTransaction();  // does nothing without an open transaction
+    } catch (...) {
+      // Nothing better to do during unwinding; the next Begin reports it.
+    }
+  });
+  cache.handles = handle;
+  return handle;
+}
 
 std::shared_ptr<ConfigStore> DefaultStore() {
   thread_local CachedConnection cache;
   std::string path = DefaultStorePath();
-  if (cache.store && cache.pid == getpid() && cache.path == path) return cache.store;
+  if (cache.store && cache.pid == getpid() && cache.path == path) {
+    if (std::shared_ptr<ConfigStore> handle = cache.handles.lock()) return handle;
+    return NewHandle(cache);
+  }
   if (cache.store && cache.pid != getpid()) {
     // A connection inherited through fork() belongs to the parent: closing
     // it here could disturb the parent's locks and WAL, so it is abandoned.
@@ -43,7 +73,7 @@ std::shared_ptr<ConfigStore> DefaultStore() {
   cache.store = NewSqliteStore(path);
   cache.pid = getpid();
   cache.path = std::move(path);
-  return cache.store;
+  return NewHandle(cache);
 }
 }  // namespace
 

@@ -34,7 +34,9 @@ class CONFIGSTORE_EXPORT ConfigStore {
   // The store for "nameSpace" (only sGlobalNamespace is served). This is the
   // store installed with SetGlobalStore, or else the SQLite store at
   // DefaultStorePath(); the SQLite connection is cached per thread and
-  // process, so calling this on every operation is cheap.
+  // process, so calling this on every operation is cheap. When the last
+  // handle to the cached connection is released by an exception unwinding
+  // past it, a transaction still open on it is abandoned (AbortTransaction).
   static std::shared_ptr<ConfigStore> GetStore(const std::string& nameSpace);
 
   virtual ~ConfigStore();
