@@ -26,6 +26,7 @@ class ForwardingStore final : public TavoConfigStore::ConfigStore {
       : inner_(std::move(inner)), hook_(std::move(hook)) {}
 
   int Calls() const { return calls_; }
+  // Every call in order; a call the inner store failed reads "name!code".
   const std::vector<std::string>& Log() const { return log_; }
   void SetHook(Hook hook) { hook_ = std::move(hook); }
   void ResetCount() {
@@ -36,41 +37,44 @@ class ForwardingStore final : public TavoConfigStore::ConfigStore {
 
   std::shared_ptr<TavoConfigStore::ConfigStoreObject> GetObject(
       const TavoConfigStore::ConfigStoreObjectId& id) override {
-    Before("GetObject");
-    return inner_->GetObject(id);
+    return Forward("GetObject", [&] { return inner_->GetObject(id); });
   }
   void SetObject(const std::shared_ptr<TavoConfigStore::ConfigStoreObject>& object,
                  std::int32_t& flags) override {
-    Before("SetObject");
-    inner_->SetObject(object, flags);
+    Forward("SetObject", [&] { inner_->SetObject(object, flags); });
   }
   void DeleteObjects(const std::shared_ptr<TavoConfigStore::FilterSpecObject>& filter) override {
-    Before("DeleteObjects");
-    inner_->DeleteObjects(filter);
+    Forward("DeleteObjects", [&] { inner_->DeleteObjects(filter); });
   }
   std::vector<std::shared_ptr<TavoConfigStore::ConfigStoreObject>> GetObjects(
       const std::shared_ptr<TavoConfigStore::FilterSpecObject>& filter) override {
-    Before("GetObjects");
-    return inner_->GetObjects(filter);
+    return Forward("GetObjects", [&] { return inner_->GetObjects(filter); });
   }
   void BeginTransaction() override {
-    Before("BeginTransaction");
-    inner_->BeginTransaction();
+    Forward("BeginTransaction", [&] { inner_->BeginTransaction(); });
   }
   void CommitTransaction() override {
-    Before("CommitTransaction");
-    inner_->CommitTransaction();
+    Forward("CommitTransaction", [&] { inner_->CommitTransaction(); });
   }
   void AbortTransaction() override {
-    Before("AbortTransaction");
-    inner_->AbortTransaction();
+    Forward("AbortTransaction", [&] { inner_->AbortTransaction(); });
   }
 
  private:
-  void Before(const char* operation) {
+  // Shows the call to the hook, then runs it; a store error the inner store
+  // throws is logged as "operation!code" and passed on.
+  template <typename Call>
+  auto Forward(const char* operation, Call call) -> decltype(call()) {
     log_.emplace_back(operation);
+    const std::size_t entry = log_.size() - 1;
     ++calls_;
     if (hook_) hook_(operation, calls_);
+    try {
+      return call();
+    } catch (const TavoConfigStore::ConfigStoreException& e) {
+      log_[entry] += "!" + std::to_string(e.Code());
+      throw;
+    }
   }
 
   std::shared_ptr<TavoConfigStore::ConfigStore> inner_;

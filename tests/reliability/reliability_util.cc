@@ -83,9 +83,11 @@ std::vector<KarstDatastoreInfo> DatastoresFor(Tag tag, int count) {
   const int m = count > 0 ? count : 1 + Mod(tag.round * 5 + tag.writer, 7);
   std::vector<KarstDatastoreInfo> out(m);
   for (int i = 0; i < m; ++i) {
-    out[i].url = "ds-" + std::to_string(i);
+    // The url carries the tag; namespace and default policy are those of the
+    // policy lists, so every look-up finds something.
+    out[i].url = "ds-" + std::to_string(i) + "/" + TagText(tag, m, i);
     out[i].datastore_namespace = "ns-" + std::to_string(i % 2);
-    out[i].drp_policy_id = TagText(tag, m, i) + "|id-" + std::to_string(i % 3);
+    out[i].drp_policy_id = "id-" + std::to_string(i % 3);
   }
   return out;
 }
@@ -123,7 +125,9 @@ Observed Classify(const std::vector<KarstDatastoreInfo>& datastores) {
   o.kind = Observed::kTorn;
   Tag tag;
   int n = 0;
-  if (ParseTag(datastores.front().drp_policy_id, &tag, &n) &&
+  const std::string& url = datastores.front().url;
+  const std::size_t slash = url.find('/');
+  if (slash != std::string::npos && ParseTag(url.substr(slash + 1), &tag, &n) &&
       static_cast<std::size_t>(n) == datastores.size() && datastores == DatastoresFor(tag, n)) {
     o.kind = Observed::kWhole;
     o.tag = tag;

@@ -33,10 +33,12 @@ struct Tag {
 };
 
 // The lists for a tag: deterministic, 1..11 policies and 1..7 datastores
-// depending on the tag unless "count" says otherwise, names shared between
-// tags (so a replace overwrites keys that exist as well as adding and
-// dropping some), NUL and 0xFF bytes in the blobs. Lists of more than 100
-// policies carry 1200 more bytes a policy, to span many pages.
+// depending on the tag unless "count" says otherwise, NUL and 0xFF bytes in
+// the blobs. Policy names are shared between tags, so a replace overwrites
+// keys that exist as well as adding and dropping some; datastore urls carry
+// the tag. Every datastore's namespace and default policy exist in every
+// policy list, so each look-up finds a blob. Lists of more than 100 policies
+// carry 1200 more bytes a policy, to span many pages.
 std::vector<TavoKarst::KarstPolicyInfo> PoliciesFor(Tag tag, int count = 0);
 std::vector<TavoKarst::KarstDatastoreInfo> DatastoresFor(Tag tag, int count = 0);
 
