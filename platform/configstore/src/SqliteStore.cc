@@ -168,6 +168,7 @@ class SqliteStore final : public ConfigStore {
     std::string body;
     codec::EncodeObject(*object, &body);
     std::lock_guard<std::mutex> lock(mu_);
+    RefuseWriteAfterRollback();
     Resetter reset(put_);
     BindId(put_, object->Id(), kAllParts);
     Bind(put_, 5, body);
@@ -178,6 +179,7 @@ class SqliteStore final : public ConfigStore {
     NotifyCall("DeleteObjects");
     if (!filter) throw ConfigStoreException(Where() + ": DeleteObjects of null", SQLITE_MISUSE);
     std::lock_guard<std::mutex> lock(mu_);
+    RefuseWriteAfterRollback();
     const unsigned shape = ShapeOf(filter->Id());
     sqlite3_stmt* s = FilterStatement(&deletes_, shape, "DELETE FROM objects", "");
     Resetter reset(s);
@@ -271,6 +273,20 @@ class SqliteStore final : public ConfigStore {
 
  private:
   std::string Where() const { return "configuration store " + path_; }
+
+  // Once SQLite has rolled the caller's transaction back by itself (full
+  // disk, I/O error, interrupt), a write would be committed on its own at
+  // once, outside the transaction the caller still takes to be open, and
+  // AbortTransaction could no longer undo it. Refused until the caller ends
+  // the transaction.
+  void RefuseWriteAfterRollback() const {
+    if (inTransaction_ && sqlite3_get_autocommit(db_)) {
+      throw ConfigStoreException(
+          Where() + ": the transaction was rolled back after an earlier error; nothing is "
+                    "written until it is ended",
+          SQLITE_ABORT_ROLLBACK);
+    }
+  }
 
   // Throws the connection's current error; call before the statement is reset.
   [[noreturn]] void Fail(const std::string& what) const {
