@@ -11,7 +11,8 @@
 //    collection whole: old, or new when the operation reported success;
 //  - the next operation succeeds.
 // A second sweep makes SQLite itself roll the transaction back (an
-// interrupted statement) at every write of a replace and of Reset.
+// interrupted statement) at every write of a replace and of Reset, so the
+// store's abort has to cope with a transaction that is already gone.
 
 #include <gtest/gtest.h>
 #include <sqlite3.h>
@@ -345,6 +346,149 @@ TEST_F(FaultSweepTest, EveryCallOfEveryOperationFails) {
     EXPECT_EQ(f.torn, 0);
     EXPECT_EQ(f.nextFailedOnce, 0);
   }
+}
+
+// Makes the next statement stop with SQLITE_INTERRUPT: an INSERT or DELETE
+// interrupted inside a transaction makes SQLite roll the whole transaction
+// back by itself, as it may after a full disk or an I/O error.
+int InterruptOnce(void* armed) {
+  bool* flag = static_cast<bool*>(armed);
+  if (!*flag) return 0;
+  *flag = false;
+  return 1;
+}
+
+TEST_F(FaultSweepTest, SqliteRollsTheTransactionBackByItselfAtEveryWrite) {
+  int points = 0, rolledBack = 0, abortTolerated = 0, errorPassed = 0, old = 0, nextOk = 0;
+  for (const Operation& op : Operations()) {
+    if (op.kind != OpKind::kWrite && op.kind != OpKind::kReset) continue;
+    SCOPED_TRACE(op.name);
+    auto dry = std::make_shared<ForwardingStore>(TavoConfigStore::NewSqliteStore(path_),
+                                                 ForwardingStore::Hook());
+    TavoConfigStore::SetGlobalStore(dry);
+    ASSERT_EQ(Attempt(op).kind, Outcome::kReturned);
+    TavoConfigStore::SetGlobalStore(nullptr);
+    const std::vector<std::string> calls = dry->Log();
+    dry.reset();
+    Restore();
+
+    for (std::size_t k = 1; k <= calls.size(); ++k) {
+      if (calls[k - 1] != "SetObject" && calls[k - 1] != "DeleteObjects") continue;
+      SCOPED_TRACE("interrupted at call " + std::to_string(k) + " (" + calls[k - 1] + ")");
+      ++points;
+      auto inner = TavoConfigStore::NewSqliteStore(path_);
+      sqlite3* db = TavoConfigStore::SqliteConnectionForTesting(*inner);
+      bool armed = false;
+      sqlite3_progress_handler(db, 1, InterruptOnce, &armed);
+      bool autocommitAfterFailure = false;
+      std::size_t failedAt = 0;
+      auto wrapper = std::make_shared<ForwardingStore>(inner, ForwardingStore::Hook());
+      wrapper->SetHook([&, k](const char*, int index) {
+        if (static_cast<std::size_t>(index) == k) armed = true;
+        // The call after the failed one: has SQLite ended the transaction?
+        if (failedAt == 0 && static_cast<std::size_t>(index) == k + 1) {
+          autocommitAfterFailure = sqlite3_get_autocommit(db) != 0;
+          failedAt = k;
+        }
+      });
+      TavoConfigStore::SetGlobalStore(wrapper);
+      const Outcome got = Attempt(op);
+      TavoConfigStore::SetGlobalStore(nullptr);
+      const std::vector<std::string> log = wrapper->Log();
+      sqlite3_progress_handler(db, 0, nullptr, nullptr);
+
+      ASSERT_GE(log.size(), k);
+      EXPECT_EQ(log[k - 1], calls[k - 1] + "!" + std::to_string(SQLITE_INTERRUPT));
+      if (autocommitAfterFailure) ++rolledBack;
+      // The write bracket abandons the transaction SQLite already ended.
+      for (const std::string& call : log) {
+        if (call == "AbortTransaction") ++abortTolerated;
+        EXPECT_NE(call.rfind("AbortTransaction!", 0), 0u) << "abort failed: " << call;
+      }
+      EXPECT_EQ(sqlite3_get_autocommit(db), 1) << "transaction left open";
+      if (got.kind == Outcome::kStoreError && (got.code & 0xff) == SQLITE_INTERRUPT) {
+        ++errorPassed;
+      } else if (op.kind == OpKind::kReset && got.kind == Outcome::kStoreError) {
+        // Reset skips a failed deletion; the commit then finds the
+        // transaction gone and must say so.
+        EXPECT_EQ(got.code, SQLITE_ABORT_ROLLBACK) << got.Describe();
+        ++errorPassed;
+      } else {
+        ADD_FAILURE() << "the caller got " << got.Describe();
+      }
+      wrapper.reset();
+      inner.reset();
+
+      const Verdict committed = Committed();
+      if (Is(committed.policies, kOld) && Is(committed.datastores, kOld)) {
+        ++old;
+      } else {
+        ADD_FAILURE() << "after the failed " << op.name << ": " << committed.Describe();
+      }
+      if (Attempt(op).kind == Outcome::kReturned) ++nextOk;
+      Restore();
+    }
+  }
+  ReportFigures("sqlite-rollback",
+                "sqlite-rollback: " + std::to_string(points) +
+                    " writes interrupted (SQLite rolls the transaction back itself), rolled back "
+                    "before the next call " +
+                    std::to_string(rolledBack) + ", aborts of the ended transaction tolerated " +
+                    std::to_string(abortTolerated) + ", error reached the caller " +
+                    std::to_string(errorPassed) + ", catalogue old " + std::to_string(old) +
+                    ", next operation ok " + std::to_string(nextOk));
+  EXPECT_GT(points, 0);
+  EXPECT_EQ(rolledBack, points);
+  EXPECT_EQ(errorPassed, points);
+  EXPECT_EQ(old, points);
+  EXPECT_EQ(nextOk, points);
+}
+
+// The two sides of abandoning a transaction on release: a handle dropped in
+// the ordinary way keeps its transaction, and a host that holds a handle of
+// its own keeps the connection's transaction open past a library call that
+// failed with bad_alloc; the next write on the thread then fails once and
+// clears it.
+TEST_F(FaultSweepTest, TransactionsAndHandles) {
+  const auto ns = TavoConfigStore::sGlobalNamespace;
+  ConfigStore::GetStore(ns)->BeginTransaction();
+  ConfigStore::GetStore(ns)->DeleteObjects(std::make_shared<TavoConfigStore::FilterSpecObject>(
+      TavoConfigStore::ConfigStoreObjectId("karst_policies", "", "")));
+  EXPECT_TRUE(ThreadConnectionInTransaction());
+  ConfigStore::GetStore(ns)->CommitTransaction();
+  EXPECT_EQ(Classify(KarstLib::ListPolicyInfo()).kind, Observed::kEmpty);
+  Restore();
+
+  // The library's own handle is the last: abandoned at once.
+  auto probe = std::make_shared<FaultInjector>();
+  probe->FailWith("SetObject", 2, [] { throw std::bad_alloc(); });
+  TavoConfigStore::InstallCallProbe(probe);
+  EXPECT_THROW(KarstLib::AddPolicyInfo(PoliciesFor(kNew)), std::bad_alloc);
+  TavoConfigStore::InstallCallProbe(nullptr);
+  EXPECT_FALSE(ThreadConnectionInTransaction());
+  EXPECT_TRUE(WriteLockFree());
+  EXPECT_TRUE(Is(Classify(KarstLib::ListPolicyInfo()), kOld));
+
+  // The host holds a handle: the transaction stays until the next write.
+  auto held = ConfigStore::GetStore(ns);
+  probe = std::make_shared<FaultInjector>();
+  probe->FailWith("SetObject", 2, [] { throw std::bad_alloc(); });
+  TavoConfigStore::InstallCallProbe(probe);
+  EXPECT_THROW(KarstLib::AddPolicyInfo(PoliciesFor(kNew)), std::bad_alloc);
+  TavoConfigStore::InstallCallProbe(nullptr);
+  EXPECT_TRUE(ThreadConnectionInTransaction());
+  EXPECT_FALSE(WriteLockFree());
+  EXPECT_TRUE(Is(Committed().policies, kOld));
+  try {
+    KarstLib::AddPolicyInfo(PoliciesFor(kNew));
+    ADD_FAILURE() << "a write succeeded inside the abandoned transaction";
+  } catch (const ConfigStoreException& e) {
+    EXPECT_EQ(e.Code(), TavoConfigStore::kErrorNestedTransaction);
+  }
+  EXPECT_FALSE(ThreadConnectionInTransaction());
+  EXPECT_TRUE(WriteLockFree());
+  KarstLib::AddPolicyInfo(PoliciesFor(kNew));
+  EXPECT_TRUE(Is(Committed().policies, kNew));
 }
 
 }  // namespace
