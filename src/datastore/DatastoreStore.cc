@@ -14,19 +14,18 @@ KarstDatastoreInfo ReadDatastore(const TavoConfigStore::ConfigStoreObject& objec
   datastore.drp_policy_id = ReadString(object, kDrpPolicyIdValue);
   return datastore;
 }
+
+ObjectPtr BuildDatastoreObject(const KarstDatastoreInfo& datastore) {
+  ObjectPtr object = NewObject(kDatastoresKey, datastore.url);
+  object->SetValue(kUrlValue.c_str(), datastore.url);
+  object->SetValue(kDatastoreNamespaceValue.c_str(), datastore.datastore_namespace);
+  object->SetValue(kDrpPolicyIdValue.c_str(), datastore.drp_policy_id);
+  return object;
+}
 }  // namespace
 
 void StoreDatastores(const std::vector<KarstDatastoreInfo>& datastores) {
-  RunInWriteBracket([&datastores](const StorePtr& store) {
-    ClearDatastores(store, false);
-    for (const KarstDatastoreInfo& datastore : datastores) {
-      ObjectPtr object = NewObject(kDatastoresKey, datastore.url);
-      object->SetValue(kUrlValue.c_str(), datastore.url);
-      object->SetValue(kDatastoreNamespaceValue.c_str(), datastore.datastore_namespace);
-      object->SetValue(kDrpPolicyIdValue.c_str(), datastore.drp_policy_id);
-      WriteObject(*store, object);
-    }
-  });
+  ReplaceCollection(ClearDatastores, datastores, BuildDatastoreObject);
 }
 
 std::vector<KarstDatastoreInfo> ListDatastores() {

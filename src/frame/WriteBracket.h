@@ -30,6 +30,17 @@ void RunInWriteBracket(Changes&& changes) {
   }
 }
 
+// Replaces one whole collection: clears it (errors raised) and writes the
+// object "build" makes of each record, in input order, in one transaction.
+template <typename Record, typename Build>
+void ReplaceCollection(void (*clear)(const StorePtr&, bool), const std::vector<Record>& records,
+                       Build build) {
+  RunInWriteBracket([&](const StorePtr& store) {
+    clear(store, false);
+    for (const Record& record : records) WriteObject(*store, build(record));
+  });
+}
+
 }  // namespace TavoKarst
 
 #endif  // KARST_FRAME_WRITE_BRACKET_H_

@@ -27,12 +27,7 @@ ObjectPtr BuildPolicyObject(const KarstPolicyInfo& policy) {
 }  // namespace
 
 void StorePolicies(const std::vector<KarstPolicyInfo>& policies) {
-  RunInWriteBracket([&policies](const StorePtr& store) {
-    ClearPolicies(store, false);
-    for (const KarstPolicyInfo& policy : policies) {
-      WriteObject(*store, BuildPolicyObject(policy));
-    }
-  });
+  ReplaceCollection(ClearPolicies, policies, BuildPolicyObject);
 }
 
 }  // namespace TavoKarst
