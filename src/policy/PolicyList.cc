@@ -5,26 +5,31 @@
 namespace TavoKarst {
 
 namespace {
+// Built once: the filter is the same for every policy and is only read.
+const std::shared_ptr<TavoConfigStore::FilterSpecObject>& BlobsFilter() {
+  static const auto filter = std::make_shared<TavoConfigStore::FilterSpecObject>(
+      TavoConfigStore::ConfigStoreObjectId(kBlobsArray, TavoConfigStore::kEmptyString,
+                                           TavoConfigStore::kEmptyString, std::string()));
+  return filter;
+}
+
+// Each string is read straight into its field; a missing value leaves the
+// field empty, as ReadString would.
 KarstPolicyInfo ReadPolicy(const TavoConfigStore::ConfigStoreObject& object) {
   KarstPolicyInfo policy;
-  policy.name = ReadString(object, kNameValue);
-  policy.policy_id = ReadString(object, kPolicyIdValue);
-  policy.description = ReadString(object, kDescriptionValue);
+  object.GetValue(kNameValue.c_str(), &policy.name);
+  object.GetValue(kPolicyIdValue.c_str(), &policy.policy_id);
+  object.GetValue(kDescriptionValue.c_str(), &policy.description);
   // A policy stored without a generation number lists it as 0.
   long long generation = 0;
   object.GetValue(kGenerationNumberValue.c_str(), &generation);
   policy.generation_number = generation;
 
-  TavoConfigStore::ConfigStoreObjectId blobsId(kBlobsArray, TavoConfigStore::kEmptyString,
-                                               TavoConfigStore::kEmptyString, std::string());
-  auto blobsFilter = std::make_shared<TavoConfigStore::FilterSpecObject>(blobsId);
-  const auto instances = object.GetSubObjectInstances(blobsFilter);
-  policy.blobs.reserve(instances.size());
-  for (const auto& instance : instances) {
-    KarstPolicyBlob blob;
-    blob.blob = ReadString(*instance, kBlobValue);
-    blob.datastore_namespace = ReadString(*instance, kDatastoreNamespaceValue);
-    policy.blobs.push_back(std::move(blob));
+  const auto instances = object.GetSubObjectInstances(BlobsFilter());
+  policy.blobs.resize(instances.size());
+  for (std::size_t i = 0; i < instances.size(); ++i) {
+    instances[i]->GetValue(kBlobValue.c_str(), &policy.blobs[i].blob);
+    instances[i]->GetValue(kDatastoreNamespaceValue.c_str(), &policy.blobs[i].datastore_namespace);
   }
   return policy;
 }

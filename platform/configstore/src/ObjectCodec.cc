@@ -1,6 +1,9 @@
 #include "ObjectCodec.h"
 
+#include <cstddef>
 #include <cstdint>
+#include <cstring>
+#include <new>
 #include <utility>
 #include <vector>
 
@@ -14,36 +17,69 @@ constexpr unsigned char kFormat = 1;
 constexpr unsigned char kKindBytes = 0;
 constexpr unsigned char kKindInteger = 1;
 
-void PutVarint(std::uint64_t v, std::string* out) {
+std::size_t VarintSize(std::uint64_t v) {
+  std::size_t n = 1;
   while (v >= 0x80) {
-    out->push_back(static_cast<char>((v & 0x7f) | 0x80));
+    v >>= 7;
+    ++n;
+  }
+  return n;
+}
+
+char* PutVarint(std::uint64_t v, char* out) {
+  while (v >= 0x80) {
+    *out++ = static_cast<char>((v & 0x7f) | 0x80);
     v >>= 7;
   }
-  out->push_back(static_cast<char>(v));
+  *out++ = static_cast<char>(v);
+  return out;
 }
 
-void PutBytes(const std::string& s, std::string* out) {
-  PutVarint(s.size(), out);
-  out->append(s);
+char* PutBytes(const std::string& s, char* out) {
+  out = PutVarint(s.size(), out);
+  if (!s.empty()) std::memcpy(out, s.data(), s.size());
+  return out + s.size();
 }
 
-void PutValues(const std::vector<StoreValue>& values, std::string* out) {
-  PutVarint(values.size(), out);
+std::uint64_t Zigzag(long long value) {
+  // Zigzag keeps small negative numbers short.
+  const auto n = static_cast<std::uint64_t>(value);
+  return (n << 1) ^ (0 - (n >> 63));
+}
+
+std::size_t BytesSize(const std::string& s) { return VarintSize(s.size()) + s.size(); }
+
+std::size_t ValuesSize(const std::vector<StoreValue>& values) {
+  std::size_t n = VarintSize(values.size());
   for (const StoreValue& v : values) {
-    PutBytes(v.name, out);
+    n += BytesSize(v.name) + 1;
     if (const auto* s = std::get_if<std::string>(&v.value)) {
-      out->push_back(static_cast<char>(kKindBytes));
-      PutBytes(*s, out);
+      n += BytesSize(*s);
     } else {
-      out->push_back(static_cast<char>(kKindInteger));
-      // Zigzag keeps small negative numbers short.
-      const auto n = static_cast<std::uint64_t>(std::get<long long>(v.value));
-      PutVarint((n << 1) ^ (0 - (n >> 63)), out);
+      n += VarintSize(Zigzag(std::get<long long>(v.value)));
     }
   }
+  return n;
 }
 
-// A bounds-checked cursor: every read checks what is left first.
+char* PutValues(const std::vector<StoreValue>& values, char* out) {
+  out = PutVarint(values.size(), out);
+  for (const StoreValue& v : values) {
+    out = PutBytes(v.name, out);
+    if (const auto* s = std::get_if<std::string>(&v.value)) {
+      *out++ = static_cast<char>(kKindBytes);
+      out = PutBytes(*s, out);
+    } else {
+      *out++ = static_cast<char>(kKindInteger);
+      out = PutVarint(Zigzag(std::get<long long>(v.value)), out);
+    }
+  }
+  return out;
+}
+
+// A bounds-checked cursor: every read checks what is left first. Bodies are
+// checked in full when decoded, so the later readers never meet damage; they
+// check anyway, as memory handed to a StoreObject by other means might be bad.
 class Reader {
  public:
   Reader(const unsigned char* data, std::size_t size) : p_(data), end_(data + size) {}
@@ -53,6 +89,7 @@ class Reader {
   }
 
   std::size_t Left() const { return static_cast<std::size_t>(end_ - p_); }
+  const unsigned char* Position() const { return p_; }
 
   unsigned char Byte() {
     if (p_ == end_) Corrupt("truncated");
@@ -60,6 +97,8 @@ class Reader {
   }
 
   std::uint64_t Varint() {
+    // One byte is the common case: lengths and counts below 128.
+    if (p_ != end_ && *p_ < 0x80) return *p_++;
     std::uint64_t v = 0;
     for (int shift = 0; shift < 64; shift += 7) {
       const unsigned char b = Byte();
@@ -79,12 +118,51 @@ class Reader {
     return static_cast<std::size_t>(n);
   }
 
-  std::string Bytes() {
+  // A length-prefixed byte string, in place.
+  const char* Bytes(std::size_t* size) {
     const std::uint64_t n = Varint();
     if (n > Left()) Corrupt("length exceeds the encoding");
-    std::string s(reinterpret_cast<const char*>(p_), static_cast<std::size_t>(n));
+    const char* s = reinterpret_cast<const char*>(p_);
     p_ += n;
+    *size = static_cast<std::size_t>(n);
     return s;
+  }
+
+  std::string String() {
+    std::size_t size;
+    const char* s = Bytes(&size);
+    return std::string(s, size);
+  }
+
+  long long Integer() {
+    const std::uint64_t z = Varint();
+    return static_cast<long long>((z >> 1) ^ (0 - (z & 1)));
+  }
+
+  // Steps over one value and returns its kind.
+  unsigned char SkipPayload() {
+    const unsigned char kind = Byte();
+    std::size_t size;
+    switch (kind) {
+      case kKindBytes:
+        Bytes(&size);
+        break;
+      case kKindInteger:
+        Varint();
+        break;
+      default:
+        Corrupt("unknown value kind");
+    }
+    return kind;
+  }
+
+  void SkipValues() {
+    const std::size_t count = Count();
+    std::size_t size;
+    for (std::size_t i = 0; i < count; ++i) {
+      Bytes(&size);
+      SkipPayload();
+    }
   }
 
  private:
@@ -92,22 +170,149 @@ class Reader {
   const unsigned char* end_;
 };
 
-std::vector<StoreValue> GetValues(Reader* r) {
-  const std::size_t count = r->Count();
+}  // namespace
+
+void EncodeObject(const ConfigStoreObject& object, std::string* out) {
+  // Sized first and written in one go: no regrowing of "out".
+  static const std::vector<StoreValue> kNoValues;
+  const std::vector<SubObjectEntry>& subs = object.SubObjects();
+  std::size_t size = 1 + ValuesSize(object.Values()) + VarintSize(subs.size());
+  for (const SubObjectEntry& e : subs) {
+    size += BytesSize(e.id.Array()) + BytesSize(e.id.Key()) +
+            ValuesSize(e.object ? e.object->Values() : kNoValues);
+  }
+  const std::size_t start = out->size();
+  out->resize(start + size);
+  char* p = &(*out)[start];
+  *p++ = static_cast<char>(kFormat);
+  p = PutValues(object.Values(), p);
+  p = PutVarint(subs.size(), p);
+  for (const SubObjectEntry& e : subs) {
+    p = PutBytes(e.id.Array(), p);
+    p = PutBytes(e.id.Key(), p);
+    p = PutValues(e.object ? e.object->Values() : kNoValues, p);
+  }
+}
+
+std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId id, const unsigned char* data,
+                                                std::size_t size, BodyArena* arena) {
+  // Check everything now, so that damage is reported by the read that
+  // fetched it and the object's lazy readers only meet sound bytes. The walk
+  // notes where the sub-objects are, so they can be built right away while
+  // the body is still in the cache.
+  Reader r(data, size);
+  if (r.Byte() != kFormat) Reader::Corrupt("unknown format");
+  const std::size_t valuesBegin = 1;
+  r.SkipValues();
+  const std::size_t subsBegin = size - r.Left();
+  const std::size_t count = r.Count();
+  SubSpan spans[kEagerSubs];
+  for (std::size_t i = 0; i < count; ++i) {
+    SubSpan span;
+    span.array = static_cast<std::size_t>(
+        reinterpret_cast<const unsigned char*>(r.Bytes(&span.arraySize)) - data);
+    span.key = static_cast<std::size_t>(
+        reinterpret_cast<const unsigned char*>(r.Bytes(&span.keySize)) - data);
+    span.values = size - r.Left();
+    r.SkipValues();
+    span.valuesSize = size - r.Left() - span.values;
+    if (i < kEagerSubs) spans[i] = span;
+  }
+  if (r.Left() != 0) Reader::Corrupt("trailing bytes");
+
+  return Access::NewObject(std::move(id), data, size, valuesBegin, subsBegin, count,
+                           count <= kEagerSubs ? spans : nullptr, arena);
+}
+
+std::shared_ptr<ConfigStoreObject> Access::NewObject(ConfigStoreObjectId&& id,
+                                                     const unsigned char* body, std::size_t size,
+                                                     std::size_t valuesBegin, std::size_t subsBegin,
+                                                     std::size_t subs, const SubSpan* spans,
+                                                     BodyArena* arena) {
+  // The sub-objects live next to the body: listing them costs no allocation.
+  unsigned char* copy = nullptr;
+  BodyArena own;
+  std::shared_ptr<Body> block = (arena != nullptr ? arena : &own)->NewBody(subs, size, &copy);
+  if (size != 0) std::memcpy(copy, body, size);
+  block->subsSize = size - subsBegin;
+
+  auto object = std::make_shared<ConfigStoreObject>(std::move(id));
+  object->encoded_ = copy + valuesBegin;
+  object->encodedSize_ = subsBegin - valuesBegin;
+  object->encodedSubs_ = copy + subsBegin;
+  if (spans != nullptr) {
+    for (std::size_t i = 0; i < subs; ++i) {
+      Body::Sub* sub = new (block->subs + i) Body::Sub();
+      block->built = i + 1;
+      const auto* at = reinterpret_cast<const char*>(copy);
+      sub->array = std::string_view(at + spans[i].array, spans[i].arraySize);
+      sub->key = std::string_view(at + spans[i].key, spans[i].keySize);
+      sub->object.encoded_ = copy + spans[i].values;
+      sub->object.encodedSize_ = spans[i].valuesSize;
+    }
+    object->subsBuilt_.store(true, std::memory_order_relaxed);
+  }
+  object->body_ = std::move(block);
+  return object;
+}
+
+struct BodyArena::Chunk {
+  unsigned char* area = nullptr;
+  std::size_t capacity = 0;
+  std::size_t used = 0;
+
+  Chunk() = default;
+  Chunk(const Chunk&) = delete;
+  Chunk& operator=(const Chunk&) = delete;
+  ~Chunk() {
+    for (std::size_t at = 0; at < used;) {
+      auto* body = reinterpret_cast<Body*>(area + at);
+      at += body->footprint;
+      body->~Body();
+    }
+  }
+};
+
+std::shared_ptr<Body> BodyArena::NewBody(std::size_t subs, std::size_t size,
+                                         unsigned char** bytes) {
+  using Body = Body;
+  constexpr std::size_t kAlign = alignof(std::max_align_t);
+  static_assert(sizeof(Body) % alignof(Body::Sub) == 0, "sub-objects follow the body");
+  const std::size_t need =
+      (sizeof(Body) + subs * sizeof(Body::Sub) + size + kAlign - 1) / kAlign * kAlign;
+  if (!chunk_ || chunk_->capacity - chunk_->used < need) {
+    // A body too large for a shared chunk gets one of its own size.
+    const std::size_t capacity = need > kChunkSize / 4 ? need : kChunkSize;
+    unsigned char* area = nullptr;
+    chunk_ = std::allocate_shared<Chunk>(TrailingBytes<Chunk>(capacity, &area));
+    chunk_->area = area;
+    chunk_->capacity = capacity;
+  }
+  unsigned char* at = chunk_->area + chunk_->used;
+  auto* body = new (at) Body();
+  body->footprint = need;
+  chunk_->used += need;
+  body->subs = reinterpret_cast<Body::Sub*>(at + sizeof(Body));
+  body->capacity = subs;
+  *bytes = at + sizeof(Body) + subs * sizeof(Body::Sub);
+  return std::shared_ptr<Body>(chunk_, body);
+}
+
+std::vector<StoreValue> DecodeValues(const unsigned char* data, std::size_t size) {
+  Reader r(data, size);
+  const std::size_t count = r.Count();
   std::vector<StoreValue> values;
   values.reserve(count);
   for (std::size_t i = 0; i < count; ++i) {
     StoreValue v;
-    v.name = r->Bytes();
-    switch (r->Byte()) {
+    v.name = r.String();
+    switch (r.Byte()) {
       case kKindBytes:
-        v.value = r->Bytes();
+        v.value = r.String();
         break;
-      case kKindInteger: {
-        const std::uint64_t z = r->Varint();
-        v.value = static_cast<long long>((z >> 1) ^ (0 - (z & 1)));
+      case kKindInteger:
+        v.value = r.Integer();
         break;
-      }
       default:
         Reader::Corrupt("unknown value kind");
     }
@@ -116,37 +321,51 @@ std::vector<StoreValue> GetValues(Reader* r) {
   return values;
 }
 
-}  // namespace
-
-void EncodeObject(const ConfigStoreObject& object, std::string* out) {
-  out->push_back(static_cast<char>(kFormat));
-  PutValues(object.Values(), out);
-  const std::vector<SubObjectEntry>& subs = object.SubObjects();
-  PutVarint(subs.size(), out);
-  static const std::vector<StoreValue> kNoValues;
-  for (const SubObjectEntry& e : subs) {
-    PutBytes(e.id.Array(), out);
-    PutBytes(e.id.Key(), out);
-    PutValues(e.object ? e.object->Values() : kNoValues, out);
+bool FindValue(const unsigned char* data, std::size_t size, const char* name, ValueRef* out) {
+  const std::size_t nameSize = std::strlen(name);
+  Reader r(data, size);
+  const std::size_t count = r.Count();
+  for (std::size_t i = 0; i < count; ++i) {
+    std::size_t candidateSize;
+    const char* candidate = r.Bytes(&candidateSize);
+    if (candidateSize != nameSize || std::memcmp(candidate, name, nameSize) != 0) {
+      r.SkipPayload();
+      continue;
+    }
+    switch (r.Byte()) {
+      case kKindBytes:
+        out->isInteger = false;
+        out->bytes = r.Bytes(&out->size);
+        return true;
+      case kKindInteger:
+        out->isInteger = true;
+        out->integer = r.Integer();
+        return true;
+      default:
+        Reader::Corrupt("unknown value kind");
+    }
   }
+  return false;
 }
 
-std::shared_ptr<ConfigStoreObject> DecodeObject(const ConfigStoreObjectId& id,
-                                                const unsigned char* data, std::size_t size) {
+SubReader::SubReader(const unsigned char* data, std::size_t size)
+    : p_(data), end_(data + size), count_(0), left_(0) {
   Reader r(data, size);
-  if (r.Byte() != kFormat) Reader::Corrupt("unknown format");
-  std::vector<StoreValue> values = GetValues(&r);
-  const std::size_t count = r.Count();
-  std::vector<SubObjectEntry> subs;
-  subs.reserve(count);
-  for (std::size_t i = 0; i < count; ++i) {
-    std::string array = r.Bytes();
-    std::string key = r.Bytes();
-    subs.push_back(
-        SubObjectEntry{SubObjectId(array, key), std::make_shared<StoreObject>(GetValues(&r))});
-  }
-  if (r.Left() != 0) Reader::Corrupt("trailing bytes");
-  return std::make_shared<ConfigStoreObject>(id, std::move(values), std::move(subs));
+  count_ = left_ = r.Count();
+  p_ = r.Position();
+}
+
+bool SubReader::Next(SubRef* out) {
+  if (left_ == 0) return false;
+  Reader r(p_, static_cast<std::size_t>(end_ - p_));
+  out->array = r.Bytes(&out->arraySize);
+  out->key = r.Bytes(&out->keySize);
+  out->values = r.Position();
+  r.SkipValues();
+  out->valuesSize = static_cast<std::size_t>(r.Position() - out->values);
+  p_ = r.Position();
+  --left_;
+  return true;
 }
 
 }  // namespace codec

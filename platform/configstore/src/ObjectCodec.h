@@ -2,13 +2,19 @@
 // SQLite backend keeps it in a single column. Internal to the library.
 //
 // Format 1 (varint = unsigned LEB128, at most 10 bytes):
-//   body   := u8 format=1, varint count, value*, varint count, sub*
+//   body   := u8 format=1, values, varint count, sub*
+//   values := varint count, value*
 //   value  := bytes name, u8 kind (0 = byte string, 1 = integer), payload
 //             payload: bytes for kind 0, zigzag varint for kind 1
-//   sub    := bytes array, bytes key, varint count, value*
+//   sub    := bytes array, bytes key, values
 //   bytes  := varint length, that many raw bytes
 // The identifier is not part of the body: the store keeps it in its own
 // columns, where it can be indexed.
+//
+// A decoded object keeps its body, in the same allocation, and reads values
+// straight from it (see StoreObject.h). A body is checked in full once, when
+// it is decoded, and the readers below then walk memory known to be well
+// formed (they check bounds all the same).
 
 #ifndef TAVOCONFIGSTORE_SRC_OBJECT_CODEC_H_
 #define TAVOCONFIGSTORE_SRC_OBJECT_CODEC_H_
@@ -16,6 +22,8 @@
 #include <cstddef>
 #include <memory>
 #include <string>
+#include <string_view>
+#include <vector>
 
 #include "TavoConfigStore/StoreObject.h"
 
@@ -25,13 +33,154 @@ namespace codec {
 // Appends the encoding of the object's values and sub-objects to "*out".
 void EncodeObject(const ConfigStoreObject& object, std::string* out);
 
+class BodyArena;
+
 // A new object with identifier "id" and the contents encoded in
-// data[0, size). Throws ConfigStoreException(kErrorCorruptObject) when the
-// bytes are not a complete, well-formed encoding; never reads past "size".
-std::shared_ptr<ConfigStoreObject> DecodeObject(const ConfigStoreObjectId& id,
-                                                const unsigned char* data, std::size_t size);
+// data[0, size), which is copied into memory from "arena" (or, when null, an
+// allocation of its own). Throws ConfigStoreException(kErrorCorruptObject)
+// when the bytes are not a complete, well-formed encoding; never reads past
+// "size".
+std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId id, const unsigned char* data,
+                                                std::size_t size, BodyArena* arena = nullptr);
+
+// ---- Readers of a checked "values" section ---------------------------------
+
+// Every value, in order.
+std::vector<StoreValue> DecodeValues(const unsigned char* data, std::size_t size);
+
+// The first value called "name" (compared as std::string == const char*
+// would). Its bytes point into the section.
+struct ValueRef {
+  bool isInteger = false;
+  const char* bytes = nullptr;
+  std::size_t size = 0;
+  long long integer = 0;
+};
+bool FindValue(const unsigned char* data, std::size_t size, const char* name, ValueRef* out);
+
+// ---- Reader of a checked "varint count, sub*" section ----------------------
+
+struct SubRef {
+  const char* array;
+  std::size_t arraySize;
+  const char* key;
+  std::size_t keySize;
+  const unsigned char* values;  // a "values" section
+  std::size_t valuesSize;
+};
+
+class SubReader {
+ public:
+  SubReader(const unsigned char* data, std::size_t size);
+  std::size_t Count() const { return count_; }
+  // The next sub-object; false after the last.
+  bool Next(SubRef* out);
+
+ private:
+  const unsigned char* p_;
+  const unsigned char* end_;
+  std::size_t count_;
+  std::size_t left_;
+};
+
+// Where one sub-object lies in a body, as offsets from its start.
+struct SubSpan {
+  std::size_t array = 0;
+  std::size_t arraySize = 0;
+  std::size_t key = 0;
+  std::size_t keySize = 0;
+  std::size_t values = 0;
+  std::size_t valuesSize = 0;
+};
+// Objects with at most this many sub-objects get them built when decoded;
+// others build them on first access.
+constexpr std::size_t kEagerSubs = 16;
+
+// Builds objects over encoded memory; the friend the object classes allow.
+class Access {
+ public:
+  // "subs" sub-objects, built at once when "spans" gives where they lie.
+  static std::shared_ptr<ConfigStoreObject> NewObject(ConfigStoreObjectId&& id,
+                                                      const unsigned char* body, std::size_t size,
+                                                      std::size_t valuesBegin,
+                                                      std::size_t subsBegin, std::size_t subs,
+                                                      const SubSpan* spans, BodyArena* arena);
+};
+
+// The bodies of the objects of one listing, placed one after another in
+// shared chunks. One allocation then serves dozens of objects, and bodies,
+// larger than what malloc keeps on its fast paths, stop costing a slow one
+// each. A chunk lives while any object or sub-object placed in it does.
+// The memory of an object read from the store (see BodyArena): the header,
+// room for its sub-objects, then the encoded body.
+struct Body {
+  struct Sub {
+    std::string_view array;
+    std::string_view key;
+    StoreObject object;
+  };
+  Sub* subs = nullptr;  // room for "capacity", of which "built" are built
+  std::size_t capacity = 0;
+  std::size_t built = 0;
+  std::size_t subsSize = 0;   // of the encoded "count, sub*" section
+  std::size_t footprint = 0;  // bytes taken in its arena chunk
+
+  Body() = default;
+  Body(const Body&) = delete;
+  Body& operator=(const Body&) = delete;
+  ~Body() {
+    for (std::size_t i = 0; i < built; ++i) subs[i].~Sub();
+  }
+};
+
+class BodyArena {
+ public:
+  static constexpr std::size_t kChunkSize = 64 * 1024;
+
+  // A new body with room for "subs" sub-objects and "size" bytes, which
+  // start at "*bytes".
+  std::shared_ptr<Body> NewBody(std::size_t subs, std::size_t size, unsigned char** bytes);
+
+ private:
+  struct Chunk;
+  std::shared_ptr<Chunk> chunk_;
+};
+
+// An allocator for allocate_shared that asks for "extra" bytes more than the
+// control block needs and reports where they start: the object and a buffer
+// of its own then take one allocation. Aligned for any type.
+template <typename T>
+struct TrailingBytes {
+  using value_type = T;
+  std::size_t extra;
+  unsigned char** bytes;
+
+  TrailingBytes(std::size_t e, unsigned char** b) : extra(e), bytes(b) {}
+  template <typename U>
+  TrailingBytes(const TrailingBytes<U>& other) : extra(other.extra), bytes(other.bytes) {}
+
+  static constexpr std::size_t Head(std::size_t n) {
+    constexpr std::size_t kAlign = alignof(std::max_align_t);
+    return (n * sizeof(T) + kAlign - 1) / kAlign * kAlign;
+  }
+  T* allocate(std::size_t n) {
+    auto* p = static_cast<unsigned char*>(::operator new(Head(n) + extra));
+    *bytes = p + Head(n);
+    return reinterpret_cast<T*>(p);
+  }
+  void deallocate(T* p, std::size_t) { ::operator delete(p); }
+  template <typename U>
+  bool operator==(const TrailingBytes<U>& other) const {
+    return extra == other.extra && bytes == other.bytes;
+  }
+  template <typename U>
+  bool operator!=(const TrailingBytes<U>& other) const {
+    return !(*this == other);
+  }
+};
 
 }  // namespace codec
+
 }  // namespace TavoConfigStore
 
 #endif  // TAVOCONFIGSTORE_SRC_OBJECT_CODEC_H_

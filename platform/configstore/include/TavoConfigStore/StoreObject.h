@@ -1,6 +1,8 @@
 #ifndef TAVOCONFIGSTORE_STORE_OBJECT_H_
 #define TAVOCONFIGSTORE_STORE_OBJECT_H_
 
+#include <atomic>
+#include <cstddef>
 #include <memory>
 #include <string>
 #include <variant>
@@ -17,13 +19,26 @@ struct StoreValue {
   std::variant<std::string, long long> value;
 };
 
+namespace codec {
+class Access;
+struct Body;
+}  // namespace codec
+
+class ConfigStoreObject;
+
 // A set of named values. Setting a name that is already present replaces its
 // value (and may change its kind); values keep the order in which their names
 // were first set.
+//
+// Objects read from the SQLite store keep the values in their stored encoding
+// and read them from there in place; the vector behind Values() is built only
+// when asked for. Const members may be called from several threads at once.
 class CONFIGSTORE_EXPORT StoreObject {
  public:
   StoreObject() = default;
   explicit StoreObject(std::vector<StoreValue> values) : values_(std::move(values)) {}
+  StoreObject(const StoreObject& other);
+  StoreObject& operator=(const StoreObject& other);
   virtual ~StoreObject();
 
   void SetValue(const char* name, const std::string& value);
@@ -35,16 +50,25 @@ class CONFIGSTORE_EXPORT StoreObject {
   bool GetValue(const char* name, long long* value) const;
 
   // For backends: every value, without notifying the call probe.
-  const std::vector<StoreValue>& Values() const noexcept { return values_; }
+  const std::vector<StoreValue>& Values() const;
 
  private:
+  friend class ConfigStoreObject;
+  friend class codec::Access;
+
   StoreValue& Slot(const char* name);
   const StoreValue* Find(const char* name) const;
+  // Before a change: encoded values become ordinary ones.
+  void Own();
 
-  std::vector<StoreValue> values_;
+  // While encoded_ is set, the values are the ones encoded at
+  // encoded_[0, encodedSize_), in memory whose owner also owns this object,
+  // and values_ is filled from them on the first Values().
+  mutable std::vector<StoreValue> values_;
+  const unsigned char* encoded_ = nullptr;
+  std::size_t encodedSize_ = 0;
+  mutable std::atomic<bool> expanded_{false};
 };
-
-class ConfigStoreObject;
 
 // One sub-object together with its identifier, as a backend encodes it.
 struct SubObjectEntry {
@@ -58,8 +82,12 @@ struct SubObjectEntry {
 class CONFIGSTORE_EXPORT ConfigStoreObject : public StoreObject {
  public:
   explicit ConfigStoreObject(const ConfigStoreObjectId& id);
+  explicit ConfigStoreObject(ConfigStoreObjectId&& id);
   ConfigStoreObject(const ConfigStoreObjectId& id, std::vector<StoreValue> values,
                     std::vector<SubObjectEntry> subObjects);
+  // Shares the sub-objects, as a member-wise copy would.
+  ConfigStoreObject(const ConfigStoreObject& other);
+  ConfigStoreObject& operator=(const ConfigStoreObject& other);
   ~ConfigStoreObject() override;
 
   const ConfigStoreObjectId& Id() const noexcept { return id_; }
@@ -76,14 +104,33 @@ class CONFIGSTORE_EXPORT ConfigStoreObject : public StoreObject {
       const std::shared_ptr<FilterSpecObject>& filter) const;
 
   // For backends: every sub-object, without notifying the call probe.
-  const std::vector<SubObjectEntry>& SubObjects() const noexcept { return subObjects_; }
+  const std::vector<SubObjectEntry>& SubObjects() const;
 
   // A deep copy: values and sub-objects are not shared with this object.
   std::shared_ptr<ConfigStoreObject> Clone() const;
 
  private:
+  friend class codec::Access;
+
+  // The body's sub-objects, built once.
+  const codec::Body& BuiltSubs() const;
+  // Fills subObjects_ from the body once.
+  void ExpandSubObjects() const;
+  // Before a change: subObjects_ becomes the only record of the sub-objects.
+  void OwnSubObjects();
+
   ConfigStoreObjectId id_;
-  std::vector<SubObjectEntry> subObjects_;
+  // While encodedSubs_ is set, the sub-objects are the ones encoded there and
+  // built in body_; subObjects_ is filled, sharing them, only when asked for.
+  mutable std::vector<SubObjectEntry> subObjects_;
+  const unsigned char* encodedSubs_ = nullptr;
+  // Holds the encoded values and sub-objects; shared with the sub-objects
+  // handed out, which may outlive this object.
+  // The memory of an object read from the store: its encoded body and room
+  // for its sub-objects, which are built there on first access.
+  std::shared_ptr<codec::Body> body_;
+  mutable std::atomic<bool> subsBuilt_{false};
+  mutable std::atomic<bool> subsExpanded_{false};
 };
 
 }  // namespace TavoConfigStore
