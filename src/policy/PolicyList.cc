@@ -5,14 +5,6 @@
 namespace TavoKarst {
 
 namespace {
-// Built once: the filter is the same for every policy and is only read.
-const std::shared_ptr<TavoConfigStore::FilterSpecObject>& BlobsFilter() {
-  static const auto filter = std::make_shared<TavoConfigStore::FilterSpecObject>(
-      TavoConfigStore::ConfigStoreObjectId(kBlobsArray, TavoConfigStore::kEmptyString,
-                                           TavoConfigStore::kEmptyString, std::string()));
-  return filter;
-}
-
 // Each string is read straight into its field; a missing value leaves the
 // field empty, as ReadString would.
 KarstPolicyInfo ReadPolicy(const TavoConfigStore::ConfigStoreObject& object) {
@@ -25,7 +17,12 @@ KarstPolicyInfo ReadPolicy(const TavoConfigStore::ConfigStoreObject& object) {
   object.GetValue(kGenerationNumberValue.c_str(), &generation);
   policy.generation_number = generation;
 
-  const auto instances = object.GetSubObjectInstances(BlobsFilter());
+  // The filter over the "blobs" array is built anew for each policy: the
+  // library keeps nothing between calls but its fixed names.
+  TavoConfigStore::ConfigStoreObjectId blobsId(kBlobsArray, TavoConfigStore::kEmptyString,
+                                               TavoConfigStore::kEmptyString, std::string());
+  const auto instances =
+      object.GetSubObjectInstances(std::make_shared<TavoConfigStore::FilterSpecObject>(blobsId));
   policy.blobs.resize(instances.size());
   for (std::size_t i = 0; i < instances.size(); ++i) {
     instances[i]->GetValue(kBlobValue.c_str(), &policy.blobs[i].blob);
