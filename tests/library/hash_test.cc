@@ -38,12 +38,33 @@ TEST(Crc32Test, MatchesZlibAtEveryLengthAndAlignment) {
     ASSERT_EQ(TavoKarst::Crc32Bytewise(p, length), expected) << "length " << length;
     ASSERT_EQ(TavoKarst::Crc32Portable(p, length), expected) << "length " << length;
     ASSERT_EQ(TavoKarst::Crc32Clmul(p, length), expected) << "length " << length;
+    ASSERT_EQ(TavoKarst::Crc32Avx512(p, length), expected) << "length " << length;
     const std::string text(reinterpret_cast<const char*>(p), length);
     char hex[9];
     std::snprintf(hex, sizeof hex, "%x", expected);
     ASSERT_EQ(Crc32Hex(text), length == 0 ? "" : hex);
   }
   if (!TavoKarst::CpuHasClmul()) std::printf("note: no PCLMULQDQ here, folding path not run\n");
+  if (!TavoKarst::CpuHasAvx512Clmul()) {
+    std::printf("note: no VPCLMULQDQ with AVX-512 here, 512-bit folding path not run\n");
+  }
+  // Long texts run the wide paths' main loops many times over, and every
+  // path continues a CRC begun by another.
+  std::vector<unsigned char> big((1 << 20) + 77);
+  for (auto& b : big) b = static_cast<unsigned char>(rng());
+  for (std::size_t length : {std::size_t{256 * 1024}, big.size() - 3}) {
+    const auto expected =
+        static_cast<std::uint32_t>(crc32(0L, big.data() + 3, static_cast<uInt>(length)));
+    EXPECT_EQ(TavoKarst::Crc32(big.data() + 3, length), expected);
+    EXPECT_EQ(TavoKarst::Crc32Portable(big.data() + 3, length), expected);
+    EXPECT_EQ(TavoKarst::Crc32Clmul(big.data() + 3, length), expected);
+    EXPECT_EQ(TavoKarst::Crc32Avx512(big.data() + 3, length), expected);
+    const std::uint32_t head = TavoKarst::Crc32Portable(big.data() + 3, 1001);
+    EXPECT_EQ(TavoKarst::Crc32Avx512(big.data() + 1004, length - 1001, head), expected);
+    EXPECT_EQ(TavoKarst::Crc32Clmul(big.data() + 1004, length - 1001,
+                                    TavoKarst::Crc32Avx512(big.data() + 3, 1001)),
+              expected);
+  }
   // Continuing a CRC over a split text gives the CRC of the whole.
   const std::uint32_t head = TavoKarst::Crc32(buffer.data(), 1000);
   EXPECT_EQ(TavoKarst::Crc32(buffer.data() + 1000, 3000, head),
