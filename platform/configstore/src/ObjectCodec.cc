@@ -37,7 +37,7 @@ char* PutVarint(std::uint64_t v, char* out) {
 
 char* PutBytes(const std::string& s, char* out) {
   out = PutVarint(s.size(), out);
-  if (!s.empty()) std::memcpy(out, s.data(), s.size());
+  s.copy(out, s.size());  // raw bytes, no terminator
   return out + s.size();
 }
 

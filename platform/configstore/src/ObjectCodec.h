@@ -135,7 +135,7 @@ struct Body {
 
 class BodyArena {
  public:
-  static constexpr std::size_t kChunkSize = 64 * 1024;
+  static constexpr std::size_t kChunkSize = std::size_t{64} * 1024;
 
   // A new body with room for "subs" sub-objects and "size" bytes, which
   // start at "*bytes".
