@@ -8,8 +8,8 @@
 // I/O steps: the fault VFS ends the process at the k-th write, sync or
 // truncate SQLite makes during the replace. Each collection must be old or
 // new, and once a crash point leaves the new list, every later one must too.
-// A replace large enough to trigger SQLite's automatic checkpoint puts crash
-// points inside the copy of the log back into the database file as well.
+// A replace followed by a checkpoint puts crash points inside the copy of the
+// log back into the database file as well.
 
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -45,7 +45,8 @@ struct Target {
   int collection;  // 0 policies, 1 datastores
   Tag oldTag;
   Tag newTag;
-  int count;  // 0: the tag's own length
+  int count;                // 0: the tag's own length
+  bool checkpoint = false;  // a checkpoint follows the commit
 };
 
 void Replace(const Target& t) {
@@ -160,13 +161,15 @@ TEST_F(CrashStepsTest, CrashBeforeEveryStoreCallOfAReplace) {
 TEST_F(CrashStepsTest, CrashAtEveryWriteAndSyncOfAReplace) {
   int tried = 0, oldOrNew = 0, partial = 0, regressed = 0;
   std::string counts, durable;
-  for (const Target& t : {Target{"policies", 0, kOldPolicies, kNewPolicies, 0},
-                          Target{"datastores", 1, kOldDatastores, kNewDatastores, 0},
-                          Target{"checkpointing policies", 0, kOldPolicies, kNewPolicies, 3000}}) {
+  for (const Target& t :
+       {Target{"policies", 0, kOldPolicies, kNewPolicies, 0},
+        Target{"datastores", 1, kOldDatastores, kNewDatastores, 0},
+        Target{"checkpointing policies", 0, kOldPolicies, kNewPolicies, 300, true}}) {
     SCOPED_TRACE(t.name);
     FreshCopy();
     ChildResult dry = RunChild([&](int fd) {
       KarstLib::ListPolicyInfo();  // opened: only the replace's own I/O is counted
+      if (t.checkpoint) new CheckpointEveryCommit();  // the process ends with it
       FaultVfs::KeepLog(true);
       FaultVfs::Arm(IoFault{});
       Replace(t);
@@ -179,11 +182,10 @@ TEST_F(CrashStepsTest, CrashAtEveryWriteAndSyncOfAReplace) {
     const int total = static_cast<int>(calls.size());
     ASSERT_GT(total, 0);
 
-    // Every call of a small replace. Of a large one (which spills pages to
-    // the log early and checkpoints after the commit), an even sample, every
+    // Every call of a small replace. Of a large one, an even sample, every
     // call around the last write to the log, and a sample of the checkpoint.
     std::set<int> points;
-    const int limit = Scaled(60, 20);
+    const int limit = Scaled(120, 20);
     if (total <= limit) {
       for (int k = 1; k <= total; ++k) points.insert(k);
     } else {
@@ -208,6 +210,7 @@ TEST_F(CrashStepsTest, CrashAtEveryWriteAndSyncOfAReplace) {
         FreshCopy();
         ChildResult crash = RunChild([&](int) {
           KarstLib::ListPolicyInfo();
+          if (t.checkpoint) new CheckpointEveryCommit();
           IoFault fault;
           fault.action = action;
           fault.nth = k;

@@ -57,9 +57,13 @@ std::vector<Write> Writes() {
   return {{"replace policies", [] { KarstLib::AddPolicyInfo(PoliciesFor(kNew)); }, false},
           {"replace datastores", [] { KarstLib::AddDatastoreInfo(DatastoresFor(kNew)); }, false},
           {"reset", [] { KarstLib::Reset(); }, true},
-          // Large enough to spill to the log early and checkpoint after the commit.
+          // A checkpoint follows the commit.
           {"checkpointing replace",
-           [] { KarstLib::AddPolicyInfo(PoliciesFor(kNew, Scaled(3000, 1500))); }, false}};
+           [] {
+             CheckpointEveryCommit checkpoint;
+             KarstLib::AddPolicyInfo(PoliciesFor(kNew, 300));
+           },
+           false}};
 }
 
 bool Is(const Observed& o, Tag tag) { return o.kind == Observed::kWhole && o.tag == tag; }
@@ -115,7 +119,7 @@ TEST_F(IoErrorTest, EveryWriteSyncAndTruncateFails) {
     // Every call of a small write; of the large one, a sample of the log
     // writes and everything from its last log write on.
     std::set<int> points;
-    const int limit = Scaled(24, 8);
+    const int limit = Scaled(120, 12);
     if (total <= limit) {
       for (int k = 1; k <= total; ++k) points.insert(k);
     } else {

@@ -2,6 +2,7 @@
 
 #include <poll.h>
 #include <signal.h>
+#include <sqlite3.h>
 #include <stdlib.h>
 #include <sys/wait.h>
 #include <time.h>
@@ -18,6 +19,8 @@
 #include <fstream>
 #include <iostream>
 
+#include "SqliteStoreTesting.h"
+#include "TavoConfigStore/ConfigStore.h"
 #include "TavoConfigStore/ConfigStoreException.h"
 
 namespace karst_reliability {
@@ -272,6 +275,17 @@ Verdict VerifyInFreshProcess(double timeoutSeconds) {
   v.ok = true;
   return v;
 }
+
+namespace {
+void SetAutoCheckpoint(int pages) {
+  auto store = TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace);
+  sqlite3* db = TavoConfigStore::SqliteConnectionForTesting(*store);
+  if (db != nullptr) sqlite3_wal_autocheckpoint(db, pages);
+}
+}  // namespace
+
+CheckpointEveryCommit::CheckpointEveryCommit() { SetAutoCheckpoint(1); }
+CheckpointEveryCommit::~CheckpointEveryCommit() { SetAutoCheckpoint(1000); }
 
 void ReportFigures(const std::string& part, const std::string& line) {
   std::cout << line << std::endl;

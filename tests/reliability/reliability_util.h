@@ -100,6 +100,18 @@ struct Verdict {
 };
 Verdict VerifyInFreshProcess(double timeoutSeconds = 120);
 
+// While alive, every commit on this thread's cached store connection is
+// followed at once by a checkpoint (the copy of the log into the database
+// file), so a test can fail or crash inside one without writing the
+// thousand pages SQLite waits for by default.
+class CheckpointEveryCommit {
+ public:
+  CheckpointEveryCommit();
+  ~CheckpointEveryCommit();
+  CheckpointEveryCommit(const CheckpointEveryCommit&) = delete;
+  CheckpointEveryCommit& operator=(const CheckpointEveryCommit&) = delete;
+};
+
 // Prints "line" and keeps it as this run's figures of "part", which the test
 // script prints at the end of the whole run.
 void ReportFigures(const std::string& part, const std::string& line);
