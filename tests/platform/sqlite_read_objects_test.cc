@@ -266,12 +266,15 @@ TEST_F(SqliteReadObjectsTest, ListingsMatchTheMemoryBackend) {
       store_->DeleteObjects(filter);
       memory->DeleteObjects(filter);
     } else {
-      // Listings inside a transaction see its writes.
+      // Listings inside a transaction see its writes and deletions.
       store_->BeginTransaction();
       memory->BeginTransaction();
       auto o = Obj(pick({"a", "b"}), pick(groups), "c", "t" + std::to_string(step % 3));
       Set(*store_, o);
       Set(*memory, o);
+      const auto doomed = randomFilter();
+      store_->DeleteObjects(doomed);
+      memory->DeleteObjects(doomed);
       const auto filter = randomFilter();
       ASSERT_EQ(Instances(store_->GetObjects(filter)), Instances(memory->GetObjects(filter)));
       if (op == 8) {

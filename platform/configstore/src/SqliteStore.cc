@@ -193,7 +193,24 @@ class SqliteStore final : public ConfigStore {
     std::lock_guard<std::mutex> lock(mu_);
     RefuseWriteAfterRollback();
     const unsigned shape = ShapeOf(filter->Id());
-    sqlite3_stmt* s = FilterStatement(&deletes_, shape, "DELETE FROM objects", "");
+    sqlite3_stmt*& s = deletes_[shape];
+    if (s == nullptr) {
+      if (ByRange(shape)) {
+        // As for listing: found through the index, a collection's rows
+        // would be visited in index order, one random table page after
+        // another (a read each, once the collection outgrows the page cache).
+        // Deleting between the lowest and highest seq of the matches goes
+        // through the table in order. One statement, so the deletion stays a
+        // single write.
+        const std::string where = Where(shape, false);
+        s = Prepare("DELETE FROM objects WHERE seq BETWEEN (SELECT min(seq) FROM objects WHERE " +
+                    where + ") AND (SELECT max(seq) FROM objects WHERE " + where + ") AND " +
+                    Where(shape, true));
+      } else {
+        s = Prepare(shape == 0 ? "DELETE FROM objects"
+                               : "DELETE FROM objects WHERE " + Where(shape, false));
+      }
+    }
     Resetter reset(s);
     BindId(s, filter->Id(), shape);
     if (sqlite3_step(s) != SQLITE_DONE) Fail("deleting objects");
@@ -389,26 +406,60 @@ class SqliteStore final : public ConfigStore {
              "creating the schema");
   }
 
-  // The statement for one filter shape, prepared on first use and kept.
+  // "key = ?1 AND grp = ?2 ..." for the parts a filter shape constrains;
   // "plus" keeps SQLite from using the identifier index for those terms.
+  static std::string Where(unsigned shape, bool plus) {
+    std::string sql;
+    for (unsigned part = 0; part < 4; ++part) {
+      if ((shape & (1u << part)) == 0) continue;
+      if (!sql.empty()) sql += " AND ";
+      if (plus) sql += '+';
+      sql += kColumns[part];
+      sql += " = ?" + std::to_string(part + 1);
+    }
+    return sql;
+  }
+
+  // The statement for one filter shape, prepared on first use and kept.
   sqlite3_stmt* FilterStatement(std::array<sqlite3_stmt*, kShapes>* cache, unsigned shape,
                                 const char* head, const char* tail, bool plus = false) {
     sqlite3_stmt*& s = (*cache)[shape];
     if (s == nullptr) {
       std::string sql = head;
-      const char* joint = sql.find(" WHERE ") == std::string::npos ? " WHERE " : " AND ";
-      for (unsigned part = 0; part < 4; ++part) {
-        if ((shape & (1u << part)) == 0) continue;
-        sql += joint;
-        if (plus) sql += '+';
-        sql += kColumns[part];
-        sql += " = ?" + std::to_string(part + 1);
-        joint = " AND ";
+      const std::string where = Where(shape, plus);
+      if (!where.empty()) {
+        sql += sql.find(" WHERE ") == std::string::npos ? " WHERE " : " AND ";
+        sql += where;
       }
       sql += tail;
       s = Prepare(sql);
     }
     return s;
+  }
+
+  // Filters on a leading part of the identifier index, short of a whole
+  // identifier, are served by seq ranges.
+  static bool ByRange(unsigned shape) { return (shape & 1u) != 0 && shape != kAllParts; }
+
+  struct Bounds {
+    sqlite3_int64 low = 0;
+    sqlite3_int64 high = 0;
+    sqlite3_int64 count = 0;
+  };
+
+  // The lowest and highest seq of the objects the filter matches, and how
+  // many there are; false when there are none.
+  bool FindBounds(const ConfigStoreObjectId& id, unsigned shape, Bounds* out) {
+    sqlite3_stmt* bounds =
+        FilterStatement(&bounds_, shape, "SELECT min(seq), max(seq), count(*) FROM objects", "");
+    Resetter reset(bounds);
+    BindId(bounds, id, shape);
+    if (sqlite3_step(bounds) != SQLITE_ROW) Fail("finding objects");
+    if (sqlite3_column_type(bounds, 0) == SQLITE_NULL) return false;
+    out->low = sqlite3_column_int64(bounds, 0);
+    out->high = sqlite3_column_int64(bounds, 1);
+    out->count = sqlite3_column_int64(bounds, 2);
+    return true;
   }
 
   // The listing statement for a filter, bound and ready to step; null when
@@ -423,16 +474,13 @@ class SqliteStore final : public ConfigStore {
   // other row lies in it and the rows need no filtering.
   sqlite3_stmt* ListStatement(const ConfigStoreObjectId& id, unsigned shape) {
     static const char kSelect[] = "SELECT key, grp, component, instance, body FROM objects";
-    const bool byRange = (shape & 1u) != 0 && shape != kAllParts;
-    if (!byRange) {
+    if (!ByRange(shape)) {
       sqlite3_stmt* s = FilterStatement(&selects_, shape, kSelect, " ORDER BY seq");
       BindId(s, id, shape);
       return s;
     }
-    // All three statements are prepared together, so the set of prepared
-    // statements does not depend on how the rows happen to lie.
-    sqlite3_stmt* bounds =
-        FilterStatement(&bounds_, shape, "SELECT min(seq), max(seq), count(*) FROM objects", "");
+    // Both range statements are prepared before the bounds choose one, so
+    // the set of prepared statements does not depend on how the rows lie.
     sqlite3_stmt* filtered = FilterStatement(
         &rangeSelects_, shape,
         "SELECT key, grp, component, instance, body FROM objects WHERE seq BETWEEN ?5 AND ?6",
@@ -442,24 +490,14 @@ class SqliteStore final : public ConfigStore {
           "SELECT key, grp, component, instance, body FROM objects WHERE seq BETWEEN ?5 AND ?6 "
           "ORDER BY seq");
     }
-    sqlite3_int64 low;
-    sqlite3_int64 high;
-    sqlite3_int64 count;
-    {
-      Resetter reset(bounds);
-      BindId(bounds, id, shape);
-      if (sqlite3_step(bounds) != SQLITE_ROW) Fail("listing objects");
-      if (sqlite3_column_type(bounds, 0) == SQLITE_NULL) return nullptr;
-      low = sqlite3_column_int64(bounds, 0);
-      high = sqlite3_column_int64(bounds, 1);
-      count = sqlite3_column_int64(bounds, 2);
-    }
-    if (high - low + 1 == count) {
-      BindRange(span_, low, high);
+    Bounds bounds;
+    if (!FindBounds(id, shape, &bounds)) return nullptr;
+    if (bounds.high - bounds.low + 1 == bounds.count) {
+      BindRange(span_, bounds.low, bounds.high);
       return span_;
     }
     BindId(filtered, id, shape);
-    BindRange(filtered, low, high);
+    BindRange(filtered, bounds.low, bounds.high);
     return filtered;
   }
 
