@@ -1,6 +1,8 @@
 #include "hash/DbHash.h"
 
 #include <algorithm>
+#include <cstdint>
+#include <cstring>
 #include <vector>
 
 #include "Velk/Misc.h"
@@ -23,11 +25,78 @@ struct KeyedText {
   }
 };
 
-std::string DigestOfDigests(std::vector<KeyedText>& records) {
-  std::sort(records.begin(), records.end());
+// 8 bytes of a key from "from" on, big-endian and zero-padded: comparing two
+// of these orders keys as their bytes from "from" on do, except that a tie
+// leaves it open (equal bytes, or a shorter key padded with zeros).
+std::uint64_t KeyPrefix(const std::string& key, std::size_t from) {
+  unsigned char bytes[8] = {};
+  if (from < key.size()) {
+    std::memcpy(bytes, key.data() + from, std::min<std::size_t>(key.size() - from, 8));
+  }
+  std::uint64_t v = 0;
+  for (unsigned char b : bytes) v = (v << 8) | b;
+  return v;
+}
+
+// Orders "count" records by key, then (for tied keys) by text, and digests
+// their texts' digests in that order. "keyOf(i)" is record i's key;
+// "textOf(i)" builds its text, once per record.
+//
+// The order is found through a compact index: sorting the records in place
+// compares keys scattered over the heap, a cache miss or two per comparison
+// once there are many. The bytes every key shares decide nothing, so each
+// entry carries the 8 that follow them. A text is kept only while its key is
+// tied with another's; the others are digested as soon as they are built.
+template <typename KeyOf, typename TextOf>
+std::string DigestOfDigests(std::size_t count, KeyOf keyOf, TextOf textOf) {
+  std::size_t common = count == 0 ? 0 : keyOf(0).size();
+  for (std::size_t i = 1; i < count; ++i) {
+    const std::string& first = keyOf(0);
+    const std::string& key = keyOf(i);
+    common = std::min(common, key.size());
+    common = static_cast<std::size_t>(
+        std::mismatch(first.begin(), first.begin() + static_cast<std::ptrdiff_t>(common),
+                      key.begin())
+            .first -
+        first.begin());
+  }
+  struct Entry {
+    std::uint64_t prefix;
+    std::size_t index;
+  };
+  std::vector<Entry> order;
+  order.reserve(count);
+  for (std::size_t i = 0; i < count; ++i) order.push_back({KeyPrefix(keyOf(i), common), i});
+  std::sort(order.begin(), order.end(), [&keyOf](const Entry& a, const Entry& b) {
+    if (a.prefix != b.prefix) return a.prefix < b.prefix;
+    return keyOf(a.index) < keyOf(b.index);
+  });
+
+  std::vector<bool> tied(count, false);
+  for (std::size_t i = 1; i < count; ++i) {
+    if (keyOf(order[i].index) == keyOf(order[i - 1].index)) {
+      tied[order[i].index] = tied[order[i - 1].index] = true;
+    }
+  }
+  std::vector<std::string> digests(count);
+  std::vector<std::string> texts(count);
+  for (std::size_t i = 0; i < count; ++i) {
+    std::string text = textOf(i);
+    digests[i] = Crc32Hex(text);
+    if (tied[i]) texts[i] = std::move(text);
+  }
+  for (std::size_t begin = 0; begin < count;) {
+    std::size_t end = begin + 1;
+    while (end < count && keyOf(order[end].index) == keyOf(order[begin].index)) ++end;
+    std::sort(order.begin() + static_cast<std::ptrdiff_t>(begin),
+              order.begin() + static_cast<std::ptrdiff_t>(end),
+              [&texts](const Entry& a, const Entry& b) { return texts[a.index] < texts[b.index]; });
+    begin = end;
+  }
+
   std::string accumulator;
-  accumulator.reserve(records.size() * 8);
-  for (const KeyedText& record : records) accumulator += Crc32Hex(record.text);
+  accumulator.reserve(count * 8);
+  for (const Entry& e : order) accumulator += digests[e.index];
   return Crc32Hex(accumulator);
 }
 
@@ -36,15 +105,23 @@ std::string PolicyText(KarstPolicyInfo& policy) {
   std::string text =
       Velk::Misc::StrPrintf("%s%s%s%ld", policy.name.c_str(), policy.policy_id.c_str(),
                             policy.description.c_str(), policy.generation_number);
-  std::vector<KeyedText> blobs;
-  blobs.reserve(policy.blobs.size());
-  for (KarstPolicyBlob& blob : policy.blobs) {
-    blobs.push_back({std::move(blob.datastore_namespace), std::move(blob.blob)});
+  // The usual handful of blobs is sorted on the stack.
+  constexpr std::size_t kFew = 8;
+  KeyedText few[kFew];
+  std::vector<KeyedText> many;
+  const std::size_t count = policy.blobs.size();
+  if (count > kFew) many.resize(count);
+  KeyedText* blobs = count > kFew ? many.data() : few;
+  std::size_t size = text.size();
+  for (std::size_t i = 0; i < count; ++i) {
+    blobs[i] = {std::move(policy.blobs[i].datastore_namespace), std::move(policy.blobs[i].blob)};
+    size += blobs[i].key.size() + blobs[i].text.size();
   }
-  std::sort(blobs.begin(), blobs.end());
-  for (const KeyedText& blob : blobs) {
-    text += blob.key;
-    text += blob.text;
+  std::sort(blobs, blobs + count);
+  text.reserve(size);
+  for (std::size_t i = 0; i < count; ++i) {
+    text += blobs[i].key;
+    text += blobs[i].text;
   }
   return text;
 }
@@ -52,26 +129,21 @@ std::string PolicyText(KarstPolicyInfo& policy) {
 
 std::string GetPolicyDbHash() {
   std::vector<KarstPolicyInfo> policies = ListPolicies();
-  std::vector<KeyedText> records;
-  records.reserve(policies.size());
-  for (KarstPolicyInfo& policy : policies) {
-    std::string text = PolicyText(policy);
-    records.push_back({std::move(policy.policy_id), std::move(text)});
-  }
-  return DigestOfDigests(records);
+  return DigestOfDigests(
+      policies.size(), [&](std::size_t i) -> const std::string& { return policies[i].policy_id; },
+      [&](std::size_t i) { return PolicyText(policies[i]); });
 }
 
 std::string GetDatastoreDbHash() {
   std::vector<KarstDatastoreInfo> datastores = ListDatastores();
-  std::vector<KeyedText> records;
-  records.reserve(datastores.size());
-  for (KarstDatastoreInfo& d : datastores) {
-    std::string text = Velk::Misc::StrCat(d.url.data(), d.url.size(), d.datastore_namespace.data(),
-                                          d.datastore_namespace.size(), d.drp_policy_id.data(),
-                                          d.drp_policy_id.size());
-    records.push_back({std::move(d.url), std::move(text)});
-  }
-  return DigestOfDigests(records);
+  return DigestOfDigests(
+      datastores.size(), [&](std::size_t i) -> const std::string& { return datastores[i].url; },
+      [&](std::size_t i) {
+        const KarstDatastoreInfo& d = datastores[i];
+        return Velk::Misc::StrCat(d.url.data(), d.url.size(), d.datastore_namespace.data(),
+                                  d.datastore_namespace.size(), d.drp_policy_id.data(),
+                                  d.drp_policy_id.size());
+      });
 }
 
 std::pair<std::string, std::string> ComputeDbHash() {
