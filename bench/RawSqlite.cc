@@ -19,7 +19,7 @@ namespace {
 // applies before the file gets its first table.
 const char* const kCopiedPragmas[] = {"page_size",    "journal_mode", "synchronous",
                                       "cache_size",   "mmap_size",    "wal_autocheckpoint",
-                                      "locking_mode", "temp_store"};
+                                      "locking_mode", "temp_store",   "cache_spill"};
 
 std::string QueryText(sqlite3* db, const std::string& sql) {
   sqlite3_stmt* s = nullptr;
@@ -121,6 +121,28 @@ RawPolicyDb::RawPolicyDb(const std::string& path, Layout layout, const Connectio
     selectPolicies_ =
         Prepare("SELECT name, policy_id, description, generation, blobs FROM policies ORDER BY id");
     selectByName_ = Prepare("SELECT blobs FROM policies WHERE name = ?1");
+  } else if (layout_ == Layout::kStoreSchema) {
+    Exec(
+        "CREATE TABLE IF NOT EXISTS objects(seq INTEGER PRIMARY KEY, key BLOB NOT NULL, "
+        "grp BLOB NOT NULL, component BLOB NOT NULL, instance BLOB NOT NULL, body BLOB NOT NULL)");
+    Exec("CREATE UNIQUE INDEX IF NOT EXISTS objects_id ON objects(key, grp, component, instance)");
+    // The collection is found through the index, then read or deleted in
+    // seq order, as the store does.
+    static const char kCollection[] = " +key = ?1 AND +grp = ?2 AND +component = ?3";
+    bounds_ = Prepare(
+        "SELECT min(seq), max(seq) FROM objects WHERE key = ?1 AND grp = ?2 AND component = ?3");
+    clearPolicies_ = Prepare(
+        (std::string("DELETE FROM objects WHERE seq BETWEEN ?4 AND ?5 AND") + kCollection).c_str());
+    insertPolicy_ = Prepare(
+        "INSERT OR REPLACE INTO objects(key, grp, component, instance, body) "
+        "VALUES(?1, ?2, ?3, ?4, ?5)");
+    selectPolicies_ =
+        Prepare((std::string("SELECT body FROM objects WHERE seq BETWEEN ?4 AND ?5 AND") +
+                 kCollection + " ORDER BY seq")
+                    .c_str());
+    selectByName_ = Prepare(
+        "SELECT body FROM objects WHERE key = ?1 AND grp = ?2 AND component = ?3 AND instance = "
+        "?4");
   } else {
     Exec(
         "CREATE TABLE IF NOT EXISTS policies(id INTEGER PRIMARY KEY, name BLOB NOT NULL UNIQUE, "
@@ -141,7 +163,76 @@ RawPolicyDb::RawPolicyDb(const std::string& path, Layout layout, const Connectio
   }
   begin_ = Prepare("BEGIN IMMEDIATE");
   commit_ = Prepare("COMMIT");
-  clearPolicies_ = Prepare("DELETE FROM policies");
+  if (clearPolicies_ == nullptr) clearPolicies_ = Prepare("DELETE FROM policies");
+}
+
+namespace {
+const std::string kKey = "karst_policies";
+const std::string kGroup = "storage";
+const std::string kComponent = "tavo";
+
+void BindCollection(sqlite3_stmt* s) {
+  BindBytes(s, 1, kKey);
+  BindBytes(s, 2, kGroup);
+  BindBytes(s, 3, kComponent);
+}
+
+// kStoreSchema body: the three strings, the generation number, then the
+// blobs as in the one-row layout.
+void Unpack(const void* data, int size, KarstPolicyInfo* p) {
+  const auto* at = static_cast<const char*>(data);
+  const char* end = at + size;
+  std::string* fields[] = {&p->name, &p->policy_id, &p->description};
+  for (std::string* f : fields) {
+    std::uint32_t n;
+    std::memcpy(&n, at, 4);
+    f->assign(at + 4, n);
+    at += 4 + n;
+  }
+  std::memcpy(&p->generation_number, at, 8);
+  at += 8;
+  Unpacker blobs(at, static_cast<int>(end - at));
+  const char* ns;
+  const char* blob;
+  std::uint32_t nsSize;
+  std::uint32_t blobSize;
+  p->blobs.reserve(4);
+  while (blobs.Next(&ns, &nsSize, &blob, &blobSize)) {
+    p->blobs.push_back({std::string(blob, blobSize), std::string(ns, nsSize)});
+  }
+}
+}  // namespace
+
+bool RawPolicyDb::Bounds(sqlite3_int64* low, sqlite3_int64* high) {
+  BindCollection(bounds_);
+  bool found = false;
+  if (sqlite3_step(bounds_) == SQLITE_ROW && sqlite3_column_type(bounds_, 0) != SQLITE_NULL) {
+    *low = sqlite3_column_int64(bounds_, 0);
+    *high = sqlite3_column_int64(bounds_, 1);
+    found = true;
+  }
+  sqlite3_reset(bounds_);
+  return found;
+}
+
+void RawPolicyDb::Pack(const KarstPolicyInfo& p) {
+  packed_.clear();
+  if (layout_ == Layout::kStoreSchema) {
+    for (const std::string* f : {&p.name, &p.policy_id, &p.description}) {
+      PutU32(static_cast<std::uint32_t>(f->size()), &packed_);
+      packed_ += *f;
+    }
+    char g[8];
+    std::memcpy(g, &p.generation_number, 8);
+    packed_.append(g, 8);
+  }
+  for (const KarstPolicyBlob& b : p.blobs) {
+    if (b.datastore_namespace.empty()) continue;
+    PutU32(static_cast<std::uint32_t>(b.datastore_namespace.size()), &packed_);
+    packed_ += b.datastore_namespace;
+    PutU32(static_cast<std::uint32_t>(b.blob.size()), &packed_);
+    packed_ += b.blob;
+  }
 }
 
 RawPolicyDb::~RawPolicyDb() {
@@ -173,6 +264,25 @@ void RawPolicyDb::Run(sqlite3_stmt* s) {
 
 void RawPolicyDb::Replace(const std::vector<KarstPolicyInfo>& policies) {
   Run(begin_);
+  if (layout_ == Layout::kStoreSchema) {
+    sqlite3_int64 low;
+    sqlite3_int64 high;
+    if (Bounds(&low, &high)) {
+      BindCollection(clearPolicies_);
+      sqlite3_bind_int64(clearPolicies_, 4, low);
+      sqlite3_bind_int64(clearPolicies_, 5, high);
+      Run(clearPolicies_);
+    }
+    for (const KarstPolicyInfo& p : policies) {
+      BindCollection(insertPolicy_);
+      BindBytes(insertPolicy_, 4, p.name);
+      Pack(p);
+      BindBytes(insertPolicy_, 5, packed_);
+      Run(insertPolicy_);
+    }
+    Run(commit_);
+    return;
+  }
   Run(clearPolicies_);
   if (layout_ == Layout::kTwoTables) Run(clearBlobs_);
   for (const KarstPolicyInfo& p : policies) {
@@ -181,14 +291,7 @@ void RawPolicyDb::Replace(const std::vector<KarstPolicyInfo>& policies) {
     BindBytes(insertPolicy_, 3, p.description);
     sqlite3_bind_int64(insertPolicy_, 4, p.generation_number);
     if (layout_ == Layout::kOneRow) {
-      packed_.clear();
-      for (const KarstPolicyBlob& b : p.blobs) {
-        if (b.datastore_namespace.empty()) continue;
-        PutU32(static_cast<std::uint32_t>(b.datastore_namespace.size()), &packed_);
-        packed_ += b.datastore_namespace;
-        PutU32(static_cast<std::uint32_t>(b.blob.size()), &packed_);
-        packed_ += b.blob;
-      }
+      Pack(p);
       BindBytes(insertPolicy_, 5, packed_);
       Run(insertPolicy_);
     } else {
@@ -210,6 +313,25 @@ void RawPolicyDb::Replace(const std::vector<KarstPolicyInfo>& policies) {
 
 std::vector<KarstPolicyInfo> RawPolicyDb::List() {
   std::vector<KarstPolicyInfo> out;
+  if (layout_ == Layout::kStoreSchema) {
+    Exec("BEGIN");
+    sqlite3_int64 low;
+    sqlite3_int64 high;
+    if (Bounds(&low, &high)) {
+      BindCollection(selectPolicies_);
+      sqlite3_bind_int64(selectPolicies_, 4, low);
+      sqlite3_bind_int64(selectPolicies_, 5, high);
+      int rc;
+      while ((rc = sqlite3_step(selectPolicies_)) == SQLITE_ROW) {
+        Unpack(sqlite3_column_blob(selectPolicies_, 0), sqlite3_column_bytes(selectPolicies_, 0),
+               &out.emplace_back());
+      }
+      if (rc != SQLITE_DONE) Fail("listing");
+      sqlite3_reset(selectPolicies_);
+    }
+    Exec("COMMIT");
+    return out;
+  }
   if (layout_ == Layout::kOneRow) {
     sqlite3_stmt* s = selectPolicies_;
     int rc;
@@ -265,8 +387,24 @@ std::vector<KarstPolicyInfo> RawPolicyDb::List() {
 
 std::string RawPolicyDb::BlobByName(const std::string& name, const std::string& ns) {
   sqlite3_stmt* s = selectByName_;
-  BindBytes(s, 1, name);
   std::string out;
+  if (layout_ == Layout::kStoreSchema) {
+    BindCollection(s);
+    BindBytes(s, 4, name);
+    if (sqlite3_step(s) == SQLITE_ROW) {
+      KarstPolicyInfo p;
+      Unpack(sqlite3_column_blob(s, 0), sqlite3_column_bytes(s, 0), &p);
+      for (const KarstPolicyBlob& b : p.blobs) {
+        if (b.datastore_namespace == ns) {
+          out = b.blob;
+          break;
+        }
+      }
+    }
+    sqlite3_reset(s);
+    return out;
+  }
+  BindBytes(s, 1, name);
   if (layout_ == Layout::kOneRow) {
     if (sqlite3_step(s) == SQLITE_ROW) {
       Unpacker blobs(sqlite3_column_blob(s, 0), sqlite3_column_bytes(s, 0));

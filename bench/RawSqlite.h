@@ -34,6 +34,11 @@ class RawPolicyDb {
     // policies(id, name UNIQUE, policy_id, description, generation) and
     // blobs(policy, seq, ns, blob) clustered on (policy, seq).
     kTwoTables,
+    // Not a contender: the configuration store's own table (every collection
+    // in one table, a four-part identifier index, a body per object) used
+    // the least wasteful way, with a packed body. It shows what that layout
+    // itself costs against the two above.
+    kStoreSchema,
   };
 
   RawPolicyDb(const std::string& path, Layout layout, const ConnectionSettings& settings);
@@ -53,6 +58,9 @@ class RawPolicyDb {
   void Exec(const char* sql);
   void Run(sqlite3_stmt* s);
   [[noreturn]] void Fail(const char* what);
+  // kStoreSchema: the lowest and highest seq of the collection; false when empty.
+  bool Bounds(sqlite3_int64* low, sqlite3_int64* high);
+  void Pack(const TavoKarst::KarstPolicyInfo& p);
 
   Layout layout_;
   sqlite3* db_ = nullptr;
@@ -65,6 +73,7 @@ class RawPolicyDb {
   sqlite3_stmt* selectPolicies_ = nullptr;
   sqlite3_stmt* selectBlobs_ = nullptr;
   sqlite3_stmt* selectByName_ = nullptr;
+  sqlite3_stmt* bounds_ = nullptr;
   std::string packed_;  // reused packing buffer
 };
 
