@@ -231,13 +231,17 @@ class SqliteStore final : public ConfigStore {
       sqlite3_stmt* s = ListStatement(filter->Id(), shape);
       if (s != nullptr) {
         Resetter reset(s);
-        std::string parts[4];
+        // The parts the filter fixes are the filter's; the others pass
+        // through scratch strings that keep their capacity, so each part is
+        // allocated once, by the identifier.
+        const ConfigStoreObjectId& fixed = filter->Id();
+        std::string parts[4] = {fixed.Key(), fixed.Group(), fixed.Component(), fixed.InstanceId()};
         codec::BodyArena arena;
         int rc;
         while ((rc = sqlite3_step(s)) == SQLITE_ROW) {
-          // The columns pass through scratch strings that keep their
-          // capacity, so each part is allocated once, by the identifier.
-          for (int c = 0; c < 4; ++c) AssignColumn(s, c, &parts[c]);
+          for (int c = 0; c < 4; ++c) {
+            if ((shape & (1u << c)) == 0) AssignColumn(s, c, &parts[c]);
+          }
           out.push_back(
               Decode(ConfigStoreObjectId(parts[0], parts[1], parts[2], parts[3]), s, 4, &arena));
         }
