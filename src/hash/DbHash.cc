@@ -29,12 +29,10 @@ struct KeyedText {
 // of these orders keys as their bytes from "from" on do, except that a tie
 // leaves it open (equal bytes, or a shorter key padded with zeros).
 std::uint64_t KeyPrefix(const std::string& key, std::size_t from) {
-  unsigned char bytes[8] = {};
-  if (from < key.size()) {
-    std::memcpy(bytes, key.data() + from, std::min<std::size_t>(key.size() - from, 8));
-  }
   std::uint64_t v = 0;
-  for (unsigned char b : bytes) v = (v << 8) | b;
+  for (std::size_t i = from; i < from + 8; ++i) {
+    v = (v << 8) | (i < key.size() ? static_cast<unsigned char>(key[i]) : 0u);
+  }
   return v;
 }
 
