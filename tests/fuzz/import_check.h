@@ -12,11 +12,6 @@ namespace karst_fuzz {
 enum class ImportResult {
   kAccepted,  // imported, and round-tripped through export
   kRefused,   // refused with InputError: exit status 2 and a position
-  // Refused with nlohmann's out_of_range (a number literal beyond double,
-  // "1e999"), which the parser lets through: karstctl reports it as a plain
-  // failure (status 1, no position). Known and tolerated, so the fuzzer can
-  // look for anything else.
-  kRefusedOutOfRange,
 };
 
 // Imports "data" the way `karstctl import` reads its input. Input that is

@@ -197,6 +197,9 @@ TEST(JsonText, MalformedTextIsReportedByLineAndColumn) {
   EXPECT_THAT(error("[1] [2]"), HasSubstr("cat.json:1:5: "));
   // nlohmann's own position is replaced, not repeated.
   EXPECT_THAT(error("[1,]"), ::testing::Not(HasSubstr("line 1")));
+  // A number beyond a double is an input error, placed at its last digit.
+  EXPECT_EQ(error("{\"policies\": [\n  {\"generation_number\": 1e999}]}"),
+            "cat.json:2:29: number overflow parsing '1e999'");
 
   // A key given twice would silently lose one value.
   EXPECT_EQ(error(R"({"policies": [{"name": "a", "blobs": [], "name": "b"}]})"),

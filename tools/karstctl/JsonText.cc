@@ -20,6 +20,36 @@ std::string ParseErrorReason(const std::string& what) {
   return what.substr(colon + 2);
 }
 
+// A number too large for a double ("1e999") is reported by nlohmann as
+// out_of_range, which carries no position. Parsing again with a handler that
+// only notes where the parser stopped finds it.
+struct ErrorLocator : nlohmann::json_sax<Json> {
+  std::size_t offset = 0;
+  bool null() override { return true; }
+  bool boolean(bool) override { return true; }
+  bool number_integer(number_integer_t) override { return true; }
+  bool number_unsigned(number_unsigned_t) override { return true; }
+  bool number_float(number_float_t, const string_t&) override { return true; }
+  bool string(string_t&) override { return true; }
+  bool binary(binary_t&) override { return true; }
+  bool start_object(std::size_t) override { return true; }
+  bool key(string_t&) override { return true; }
+  bool end_object() override { return true; }
+  bool start_array(std::size_t) override { return true; }
+  bool end_array() override { return true; }
+  bool parse_error(std::size_t position, const std::string&,
+                   const nlohmann::detail::exception&) override {
+    offset = position;
+    return false;
+  }
+};
+
+// "[json.exception.out_of_range.406] number overflow ..." without its tag.
+std::string WithoutTag(const std::string& what) {
+  std::string::size_type end = what.rfind("] ", what.find(' '));
+  return end == std::string::npos ? what : what.substr(end + 2);
+}
+
 }  // namespace
 
 TextPosition PositionOf(const std::string& text, std::size_t offset) {
@@ -66,6 +96,12 @@ Json ParseJsonText(const std::string& text, const std::string& source) {
     TextPosition at = PositionOf(text, e.byte == 0 ? 0 : e.byte - 1);
     throw InputError(source + ":" + std::to_string(at.line) + ":" + std::to_string(at.column) +
                      ": " + ParseErrorReason(e.what()));
+  } catch (const Json::out_of_range& e) {
+    ErrorLocator locator;
+    Json::sax_parse(text, &locator);
+    TextPosition at = PositionOf(text, locator.offset == 0 ? 0 : locator.offset - 1);
+    throw InputError(source + ":" + std::to_string(at.line) + ":" + std::to_string(at.column) +
+                     ": " + WithoutTag(e.what()));
   }
 }
 
