@@ -16,14 +16,6 @@ namespace TavoKarst {
 // common prefix. Records tied on their key are ordered by their whole text,
 // so the digest does not depend on the store's order even then.
 namespace {
-struct KeyedText {
-  std::string key;
-  std::string text;
-  bool operator<(const KeyedText& other) const {
-    const int byKey = key.compare(other.key);
-    return byKey != 0 ? byKey < 0 : text < other.text;
-  }
-};
 
 // 8 bytes of a key from "from" on, big-endian and zero-padded: comparing two
 // of these orders keys as their bytes from "from" on do, except that a tie
@@ -79,9 +71,9 @@ std::string DigestOfDigests(std::size_t count, KeyOf keyOf, TextOf textOf) {
   std::vector<std::string> digests(count);
   std::vector<std::string> texts(count);
   for (std::size_t i = 0; i < count; ++i) {
-    std::string text = textOf(i);
+    const std::string& text = textOf(i);
     digests[i] = Crc32Hex(text);
-    if (tied[i]) texts[i] = std::move(text);
+    if (tied[i]) texts[i] = text;
   }
   for (std::size_t begin = 0; begin < count;) {
     std::size_t end = begin + 1;
@@ -98,38 +90,42 @@ std::string DigestOfDigests(std::size_t count, KeyOf keyOf, TextOf textOf) {
   return Crc32Hex(accumulator);
 }
 
-std::string PolicyText(KarstPolicyInfo& policy) {
+// Builds a policy's text into "*text", whose capacity is reused from one
+// policy to the next.
+void PolicyText(const KarstPolicyInfo& policy, std::string* text) {
   // "%s" stops at a NUL: name, policy_id and description count only up to it.
-  std::string text =
-      Velk::Misc::StrPrintf("%s%s%s%ld", policy.name.c_str(), policy.policy_id.c_str(),
-                            policy.description.c_str(), policy.generation_number);
-  // The usual handful of blobs is sorted on the stack.
+  text->assign(Velk::Misc::StrPrintf("%s%s%s%ld", policy.name.c_str(), policy.policy_id.c_str(),
+                                     policy.description.c_str(), policy.generation_number));
+  // Blob entries in ascending order of namespace; tied namespaces by blob. The
+  // usual handful of indices is sorted on the stack.
   constexpr std::size_t kFew = 8;
-  KeyedText few[kFew];
-  std::vector<KeyedText> many;
+  std::uint32_t few[kFew];
+  std::vector<std::uint32_t> many;
   const std::size_t count = policy.blobs.size();
   if (count > kFew) many.resize(count);
-  KeyedText* blobs = count > kFew ? many.data() : few;
-  std::size_t size = text.size();
+  std::uint32_t* order = count > kFew ? many.data() : few;
+  for (std::size_t i = 0; i < count; ++i) order[i] = static_cast<std::uint32_t>(i);
+  const std::vector<KarstPolicyBlob>& blobs = policy.blobs;
+  std::sort(order, order + count, [&blobs](std::uint32_t a, std::uint32_t b) {
+    const int byKey = blobs[a].datastore_namespace.compare(blobs[b].datastore_namespace);
+    return byKey != 0 ? byKey < 0 : blobs[a].blob < blobs[b].blob;
+  });
   for (std::size_t i = 0; i < count; ++i) {
-    blobs[i] = {std::move(policy.blobs[i].datastore_namespace), std::move(policy.blobs[i].blob)};
-    size += blobs[i].key.size() + blobs[i].text.size();
+    *text += blobs[order[i]].datastore_namespace;
+    *text += blobs[order[i]].blob;
   }
-  std::sort(blobs, blobs + count);
-  text.reserve(size);
-  for (std::size_t i = 0; i < count; ++i) {
-    text += blobs[i].key;
-    text += blobs[i].text;
-  }
-  return text;
 }
 }  // namespace
 
 std::string GetPolicyDbHash() {
-  std::vector<KarstPolicyInfo> policies = ListPolicies();
+  const std::vector<KarstPolicyInfo> policies = ListPolicies();
+  std::string text;
   return DigestOfDigests(
       policies.size(), [&](std::size_t i) -> const std::string& { return policies[i].policy_id; },
-      [&](std::size_t i) { return PolicyText(policies[i]); });
+      [&](std::size_t i) -> const std::string& {
+        PolicyText(policies[i], &text);
+        return text;
+      });
 }
 
 std::string GetDatastoreDbHash() {

@@ -2,6 +2,7 @@
 
 #include <climits>
 #include <cstdint>
+#include <cstdio>
 #include <string>
 
 #include "Velk/Misc.h"
@@ -19,6 +20,24 @@ TEST(VelkCoreTest, StrPrintfFormatsAtAnyLength) {
   // "%s" stops at the first NUL, as printf does.
   const std::string withNul("ab\0cd", 5);
   EXPECT_EQ(Velk::Misc::StrPrintf("%s|", withNul.c_str()), "ab|");
+}
+
+// Plain "%s"/"%d"/"%ld"/"%lld"/"%%" formats are written without vsnprintf;
+// both paths must give printf's bytes.
+TEST(VelkCoreTest, StrPrintfMatchesPrintf) {
+  const long long longs[] = {0, 1, -1, 9, 10, -10, 1234567890123LL, LLONG_MAX, LLONG_MIN};
+  for (long long v : longs) {
+    char expected[64];
+    std::snprintf(expected, sizeof expected, "a%%b%lldc%ld", v, static_cast<long>(v));
+    EXPECT_EQ(Velk::Misc::StrPrintf("a%%b%lldc%ld", v, static_cast<long>(v)), expected) << v;
+  }
+  const int ints[] = {0, -7, INT_MAX, INT_MIN};
+  for (int v : ints) EXPECT_EQ(Velk::Misc::StrPrintf("%d", v), std::to_string(v));
+  EXPECT_EQ(Velk::Misc::StrPrintf("%s%s", "", ""), "");
+  EXPECT_EQ(Velk::Misc::StrPrintf("no conversions"), "no conversions");
+  EXPECT_EQ(Velk::Misc::StrPrintf("100%%"), "100%");
+  // Anything else goes through vsnprintf.
+  EXPECT_EQ(Velk::Misc::StrPrintf("[%5s|%-3d|%x|%s]", "ab", 7, 255U, "z"), "[   ab|7  |ff|z]");
 }
 
 TEST(VelkCoreTest, StrCatKeepsEveryByte) {

@@ -1,22 +1,129 @@
 #include "Velk/Misc.h"
 
 #include <cstdarg>
+#include <cstdint>
 #include <cstdio>
+#include <cstring>
 
 #include "Velk/VelkException.h"
 
 namespace Velk {
 namespace Misc {
 
-std::string StrPrintf(const char* format, ...) {
-  // Most digest texts are short: try a stack buffer first, then size exactly.
+namespace {
+// Formats made only of text, "%s", "%d", "%ld", "%lld" and "%%" (the digest
+// texts are) are written directly: vsnprintf's general machinery costs more
+// than the formatting itself on short texts. Anything else goes to
+// vsnprintf.
+enum class Piece { kText, kString, kInt, kLong, kPercent, kOther };
+
+// The conversion starting at format[0] == '%', and its length.
+Piece ConversionAt(const char* format, std::size_t* length) {
+  if (format[1] == 's') return *length = 2, Piece::kString;
+  if (format[1] == 'd') return *length = 2, Piece::kInt;
+  if (format[1] == '%') return *length = 2, Piece::kPercent;
+  if (format[1] == 'l' && format[2] == 'd') return *length = 3, Piece::kLong;
+  if (format[1] == 'l' && format[2] == 'l' && format[3] == 'd') return *length = 4, Piece::kLong;
+  return *length = 0, Piece::kOther;
+}
+
+bool IsSimple(const char* format) {
+  for (const char* p = std::strchr(format, '%'); p != nullptr; p = std::strchr(p, '%')) {
+    std::size_t length;
+    if (ConversionAt(p, &length) == Piece::kOther) return false;
+    p += length;
+  }
+  return true;
+}
+
+// Decimal digits of "value" written backwards ending at "end"; returns the
+// first character. Works on the magnitude as unsigned, so the most negative
+// value needs no special case.
+char* Decimal(long long value, char* end) {
+  std::uint64_t magnitude =
+      value < 0 ? 0 - static_cast<std::uint64_t>(value) : static_cast<std::uint64_t>(value);
+  do {
+    *--end = static_cast<char>('0' + magnitude % 10);
+    magnitude /= 10;
+  } while (magnitude != 0);
+  if (value < 0) *--end = '-';
+  return end;
+}
+
+std::string FormatSimple(const char* format, va_list args) {
+  // Pass one measures, pass two writes: the result is allocated once.
+  va_list again;
+  va_copy(again, args);
+  char digits[24];
+  std::size_t size = 0;
+  for (const char* p = format; *p != '\0';) {
+    if (*p != '%') {
+      const char* next = std::strchr(p, '%');
+      const std::size_t n = next == nullptr ? std::strlen(p) : static_cast<std::size_t>(next - p);
+      size += n;
+      p += n;
+      continue;
+    }
+    std::size_t length;
+    switch (ConversionAt(p, &length)) {
+      case Piece::kString:
+        size += std::strlen(va_arg(args, const char*));
+        break;
+      case Piece::kInt:
+        size += static_cast<std::size_t>(digits + sizeof digits -
+                                         Decimal(va_arg(args, int), digits + sizeof digits));
+        break;
+      case Piece::kLong:
+        size += static_cast<std::size_t>(digits + sizeof digits -
+                                         Decimal(va_arg(args, long long), digits + sizeof digits));
+        break;
+      default:
+        size += 1;
+        break;
+    }
+    p += length;
+  }
+
+  std::string out;
+  out.reserve(size);
+  for (const char* p = format; *p != '\0';) {
+    if (*p != '%') {
+      const char* next = std::strchr(p, '%');
+      const std::size_t n = next == nullptr ? std::strlen(p) : static_cast<std::size_t>(next - p);
+      out.append(p, n);
+      p += n;
+      continue;
+    }
+    std::size_t length;
+    const char* first;
+    switch (ConversionAt(p, &length)) {
+      case Piece::kString:
+        out.append(va_arg(again, const char*));
+        break;
+      case Piece::kInt:
+        first = Decimal(va_arg(again, int), digits + sizeof digits);
+        out.append(first, static_cast<std::size_t>(digits + sizeof digits - first));
+        break;
+      case Piece::kLong:
+        first = Decimal(va_arg(again, long long), digits + sizeof digits);
+        out.append(first, static_cast<std::size_t>(digits + sizeof digits - first));
+        break;
+      default:
+        out.push_back('%');
+        break;
+    }
+    p += length;
+  }
+  va_end(again);
+  return out;
+}
+
+std::string FormatGeneral(const char* format, va_list args) {
+  // Most texts are short: try a stack buffer first, then size exactly.
   char small[256];
-  va_list args;
-  va_start(args, format);
   va_list again;
   va_copy(again, args);
   const int needed = std::vsnprintf(small, sizeof small, format, args);
-  va_end(args);
   if (needed < 0) {
     va_end(again);
     throw Lib::VelkException(std::string("StrPrintf: cannot format \"") + format + "\"");
@@ -30,6 +137,20 @@ std::string StrPrintf(const char* format, ...) {
   }
   va_end(again);
   return out;
+}
+}  // namespace
+
+std::string StrPrintf(const char* format, ...) {
+  va_list args;
+  va_start(args, format);
+  try {
+    std::string out = IsSimple(format) ? FormatSimple(format, args) : FormatGeneral(format, args);
+    va_end(args);
+    return out;
+  } catch (...) {
+    va_end(args);
+    throw;
+  }
 }
 
 std::string StrCat(const char* a, std::size_t aLen, const char* b, std::size_t bLen, const char* c,
