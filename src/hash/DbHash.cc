@@ -63,21 +63,34 @@ std::string DigestOfDigests(std::size_t count, KeyOf keyOf, TextOf textOf) {
   });
 
   std::vector<bool> tied(count, false);
+  // Keys whose prefixes differ differ; only equal prefixes need the keys,
+  // which lie all over the heap.
   for (std::size_t i = 1; i < count; ++i) {
-    if (keyOf(order[i].index) == keyOf(order[i - 1].index)) {
+    if (order[i].prefix == order[i - 1].prefix &&
+        keyOf(order[i].index) == keyOf(order[i - 1].index)) {
       tied[order[i].index] = tied[order[i - 1].index] = true;
     }
   }
   std::vector<std::string> digests(count);
-  std::vector<std::string> texts(count);
+  std::vector<std::string> texts;  // sized only when some keys tie
   for (std::size_t i = 0; i < count; ++i) {
     const std::string& text = textOf(i);
     digests[i] = Crc32Hex(text);
-    if (tied[i]) texts[i] = text;
+    if (tied[i]) {
+      if (texts.empty()) texts.resize(count);
+      texts[i] = text;
+    }
   }
   for (std::size_t begin = 0; begin < count;) {
     std::size_t end = begin + 1;
-    while (end < count && keyOf(order[end].index) == keyOf(order[begin].index)) ++end;
+    if (!tied[order[begin].index]) {
+      begin = end;
+      continue;
+    }
+    while (end < count && order[end].prefix == order[begin].prefix &&
+           keyOf(order[end].index) == keyOf(order[begin].index)) {
+      ++end;
+    }
     std::sort(order.begin() + static_cast<std::ptrdiff_t>(begin),
               order.begin() + static_cast<std::ptrdiff_t>(end),
               [&texts](const Entry& a, const Entry& b) { return texts[a.index] < texts[b.index]; });
@@ -115,6 +128,24 @@ void PolicyText(const KarstPolicyInfo& policy, std::string* text) {
     *text += blobs[order[i]].blob;
   }
 }
+// A large catalogue is far bigger than the caches, and each policy's strings
+// sit behind two or three pointers: fetched one after another, every one
+// costs a trip to memory. Asking for the next policies' memory ahead lets
+// those trips overlap.
+void PrefetchBlobList(const KarstPolicyInfo& policy) {
+  __builtin_prefetch(policy.blobs.data());
+  __builtin_prefetch(policy.name.data());
+  __builtin_prefetch(policy.policy_id.data());
+  __builtin_prefetch(policy.description.data());
+}
+
+void PrefetchBlobs(const KarstPolicyInfo& policy) {
+  for (const KarstPolicyBlob& blob : policy.blobs) {
+    __builtin_prefetch(blob.datastore_namespace.data());
+    const char* bytes = blob.blob.data();
+    for (std::size_t at = 0; at < blob.blob.size(); at += 64) __builtin_prefetch(bytes + at);
+  }
+}
 }  // namespace
 
 std::string GetPolicyDbHash() {
@@ -123,6 +154,8 @@ std::string GetPolicyDbHash() {
   return DigestOfDigests(
       policies.size(), [&](std::size_t i) -> const std::string& { return policies[i].policy_id; },
       [&](std::size_t i) -> const std::string& {
+        if (i + 2 < policies.size()) PrefetchBlobList(policies[i + 2]);
+        if (i + 1 < policies.size()) PrefetchBlobs(policies[i + 1]);
         PolicyText(policies[i], &text);
         return text;
       });
