@@ -92,7 +92,12 @@ TEST_F(DbHashTest, WorkedExample) {
 TEST_F(DbHashTest, IndependentOfListingOrder) {
   std::vector<TavoKarst::KarstPolicyInfo> policies = {
       kGold, kSilver, Policy("bronze", "\xff-high", {{"z", "\x01"}, {"y", "\xff"}, {"x", "a"}}),
-      Policy("twin-a", "p-dup", {{"1", "n"}}), Policy("twin-b", "p-dup", {{"2", "n"}})};
+      Policy("twin-a", "p-dup", {{"1", "n"}}), Policy("twin-b", "p-dup", {{"2", "n"}}),
+      // Keys that agree well past their first differing byte from the
+      // others, tied and untied.
+      Policy("long-a", "p-0123456789abcdef-x", {{"3", "n"}}),
+      Policy("long-b", "p-0123456789abcdef-x", {{"4", "n"}}),
+      Policy("long-c", "p-0123456789abcdef-y", {{"5", "n"}})};
   std::vector<TavoKarst::KarstDatastoreInfo> datastores = {
       Datastore("b", "1", "2"), Datastore("a", "3", "4"), Datastore("\xff", "", ""),
       Datastore("", "only-namespace", "")};
