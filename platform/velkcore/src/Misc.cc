@@ -15,7 +15,7 @@ namespace {
 // texts are) are written directly: vsnprintf's general machinery costs more
 // than the formatting itself on short texts. Anything else goes to
 // vsnprintf.
-enum class Piece { kText, kString, kInt, kLong, kPercent, kOther };
+enum class Piece { kString, kInt, kLong, kLongLong, kPercent, kOther };
 
 // The conversion starting at format[0] == '%', and its length.
 Piece ConversionAt(const char* format, std::size_t* length) {
@@ -23,7 +23,9 @@ Piece ConversionAt(const char* format, std::size_t* length) {
   if (format[1] == 'd') return *length = 2, Piece::kInt;
   if (format[1] == '%') return *length = 2, Piece::kPercent;
   if (format[1] == 'l' && format[2] == 'd') return *length = 3, Piece::kLong;
-  if (format[1] == 'l' && format[2] == 'l' && format[3] == 'd') return *length = 4, Piece::kLong;
+  if (format[1] == 'l' && format[2] == 'l' && format[3] == 'd') {
+    return *length = 4, Piece::kLongLong;
+  }
   return *length = 0, Piece::kOther;
 }
 
@@ -50,11 +52,24 @@ char* Decimal(long long value, char* end) {
   return end;
 }
 
+// The next argument of an integer conversion, read as the type it was passed
+// as.
+long long IntegerArg(Piece piece, va_list* ap) {
+  if (piece == Piece::kInt) return va_arg(*ap, int);
+  if (piece == Piece::kLong) return va_arg(*ap, long);
+  return va_arg(*ap, long long);
+}
+
+bool IsInteger(Piece piece) {
+  return piece == Piece::kInt || piece == Piece::kLong || piece == Piece::kLongLong;
+}
+
 std::string FormatSimple(const char* format, va_list args) {
   // Pass one measures, pass two writes: the result is allocated once.
-  va_list again;
-  va_copy(again, args);
+  va_list measure;
+  va_copy(measure, args);
   char digits[24];
+  char* const end = digits + sizeof digits;
   std::size_t size = 0;
   for (const char* p = format; *p != '\0';) {
     if (*p != '%') {
@@ -65,25 +80,20 @@ std::string FormatSimple(const char* format, va_list args) {
       continue;
     }
     std::size_t length;
-    switch (ConversionAt(p, &length)) {
-      case Piece::kString:
-        size += std::strlen(va_arg(args, const char*));
-        break;
-      case Piece::kInt:
-        size += static_cast<std::size_t>(digits + sizeof digits -
-                                         Decimal(va_arg(args, int), digits + sizeof digits));
-        break;
-      case Piece::kLong:
-        size += static_cast<std::size_t>(digits + sizeof digits -
-                                         Decimal(va_arg(args, long long), digits + sizeof digits));
-        break;
-      default:
-        size += 1;
-        break;
+    const Piece piece = ConversionAt(p, &length);
+    if (piece == Piece::kString) {
+      size += std::strlen(va_arg(measure, const char*));
+    } else if (IsInteger(piece)) {
+      size += static_cast<std::size_t>(end - Decimal(IntegerArg(piece, &measure), end));
+    } else {
+      size += 1;  // "%%"
     }
     p += length;
   }
+  va_end(measure);
 
+  va_list write;
+  va_copy(write, args);
   std::string out;
   out.reserve(size);
   for (const char* p = format; *p != '\0';) {
@@ -95,26 +105,18 @@ std::string FormatSimple(const char* format, va_list args) {
       continue;
     }
     std::size_t length;
-    const char* first;
-    switch (ConversionAt(p, &length)) {
-      case Piece::kString:
-        out.append(va_arg(again, const char*));
-        break;
-      case Piece::kInt:
-        first = Decimal(va_arg(again, int), digits + sizeof digits);
-        out.append(first, static_cast<std::size_t>(digits + sizeof digits - first));
-        break;
-      case Piece::kLong:
-        first = Decimal(va_arg(again, long long), digits + sizeof digits);
-        out.append(first, static_cast<std::size_t>(digits + sizeof digits - first));
-        break;
-      default:
-        out.push_back('%');
-        break;
+    const Piece piece = ConversionAt(p, &length);
+    if (piece == Piece::kString) {
+      out.append(va_arg(write, const char*));
+    } else if (IsInteger(piece)) {
+      const char* first = Decimal(IntegerArg(piece, &write), end);
+      out.append(first, static_cast<std::size_t>(end - first));
+    } else {
+      out.push_back('%');
     }
     p += length;
   }
-  va_end(again);
+  va_end(write);
   return out;
 }
 
