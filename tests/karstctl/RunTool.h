@@ -6,6 +6,8 @@
 #include <utility>
 #include <vector>
 
+#include "FileBytes.h"
+
 namespace karstctl_test {
 
 struct ToolResult {
@@ -30,8 +32,8 @@ ToolResult RunTool(const std::string& scratch, const std::vector<std::string>& a
 std::string MakeScratchDir();
 void RemoveTree(const std::string& path);
 
-std::string ReadFile(const std::string& path);
-void WriteFile(const std::string& path, const std::string& bytes);
+using testfiles::ReadFile;
+using testfiles::WriteFile;
 
 }  // namespace karstctl_test
 

@@ -19,6 +19,7 @@
 #include <thread>
 #include <vector>
 
+#include "FileBytes.h"
 #include "SqliteStoreTesting.h"
 #include "TavoConfigStore/ConfigStore.h"
 #include "store_test_util.h"
@@ -38,15 +39,8 @@ using testutil::Obj;
 using testutil::ScratchDir;
 using testutil::Set;
 
-std::string ReadFile(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
-}
-
-void WriteFile(const std::string& path, const std::string& bytes) {
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out.write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
-}
+using testfiles::ReadFile;
+using testfiles::WriteFile;
 
 std::string RandomBytes(std::size_t n, unsigned seed) {
   std::mt19937 rng(seed);

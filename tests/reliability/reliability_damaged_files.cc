@@ -29,6 +29,7 @@
 #include <string>
 #include <vector>
 
+#include "FileBytes.h"
 #include "TavoConfigStore/ConfigStore.h"
 #include "TavoConfigStore/ConfigStoreException.h"
 #include "TavoKarst/KarstLib.h"
@@ -44,15 +45,8 @@ const Tag kGood{1, 5};
 const Tag kNew{2, 9};
 constexpr int kGoodPolicies = 200;  // about 70 pages
 
-std::string ReadFile(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
-}
-
-void WriteFile(const std::string& path, const std::string& bytes) {
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out.write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
-}
+using testfiles::ReadFile;
+using testfiles::WriteFile;
 
 // What one process could do with the file at the store path.
 struct Result {

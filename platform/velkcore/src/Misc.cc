@@ -64,58 +64,48 @@ bool IsInteger(Piece piece) {
   return piece == Piece::kInt || piece == Piece::kLong || piece == Piece::kLongLong;
 }
 
-std::string FormatSimple(const char* format, va_list args) {
-  // Pass one measures, pass two writes: the result is allocated once.
-  va_list measure;
-  va_copy(measure, args);
+// Walks a simple format, handing each piece of the result to "emit" as
+// (pointer, length).
+template <typename Emit>
+void WalkSimple(const char* format, va_list* ap, Emit emit) {
   char digits[24];
   char* const end = digits + sizeof digits;
-  std::size_t size = 0;
   for (const char* p = format; *p != '\0';) {
     if (*p != '%') {
       const char* next = std::strchr(p, '%');
       const std::size_t n = next == nullptr ? std::strlen(p) : static_cast<std::size_t>(next - p);
-      size += n;
+      emit(p, n);
       p += n;
       continue;
     }
     std::size_t length;
     const Piece piece = ConversionAt(p, &length);
     if (piece == Piece::kString) {
-      size += std::strlen(va_arg(measure, const char*));
+      const char* text = va_arg(*ap, const char*);
+      emit(text, std::strlen(text));
     } else if (IsInteger(piece)) {
-      size += static_cast<std::size_t>(end - Decimal(IntegerArg(piece, &measure), end));
+      const char* first = Decimal(IntegerArg(piece, ap), end);
+      emit(first, static_cast<std::size_t>(end - first));
     } else {
-      size += 1;  // "%%"
+      emit("%", 1);
     }
     p += length;
   }
+}
+
+std::string FormatSimple(const char* format, va_list args) {
+  // Pass one measures, pass two writes: the result is allocated once.
+  std::size_t size = 0;
+  va_list measure;
+  va_copy(measure, args);
+  WalkSimple(format, &measure, [&size](const char*, std::size_t n) { size += n; });
   va_end(measure);
 
-  va_list write;
-  va_copy(write, args);
   std::string out;
   out.reserve(size);
-  for (const char* p = format; *p != '\0';) {
-    if (*p != '%') {
-      const char* next = std::strchr(p, '%');
-      const std::size_t n = next == nullptr ? std::strlen(p) : static_cast<std::size_t>(next - p);
-      out.append(p, n);
-      p += n;
-      continue;
-    }
-    std::size_t length;
-    const Piece piece = ConversionAt(p, &length);
-    if (piece == Piece::kString) {
-      out.append(va_arg(write, const char*));
-    } else if (IsInteger(piece)) {
-      const char* first = Decimal(IntegerArg(piece, &write), end);
-      out.append(first, static_cast<std::size_t>(end - first));
-    } else {
-      out.push_back('%');
-    }
-    p += length;
-  }
+  va_list write;
+  va_copy(write, args);
+  WalkSimple(format, &write, [&out](const char* piece, std::size_t n) { out.append(piece, n); });
   va_end(write);
   return out;
 }
