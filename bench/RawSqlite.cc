@@ -5,7 +5,6 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "SqliteStoreTesting.h"
 #include "TavoConfigStore/ConfigStore.h"
 
 namespace karst_bench {
@@ -82,17 +81,23 @@ std::string ConnectionSettings::Describe() const {
 }
 
 ConnectionSettings StoreConnectionSettings() {
-  auto store = TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace);
-  sqlite3* db = TavoConfigStore::SqliteConnectionForTesting(*store);
-  if (db == nullptr) {
-    std::fprintf(stderr, "the configuration store is not the SQLite store\n");
+  // Opening the store creates its file with the page size and journal mode it
+  // keeps there; of the per-connection settings the store changes only
+  // synchronous, to FULL, and leaves the rest at SQLite's defaults.
+  TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace);
+  sqlite3* db = nullptr;
+  if (sqlite3_open_v2(TavoConfigStore::DefaultStorePath().c_str(), &db, SQLITE_OPEN_READWRITE,
+                      nullptr) != SQLITE_OK) {
+    std::fprintf(stderr, "cannot open the store file: %s\n", sqlite3_errmsg(db));
     std::exit(2);
   }
+  sqlite3_exec(db, "PRAGMA synchronous=FULL", nullptr, nullptr, nullptr);
   ConnectionSettings settings;
   for (const char* name : kCopiedPragmas) {
     settings.pragmas.push_back(std::string(name) + "=" +
                                QueryText(db, std::string("PRAGMA ") + name));
   }
+  sqlite3_close(db);
   return settings;
 }
 

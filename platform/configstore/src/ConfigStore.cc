@@ -7,7 +7,6 @@
 #include <exception>
 #include <mutex>
 
-#include "TavoConfigStore/CallProbe.h"
 
 namespace TavoConfigStore {
 
@@ -80,7 +79,6 @@ std::shared_ptr<ConfigStore> DefaultStore() {
 ConfigStore::~ConfigStore() = default;
 
 std::shared_ptr<ConfigStore> ConfigStore::GetStore(const std::string& nameSpace) {
-  NotifyCall("GetStore");
   if (nameSpace != sGlobalNamespace) {
     throw ConfigStoreException("configuration store: unknown namespace \"" + nameSpace + "\"",
                                kErrorUnknownNamespace);

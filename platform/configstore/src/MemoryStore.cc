@@ -5,7 +5,6 @@
 #include <optional>
 #include <tuple>
 
-#include "TavoConfigStore/CallProbe.h"
 #include "TavoConfigStore/ConfigStore.h"
 
 namespace TavoConfigStore {
@@ -27,7 +26,6 @@ struct State {
 class MemoryStore final : public ConfigStore {
  public:
   std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
-    NotifyCall("GetObject");
     std::lock_guard<std::mutex> lock(mu_);
     auto it = state_.index.find(KeyOf(id));
     if (it == state_.index.end()) return nullptr;
@@ -36,7 +34,7 @@ class MemoryStore final : public ConfigStore {
 
   void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
                  std::int32_t& /*flags*/) override {
-    NotifyCall("SetObject");
+    RefuseNull(object.get(), "SetObject");
     std::shared_ptr<const ConfigStoreObject> copy = object->Clone();
     std::lock_guard<std::mutex> lock(mu_);
     IdKey key = KeyOf(object->Id());
@@ -51,7 +49,7 @@ class MemoryStore final : public ConfigStore {
   }
 
   void DeleteObjects(const std::shared_ptr<FilterSpecObject>& filter) override {
-    NotifyCall("DeleteObjects");
+    RefuseNull(filter.get(), "DeleteObjects");
     std::lock_guard<std::mutex> lock(mu_);
     for (auto it = state_.bySeq.begin(); it != state_.bySeq.end();) {
       if (filter->Matches(it->second->Id())) {
@@ -65,7 +63,7 @@ class MemoryStore final : public ConfigStore {
 
   std::vector<std::shared_ptr<ConfigStoreObject>> GetObjects(
       const std::shared_ptr<FilterSpecObject>& filter) override {
-    NotifyCall("GetObjects");
+    RefuseNull(filter.get(), "GetObjects");
     std::lock_guard<std::mutex> lock(mu_);
     std::vector<std::shared_ptr<ConfigStoreObject>> out;
     for (const auto& [seq, object] : state_.bySeq) {
@@ -75,7 +73,6 @@ class MemoryStore final : public ConfigStore {
   }
 
   void BeginTransaction() override {
-    NotifyCall("BeginTransaction");
     std::lock_guard<std::mutex> lock(mu_);
     if (saved_) {
       throw ConfigStoreException("configuration store: a transaction is already open",
@@ -85,7 +82,6 @@ class MemoryStore final : public ConfigStore {
   }
 
   void CommitTransaction() override {
-    NotifyCall("CommitTransaction");
     std::lock_guard<std::mutex> lock(mu_);
     if (!saved_) {
       throw ConfigStoreException("configuration store: no transaction to commit",
@@ -95,7 +91,6 @@ class MemoryStore final : public ConfigStore {
   }
 
   void AbortTransaction() override {
-    NotifyCall("AbortTransaction");
     std::lock_guard<std::mutex> lock(mu_);
     if (!saved_) return;
     state_ = std::move(*saved_);
@@ -103,6 +98,13 @@ class MemoryStore final : public ConfigStore {
   }
 
  private:
+  static void RefuseNull(const void* argument, const char* operation) {
+    if (argument == nullptr) {
+      throw ConfigStoreException(std::string("configuration store: ") + operation + " of null",
+                                 kErrorNullArgument);
+    }
+  }
+
   std::mutex mu_;
   State state_;
   std::optional<State> saved_;  // the state at BeginTransaction, while one is open

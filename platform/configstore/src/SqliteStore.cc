@@ -30,8 +30,6 @@
 #include <vector>
 
 #include "ObjectCodec.h"
-#include "SqliteStoreTesting.h"
-#include "TavoConfigStore/CallProbe.h"
 #include "TavoConfigStore/ConfigStore.h"
 
 namespace TavoConfigStore {
@@ -160,7 +158,6 @@ class SqliteStore final : public ConfigStore {
   }
 
   std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
-    NotifyCall("GetObject");
     std::lock_guard<std::mutex> lock(mu_);
     Resetter reset(get_);
     BindId(get_, id, kAllParts);
@@ -172,8 +169,7 @@ class SqliteStore final : public ConfigStore {
 
   void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
                  std::int32_t& /*flags*/) override {
-    NotifyCall("SetObject");
-    if (!object) throw ConfigStoreException(Where() + ": SetObject of null", SQLITE_MISUSE);
+    if (!object) throw ConfigStoreException(Where() + ": SetObject of null", kErrorNullArgument);
     // Encoded outside the lock into a buffer that keeps its capacity, so a
     // run of writes allocates nothing here.
     thread_local std::string body;
@@ -188,8 +184,7 @@ class SqliteStore final : public ConfigStore {
   }
 
   void DeleteObjects(const std::shared_ptr<FilterSpecObject>& filter) override {
-    NotifyCall("DeleteObjects");
-    if (!filter) throw ConfigStoreException(Where() + ": DeleteObjects of null", SQLITE_MISUSE);
+    if (!filter) throw ConfigStoreException(Where() + ": DeleteObjects of null", kErrorNullArgument);
     std::lock_guard<std::mutex> lock(mu_);
     RefuseWriteAfterRollback();
     const unsigned shape = ShapeOf(filter->Id());
@@ -218,8 +213,7 @@ class SqliteStore final : public ConfigStore {
 
   std::vector<std::shared_ptr<ConfigStoreObject>> GetObjects(
       const std::shared_ptr<FilterSpecObject>& filter) override {
-    NotifyCall("GetObjects");
-    if (!filter) throw ConfigStoreException(Where() + ": GetObjects of null", SQLITE_MISUSE);
+    if (!filter) throw ConfigStoreException(Where() + ": GetObjects of null", kErrorNullArgument);
     std::lock_guard<std::mutex> lock(mu_);
     const unsigned shape = ShapeOf(filter->Id());
     // Outside a transaction, an explicit read transaction pins one snapshot
@@ -256,7 +250,6 @@ class SqliteStore final : public ConfigStore {
   }
 
   void BeginTransaction() override {
-    NotifyCall("BeginTransaction");
     std::lock_guard<std::mutex> lock(mu_);
     if (inTransaction_) {
       throw ConfigStoreException(Where() + ": a transaction is already open",
@@ -269,7 +262,6 @@ class SqliteStore final : public ConfigStore {
   }
 
   void CommitTransaction() override {
-    NotifyCall("CommitTransaction");
     std::lock_guard<std::mutex> lock(mu_);
     if (!inTransaction_) {
       throw ConfigStoreException(Where() + ": no transaction to commit", kErrorNoTransaction);
@@ -292,7 +284,6 @@ class SqliteStore final : public ConfigStore {
   }
 
   void AbortTransaction() override {
-    NotifyCall("AbortTransaction");
     std::lock_guard<std::mutex> lock(mu_);
     if (!inTransaction_) return;
     // SQLite may already have rolled back by itself; there is nothing left.
@@ -306,7 +297,6 @@ class SqliteStore final : public ConfigStore {
     if (rc != SQLITE_DONE) Fail("rolling back");
   }
 
-  sqlite3* Db() const { return db_; }
 
  private:
   std::string Where() const { return "configuration store " + path_; }
@@ -572,11 +562,6 @@ class SqliteStore final : public ConfigStore {
 
 std::shared_ptr<ConfigStore> NewSqliteStore(const std::string& path) {
   return std::make_shared<SqliteStore>(path);
-}
-
-sqlite3* SqliteConnectionForTesting(ConfigStore& store) {
-  auto* sqlite = dynamic_cast<SqliteStore*>(&store);
-  return sqlite == nullptr ? nullptr : sqlite->Db();
 }
 
 }  // namespace TavoConfigStore

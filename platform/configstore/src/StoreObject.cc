@@ -6,7 +6,6 @@
 #include <string_view>
 
 #include "ObjectCodec.h"
-#include "TavoConfigStore/CallProbe.h"
 
 namespace TavoConfigStore {
 
@@ -81,19 +80,16 @@ StoreValue& StoreObject::Slot(const char* name) {
 }
 
 void StoreObject::SetValue(const char* name, const std::string& value) {
-  NotifyCall("SetValue");
   Own();
   Slot(name).value = value;
 }
 
 void StoreObject::SetValue(const char* name, long long value) {
-  NotifyCall("SetValue");
   Own();
   Slot(name).value = value;
 }
 
 bool StoreObject::GetValue(const char* name, std::string* value) const {
-  NotifyCall("GetValue");
   if (encoded_ != nullptr) {
     codec::ValueRef v;
     if (!codec::FindValue(encoded_, encodedSize_, name, &v) || v.isInteger) return false;
@@ -109,7 +105,6 @@ bool StoreObject::GetValue(const char* name, std::string* value) const {
 }
 
 bool StoreObject::GetValue(const char* name, long long* value) const {
-  NotifyCall("GetValue");
   if (encoded_ != nullptr) {
     codec::ValueRef v;
     if (!codec::FindValue(encoded_, encodedSize_, name, &v) || !v.isInteger) return false;
@@ -206,7 +201,6 @@ const std::vector<SubObjectEntry>& ConfigStoreObject::SubObjects() const {
 }
 
 std::shared_ptr<StoreObject> ConfigStoreObject::CreateSubObject(const SubObjectId& id) {
-  NotifyCall("CreateSubObject");
   OwnSubObjects();
   auto sub = std::make_shared<StoreObject>();
   for (SubObjectEntry& e : subObjects_) {
@@ -221,7 +215,6 @@ std::shared_ptr<StoreObject> ConfigStoreObject::CreateSubObject(const SubObjectI
 }
 
 std::shared_ptr<StoreObject> ConfigStoreObject::GetSubObject(const SubObjectId& id) const {
-  NotifyCall("GetSubObject");
   if (encodedSubs_ != nullptr) {
     const codec::Body& body = BuiltSubs();
     for (std::size_t i = 0; i < body.built; ++i) {
@@ -239,7 +232,6 @@ std::shared_ptr<StoreObject> ConfigStoreObject::GetSubObject(const SubObjectId& 
 
 std::vector<std::shared_ptr<StoreObject>> ConfigStoreObject::GetSubObjectInstances(
     const std::shared_ptr<FilterSpecObject>& filter) const {
-  NotifyCall("GetSubObjectInstances");
   std::vector<std::shared_ptr<StoreObject>> out;
   if (encodedSubs_ != nullptr) {
     const codec::Body& body = BuiltSubs();

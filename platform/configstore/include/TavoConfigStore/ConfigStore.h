@@ -65,7 +65,8 @@ CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewMemoryStore();
 CONFIGSTORE_EXPORT std::string DefaultStorePath();
 
 // Makes GetStore return "store" for the whole process (null restores the
-// default SQLite store). Meant for tests and for hosts that embed the store.
+// default SQLite store). For hosts that embed their own store or decorate one
+// (see ForwardingStore.h).
 CONFIGSTORE_EXPORT void SetGlobalStore(std::shared_ptr<ConfigStore> store);
 
 }  // namespace TavoConfigStore

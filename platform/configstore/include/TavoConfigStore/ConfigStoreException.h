@@ -34,7 +34,7 @@ enum StoreErrorCode : std::int32_t {
   kErrorCorruptObject = 1003,      // an object whose stored encoding cannot be read
   kErrorNoTransaction = 1004,      // Commit or Abort with no open transaction
   kErrorNestedTransaction = 1005,  // Begin while a transaction is open
-  kErrorInjected = 1006,           // default code of a fault injected by a test
+  kErrorNullArgument = 1007,       // a null object or filter handed to an operation
 };
 
 }  // namespace TavoConfigStore

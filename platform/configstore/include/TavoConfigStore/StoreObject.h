@@ -45,11 +45,13 @@ class CONFIGSTORE_EXPORT StoreObject {
   void SetValue(const char* name, long long value);
 
   // Fills "*value" and returns true when a value of that name and kind is
-  // present. Otherwise returns false and leaves "*value" untouched.
-  bool GetValue(const char* name, std::string* value) const;
-  bool GetValue(const char* name, long long* value) const;
+  // present. Otherwise returns false and leaves "*value" untouched. Virtual,
+  // as are the sub-object reads below, so that a store decorator can hand out
+  // objects of its own; a read that fails throws ConfigStoreException.
+  virtual bool GetValue(const char* name, std::string* value) const;
+  virtual bool GetValue(const char* name, long long* value) const;
 
-  // For backends: every value, without notifying the call probe.
+  // For backends: every value.
   const std::vector<StoreValue>& Values() const;
 
  private:
@@ -97,13 +99,13 @@ class CONFIGSTORE_EXPORT ConfigStoreObject : public StoreObject {
   std::shared_ptr<StoreObject> CreateSubObject(const SubObjectId& id);
 
   // The sub-object with that array and key, or null when there is none.
-  std::shared_ptr<StoreObject> GetSubObject(const SubObjectId& id) const;
+  virtual std::shared_ptr<StoreObject> GetSubObject(const SubObjectId& id) const;
 
   // Every sub-object the filter matches, in the order they were created.
-  std::vector<std::shared_ptr<StoreObject>> GetSubObjectInstances(
+  virtual std::vector<std::shared_ptr<StoreObject>> GetSubObjectInstances(
       const std::shared_ptr<FilterSpecObject>& filter) const;
 
-  // For backends: every sub-object, without notifying the call probe.
+  // For backends: every sub-object.
   const std::vector<SubObjectEntry>& SubObjects() const;
 
   // A deep copy: values and sub-objects are not shared with this object.
