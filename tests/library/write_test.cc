@@ -1,14 +1,14 @@
-// Replacing a catalogue and resetting: the store calls made, and what reaches
-// the caller when one of them fails.
+// Replacing and resetting the catalogue on the in-memory store: the store
+// calls made, the stored layout, and what reaches the caller when a call fails.
 
 #include <gtest/gtest.h>
 
-#include <functional>
-#include <new>
+#include <set>
+#include <variant>
 
-#include "MemoryStoreFixture.h"
+#include "FaultSweep.h"
+#include "Records.h"
 #include "TavoConfigStore/ConfigStoreException.h"
-#include "frame/StoreAccess.h"
 
 namespace karst_test {
 namespace {
@@ -17,230 +17,129 @@ using TavoConfigStore::ConfigStoreException;
 using TavoKarst::KarstLib;
 using Calls = std::vector<std::string>;
 
-const std::vector<TavoKarst::KarstPolicyInfo> kOldPolicies = {
-    Policy("old-a", "p-a", {{"A", "CORRA"}}), Policy("old-b", "p-b")};
-const std::vector<TavoKarst::KarstPolicyInfo> kNewPolicies = {
-    Policy("new-1", "p-1", {{"blob-1", "CORRA"}, {"skipped", ""}, {"blob-2", "ns-beta"}}),
-    Policy("new-2", "p-2"), Policy("new-3", "p-3", {{"x", "ns"}})};
-const std::vector<TavoKarst::KarstDatastoreInfo> kOldDatastores = {
-    Datastore("ds://old", "CORRA", "p-a")};
-const std::vector<TavoKarst::KarstDatastoreInfo> kNewDatastores = {
-    Datastore("ds://1", "CORRA", "p-1"), Datastore("ds://2", "ns-beta", "p-2"),
-    Datastore("ds://3", "", "")};
+const Catalogue kOld = {{Policy("old-a", "p-a", {{"A", "CORRA"}}), Policy("old-b", "p-b")},
+                        {Datastore("ds://old", "CORRA", "p-b")}};
+const Catalogue kNew = {
+    {Policy("new-1", "p-1", {{"blob-1", "CORRA"}, {"blob-2", "ns-beta"}}, "d", -2),
+     Policy("new-2", "p-2"), Policy("new-3", "p-3", {{"x", "ns"}})},
+    {Datastore("ds://1", "CORRA", "p-1"), Datastore("ds://2", "ns-beta", "p-2"),
+     Datastore("", "", "")}};
 
-class WriteTest : public MemoryStoreTest {
+class WriteTest : public ::testing::Test {
  protected:
-  void Seed() {
-    KarstLib::AddPolicyInfo(kOldPolicies);
-    KarstLib::AddDatastoreInfo(kOldDatastores);
-    probe_->ClearLog();
+  void SetUp() override {
+    StoreCatalogue(kOld);
+    store_->ClearLog();
   }
-
-  // The calls logged after the "nth" call of "operation".
-  Calls CallsAfter(const std::string& operation, int nth) const {
-    Calls all = probe_->Calls();
-    for (std::size_t i = 0; i < all.size(); ++i) {
-      if (all[i] == operation && --nth == 0) return Calls(all.begin() + i + 1, all.end());
-    }
-    ADD_FAILURE() << operation << " was not called often enough";
-    return {};
-  }
+  std::shared_ptr<TavoConfigStore::ConfigStore> memory_ = TavoConfigStore::NewMemoryStore();
+  ScopedFaultStore store_{memory_};
 };
 
-TEST_F(WriteTest, ReplaceMakesOneSetObjectPerRecordInOneTransaction) {
-  Seed();
-  KarstLib::AddPolicyInfo(kNewPolicies);
-  EXPECT_EQ(StoreCalls(), (Calls{"GetStore", "BeginTransaction", "DeleteObjects", "SetObject",
-                                 "SetObject", "SetObject", "CommitTransaction"}));
-  // Four values, then per stored blob one sub-object with two values, all
-  // before the object is written; the blob with an empty namespace costs nothing.
-  const Calls all = probe_->Calls();
-  const Calls firstPolicy(all.begin() + 3, all.begin() + 14);
-  EXPECT_EQ(firstPolicy,
-            (Calls{"SetValue", "SetValue", "SetValue", "SetValue", "CreateSubObject", "SetValue",
-                   "SetValue", "CreateSubObject", "SetValue", "SetValue", "SetObject"}));
-
-  EXPECT_EQ(KarstLib::ListDatastoreInfo(), kOldDatastores);
-  auto listed = KarstLib::ListPolicyInfo();
-  ASSERT_EQ(listed.size(), 3u);
-  EXPECT_EQ(listed[0].blobs,
-            (std::vector<TavoKarst::KarstPolicyBlob>{{"blob-1", "CORRA"}, {"blob-2", "ns-beta"}}));
-
-  probe_->ClearLog();
-  KarstLib::AddDatastoreInfo(kNewDatastores);
-  EXPECT_EQ(StoreCalls(), (Calls{"GetStore", "BeginTransaction", "DeleteObjects", "SetObject",
-                                 "SetObject", "SetObject", "CommitTransaction"}));
-  EXPECT_EQ(KarstLib::ListDatastoreInfo(), kNewDatastores);
-  EXPECT_EQ(KarstLib::ListPolicyInfo().size(), 3u);
-}
-
-TEST_F(WriteTest, EmptyListClearsOnlyItsOwnCollection) {
-  Seed();
-  KarstLib::AddPolicyInfo({});
-  EXPECT_EQ(StoreCalls(),
-            (Calls{"GetStore", "BeginTransaction", "DeleteObjects", "CommitTransaction"}));
-  EXPECT_TRUE(KarstLib::ListPolicyInfo().empty());
-  EXPECT_EQ(KarstLib::ListDatastoreInfo(), kOldDatastores);
-  KarstLib::AddPolicyInfo(kOldPolicies);
+// What each collection holds afterwards, and that the other one is left
+// alone, the fault sweep below checks; an empty list must clear too.
+TEST_F(WriteTest, ReplaceIsOneTransactionOverItsOwnCollection) {
+  KarstLib::AddPolicyInfo(kNew.policies);
+  EXPECT_EQ(store_->Calls(StoreOperations()),
+            (Calls{"BeginTransaction", "DeleteObjects", "SetObject", "SetObject", "SetObject",
+                   "CommitTransaction"}));
   KarstLib::AddDatastoreInfo({});
   EXPECT_TRUE(KarstLib::ListDatastoreInfo().empty());
-  EXPECT_EQ(KarstLib::ListPolicyInfo(), kOldPolicies);
 }
 
-struct FailurePoint {
-  std::string operation;
-  int nth;
-};
+// "name=s:text" and "name=i:number", sorted by name.
+std::string Values(const TavoConfigStore::StoreObject& object) {
+  std::set<std::string> values;
+  for (const TavoConfigStore::StoreValue& v : object.Values()) {
+    values.insert(v.name + (v.value.index() ? "=i:" + std::to_string(std::get<1>(v.value))
+                                            : "=s:" + std::get<0>(v.value)));
+  }
+  std::string out;
+  for (const std::string& v : values) out += v + " ";
+  return out;
+}
 
-// For each write and each place a store call can fail: the transaction is
-// abandoned right after the failing call, the caller gets the store's message,
-// code and detail, the old catalogue is intact, and the store still works.
-TEST_F(WriteTest, StoreErrorAbandonsTheReplaceAtEveryFailurePoint) {
-  struct Write {
-    std::string name;
-    std::function<void()> run;
-    std::vector<FailurePoint> points;
-  };
-  const std::vector<Write> writes = {
-      {"AddPolicyInfo",
-       [] { KarstLib::AddPolicyInfo(kNewPolicies); },
-       {{"GetStore", 1},
-        {"BeginTransaction", 1},
-        {"DeleteObjects", 1},
-        {"SetValue", 1},
-        {"SetValue", 4},
-        {"CreateSubObject", 2},
-        {"SetValue", 6},
-        {"SetObject", 1},
-        {"SetObject", 3},
-        {"CommitTransaction", 1}}},
-      {"AddDatastoreInfo",
-       [] { KarstLib::AddDatastoreInfo(kNewDatastores); },
-       {{"GetStore", 1},
-        {"BeginTransaction", 1},
-        {"DeleteObjects", 1},
-        {"SetValue", 2},
-        {"SetObject", 2},
-        {"CommitTransaction", 1}}},
-  };
-  for (const Write& write : writes) {
-    for (const FailurePoint& point : write.points) {
-      SCOPED_TRACE(write.name + " failing at " + point.operation + " #" +
-                   std::to_string(point.nth));
-      TearDown();
-      SetUp();
-      Seed();
-      auto detail = std::make_shared<int>(7);
-      probe_->FailWith(point.operation, point.nth,
-                       [detail] { throw ConfigStoreException("disk on fire", 517, detail); });
-      try {
-        write.run();
-        ADD_FAILURE() << "no exception";
-      } catch (const ConfigStoreException& e) {
-        EXPECT_STREQ(e.what(), "disk on fire");
-        EXPECT_EQ(e.Code(), 517);
-        EXPECT_EQ(e.Detail().get(), detail.get());
-      }
-      const Calls expectedAfter =
-          point.operation == "GetStore" ? Calls{} : Calls{"AbortTransaction"};
-      EXPECT_EQ(CallsAfter(point.operation, point.nth), expectedAfter);
-
-      probe_->ClearFaults();
-      EXPECT_EQ(KarstLib::ListPolicyInfo(), kOldPolicies);
-      EXPECT_EQ(KarstLib::ListDatastoreInfo(), kOldDatastores);
-      write.run();  // nothing was left open
+TEST_F(WriteTest, StoredLayout) {
+  KarstLib::AddPolicyInfo(
+      {Policy("gold", "p-1", {{"B", "ns-b"}, {"skipped", ""}, {"", "ns-a"}}, "", 7)});
+  KarstLib::AddDatastoreInfo({Datastore("ds://a", "", "p-1")});
+  // The values, then the sub-objects in store order as "array[key]{values}".
+  auto read = [this](const std::string& key, const std::string& instance) {
+    auto object = memory_->GetObject({key, "storage", "tavo", instance});
+    if (!object) return std::string("missing");
+    std::string out = Values(*object);
+    for (const TavoConfigStore::SubObjectEntry& sub : object->SubObjects()) {
+      out += sub.id.Array() + "[" + sub.id.Key() + "]{" + Values(*sub.object) + "}";
     }
-  }
+    return out;
+  };
+  EXPECT_EQ(read("karst_policies", "gold"),
+            "description=s: generation_number=i:7 name=s:gold policy_id=s:p-1 "
+            "blobs[ns-b]{blob=s:B datastore_namespace=s:ns-b }"
+            "blobs[ns-a]{blob=s: datastore_namespace=s:ns-a }");
+  EXPECT_EQ(read("karst_datastores", "ds://a"),
+            "datastore_namespace=s: drp_policy_id=s:p-1 url=s:ds://a ");
 }
 
-TEST_F(WriteTest, OtherExceptionsPassWithNeitherCommitNorAbort) {
-  Seed();
-  probe_->FailWith("SetObject", 2, [] { throw std::bad_alloc(); });
-  EXPECT_THROW(KarstLib::AddPolicyInfo(kNewPolicies), std::bad_alloc);
-  EXPECT_EQ(StoreCalls(),
-            (Calls{"GetStore", "BeginTransaction", "DeleteObjects", "SetObject", "SetObject"}));
-
-  TearDown();
-  SetUp();
-  // A core-library error that is not a store error is not a store error here either.
-  probe_->FailWith("DeleteObjects", 1, [] { throw Velk::Lib::VelkException("not a store error"); });
+// The sweep checks the code, the message and the abort; not the detail the
+// copy must share, nor that other errors are left as they are.
+TEST_F(WriteTest, AStoreErrorReachesTheCallerAsACopyAndOthersUnchanged) {
+  auto detail = std::make_shared<int>(7);
+  store_->FailWith("SetObject", 2, [detail] { throw ConfigStoreException("", 517, detail); });
   try {
-    KarstLib::AddDatastoreInfo(kNewDatastores);
-    ADD_FAILURE() << "no exception";
-  } catch (const ConfigStoreException&) {
-    ADD_FAILURE() << "converted to a store error";
-  } catch (const Velk::Lib::VelkException& e) {
-    EXPECT_STREQ(e.what(), "not a store error");
-  }
-  EXPECT_EQ(probe_->Count("AbortTransaction") + probe_->Count("CommitTransaction"), 0);
-}
-
-TEST_F(WriteTest, ResetDeletesBothAndIgnoresDeletionFailures) {
-  KarstLib::Reset();  // an empty store
-  EXPECT_EQ(StoreCalls(), (Calls{"GetStore", "BeginTransaction", "DeleteObjects", "DeleteObjects",
-                                 "CommitTransaction"}));
-
-  Seed();
-  KarstLib::Reset();
-  EXPECT_TRUE(KarstLib::ListPolicyInfo().empty());
-  EXPECT_TRUE(KarstLib::ListDatastoreInfo().empty());
-
-  // The policy deletion fails: datastores are still deleted and committed.
-  Seed();
-  probe_->FailStoreError("DeleteObjects", 1, "locked", 5);
-  EXPECT_NO_THROW(KarstLib::Reset());
-  EXPECT_EQ(StoreCalls(), (Calls{"GetStore", "BeginTransaction", "DeleteObjects", "DeleteObjects",
-                                 "CommitTransaction"}));
-  EXPECT_EQ(KarstLib::ListPolicyInfo(), kOldPolicies);
-  EXPECT_TRUE(KarstLib::ListDatastoreInfo().empty());
-
-  probe_->ClearFaults();
-  Seed();
-  probe_->FailStoreError("DeleteObjects", 1, "locked", 5, /*persistent=*/true);
-  EXPECT_NO_THROW(KarstLib::Reset());
-  EXPECT_EQ(probe_->Count("CommitTransaction"), 1);
-  EXPECT_EQ(probe_->Count("AbortTransaction"), 0);
-}
-
-TEST_F(WriteTest, ResetReportsOpenBeginAndCommitFailures) {
-  for (const std::string operation : {"GetStore", "BeginTransaction", "CommitTransaction"}) {
-    SCOPED_TRACE(operation);
-    TearDown();
-    SetUp();
-    Seed();
-    probe_->FailStoreError(operation, 1, "no " + operation, 11);
-    try {
-      KarstLib::Reset();
-      ADD_FAILURE() << "no exception";
-    } catch (const ConfigStoreException& e) {
-      EXPECT_EQ(e.what(), "no " + operation);
-      EXPECT_EQ(e.Code(), 11);
-    }
-    EXPECT_EQ(probe_->Count("AbortTransaction"), operation == "GetStore" ? 0 : 1);
-    probe_->ClearFaults();
-    EXPECT_EQ(KarstLib::ListPolicyInfo(), kOldPolicies);
-  }
-
-  TearDown();
-  SetUp();
-  probe_->FailWith("DeleteObjects", 2, [] { throw std::bad_alloc(); });
-  EXPECT_THROW(KarstLib::Reset(), std::bad_alloc);
-  EXPECT_EQ(probe_->Count("AbortTransaction") + probe_->Count("CommitTransaction"), 0);
-}
-
-TEST_F(WriteTest, ClearingRethrowsACopyUnlessErrorsAreIgnored) {
-  auto store = TavoKarst::OpenStore();
-  probe_->FailStoreError("DeleteObjects", 1, "denied", 23, /*persistent=*/true);
-  try {
-    TavoKarst::ClearPolicies(store, false);
-    ADD_FAILURE() << "no exception";
+    KarstLib::AddPolicyInfo(kNew.policies);
   } catch (const ConfigStoreException& e) {
-    EXPECT_STREQ(e.what(), "denied");
-    EXPECT_EQ(e.Code(), 23);
+    EXPECT_EQ(e.Detail(), detail);
   }
-  EXPECT_THROW(TavoKarst::ClearDatastores(store, false), ConfigStoreException);
-  EXPECT_NO_THROW(TavoKarst::ClearPolicies(store, true));
-  EXPECT_NO_THROW(TavoKarst::ClearDatastores(store, true));
+
+  store_->ClearFaults();
+  store_->ClearLog();
+  store_->FailWith("DeleteObjects", 1, [] { throw Velk::Lib::VelkException("core"); });
+  try {
+    KarstLib::AddDatastoreInfo(kNew.datastores);
+  } catch (const Velk::Lib::VelkException& e) {
+    EXPECT_EQ(dynamic_cast<const ConfigStoreException*>(&e), nullptr) << "made a store error";
+  }
+  EXPECT_EQ(store_->Calls(StoreOperations()), (Calls{"BeginTransaction", "DeleteObjects"}));
+}
+
+TEST_F(WriteTest, ResetIgnoresFailedDeletionsButNotAFailedBegin) {
+  // Both deletions fail: the second is still tried, and the rest committed.
+  store_->Fail("DeleteObjects", 1, FaultKind::kStoreErrorFromThenOn);
+  EXPECT_NO_THROW(KarstLib::Reset());
+  EXPECT_EQ(store_->Calls(StoreOperations()),
+            (Calls{"BeginTransaction", "DeleteObjects", "DeleteObjects", "CommitTransaction"}));
+  // The sweep lets a returning Reset pass, so it misses a swallowed failed begin.
+  store_->ClearFaults();
+  store_->Fail("BeginTransaction", 1, FaultKind::kStoreErrorFromThenOn);
+  EXPECT_THROW(KarstLib::Reset(), ConfigStoreException);
+}
+
+// Every call of every operation fails in turn: writers leave each collection
+// old or new and never a transaction open, readers change nothing, and only
+// the planned fault escapes.
+TEST(FaultSweepTest, EveryCallOfEveryOperationFailsInTurn) {
+  auto memory = TavoConfigStore::NewMemoryStore();
+  const std::vector<SweepOperation> operations = {
+      {"AddPolicyInfo",
+       [] { KarstLib::AddPolicyInfo(kNew.policies); },
+       {kNew.policies, kOld.datastores}},
+      {"AddDatastoreInfo",
+       [] { KarstLib::AddDatastoreInfo(kNew.datastores); },
+       {kOld.policies, kNew.datastores}},
+      {"Reset", [] { KarstLib::Reset(); }, {}},
+      {"ListPolicyInfo", [] { KarstLib::ListPolicyInfo(); }, kOld},
+      {"ListDatastoreInfo", [] { KarstLib::ListDatastoreInfo(); }, kOld},
+      {"GetPolicyBlobById", [] { KarstLib::GetPolicyBlobById("p-a", "ds://old"); }, kOld},
+      {"GetCorraPolicyBlobById", [] { KarstLib::GetCorraPolicyBlobById("p-b"); }, kOld},
+      {"GetCorraPolicyBlobByName", [] { KarstLib::GetCorraPolicyBlobByName("old-a"); }, kOld},
+      {"GetDefaultPolicyBlob", [] { KarstLib::GetDefaultPolicyBlob("ds://old"); }, kOld},
+      {"GetDbHash", [] { KarstLib::GetDbHash(); }, kOld},
+  };
+  const std::vector<std::string> failures = SweepFaults(
+      [memory] { return memory; }, kOld, operations,
+      {FaultKind::kStoreErrorOnce, FaultKind::kStoreErrorFromThenOn, FaultKind::kBadAlloc});
+  for (const std::string& failure : failures) ADD_FAILURE() << failure;
+  EXPECT_GT(SweptPoints(), 100);
 }
 
 }  // namespace

@@ -1,133 +1,89 @@
-// Shared by the reliability tests: self-describing catalogues, child
-// processes with a result pipe and a deadline, and the one-line figures each
-// test prints at its end.
+// What the reliability tests share beyond tests/support: self-describing
+// catalogues a reader can tell whole from torn, what a new process finds in
+// the store, random bytes and the one-line figures. It also brings in what
+// every test of the suite uses.
 
 #ifndef KARST_TESTS_RELIABILITY_RELIABILITY_UTIL_H_
 #define KARST_TESTS_RELIABILITY_RELIABILITY_UTIL_H_
 
+#include <grp.h>
 #include <gtest/gtest.h>
+#include <pwd.h>
+#include <sched.h>
+#include <signal.h>
+#include <sys/mman.h>
+#include <sys/mount.h>
+#include <sys/prctl.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
-#include <cstdint>
-#include <functional>
-#include <ostream>
+#include <atomic>
+#include <chrono>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <random>
 #include <string>
+#include <thread>
 #include <vector>
 
-#include "TavoKarst/KarstLib.h"
+#include "Child.h"
+#include "FaultSweep.h"
+#include "FaultVfs.h"
+#include "Files.h"
+#include "RawSqlite.h"
+#include "Records.h"
+#include "TavoConfigStore/ConfigStoreException.h"
 
 namespace karst_reliability {
 
-// True in sanitizer builds, where every loop runs fewer rounds.
-bool Sanitized();
+using namespace karst_test;  // NOLINT: the suite's own helpers
+using TavoConfigStore::ConfigStoreException;
+using TavoKarst::KarstDatastoreInfo;
+using TavoKarst::KarstLib;
+using TavoKarst::KarstPolicyInfo;
+
 // "full" in a normal build, "reduced" under the sanitizers.
 int Scaled(int full, int reduced);
 
-// Names one list a writer replaced a collection with: the writer and its
-// round. Every record of the list carries both, the list's length and the
-// record's index, so a reader can tell a whole list from a torn one.
+// Names one list a writer replaced a collection with: its writer, its round
+// and its length (0: 1..11 policies or 1..7 datastores, from the round).
 struct Tag {
   int writer = 0;
   long long round = 0;
-  bool operator==(const Tag& other) const { return writer == other.writer && round == other.round; }
-  bool operator!=(const Tag& other) const { return !(*this == other); }
+  int count = 0;
 };
 
-// The lists for a tag: deterministic, 1..11 policies and 1..7 datastores
-// depending on the tag unless "count" says otherwise, NUL and 0xFF bytes in
-// the blobs. Policy names are shared between tags, so a replace overwrites
-// keys that exist as well as adding and dropping some; datastore urls carry
-// the tag. Every datastore's namespace and default policy exist in every
-// policy list, so each look-up finds a blob. Lists of more than 100 policies
-// carry 1200 more bytes a policy, to span many pages.
-std::vector<TavoKarst::KarstPolicyInfo> PoliciesFor(Tag tag, int count = 0);
-std::vector<TavoKarst::KarstDatastoreInfo> DatastoresFor(Tag tag, int count = 0);
+// Every record carries the tag's text and its index, NUL and 0xFF sit in
+// the blobs, and policy names repeat between tags, so a replace overwrites
+// keys as well as adding and dropping some. Every datastore's namespace and
+// default policy exist in every policy list. Lists of more than 100 policies
+// carry 1200 more bytes a policy.
+std::vector<KarstPolicyInfo> PoliciesFor(Tag tag);
+std::vector<KarstDatastoreInfo> DatastoresFor(Tag tag);
 
-// What a listing held.
-struct Observed {
-  enum Kind { kEmpty, kWhole, kTorn };
-  Kind kind = kEmpty;
-  Tag tag;  // for kWhole
-  std::string Describe() const;
-};
-// kWhole only when the list equals PoliciesFor(tag) byte for byte.
-Observed Classify(const std::vector<TavoKarst::KarstPolicyInfo>& policies);
-Observed Classify(const std::vector<TavoKarst::KarstDatastoreInfo>& datastores);
+// "" for an empty list, the tag's text ("w=1 r=5 n=11") for a list equal to
+// that tag's list byte for byte, anything else "torn".
+std::string Classify(const std::vector<KarstPolicyInfo>& policies);
+std::string Classify(const std::vector<KarstDatastoreInfo>& datastores);
 
-// A fresh directory under the test temp dir, removed with its content.
-class ScratchDir {
- public:
-  ScratchDir();
-  ~ScratchDir();
-  ScratchDir(const ScratchDir&) = delete;
-  ScratchDir& operator=(const ScratchDir&) = delete;
-  const std::string& Path() const { return path_; }
-  std::string File(const std::string& name) const { return path_ + "/" + name; }
+// Both collections as "<policies> | <datastores>", each as Classify gives it:
+// of a catalogue, of the lists of two tags, or as a new process with a new
+// connection lists them (or how that process failed).
+std::string State(const Catalogue& catalogue);
+std::string State(Tag policies, Tag datastores);
+std::string ReadInFreshProcess();
 
- private:
-  std::string path_;
-};
+// "n" random bytes.
+std::string RandomBytes(std::size_t n, std::mt19937_64& rng);
 
-// Points the library's default store at "path" for this process and every
-// child forked afterwards.
-void UseStoreAt(const std::string& path);
-
-// How a child process ended and what it wrote to its result pipe.
-struct ChildResult {
-  bool exited = false;    // normal exit, see code
-  int code = -1;          // exit status, or the signal that ended it
-  bool timedOut = false;  // killed by the parent at the deadline
-  std::string output;
-  std::string Describe() const;
-};
-
-// Runs "body" in a forked child; whatever it writes to the fd it is given
-// comes back in "output". An exception out of "body" is written there and
-// the child exits with 3. A child still running after "timeoutSeconds" is
-// killed and reported as timed out. The child never returns into gtest.
-ChildResult RunChild(const std::function<void(int resultFd)>& body, double timeoutSeconds = 120);
-
-// Writes all of "bytes" to "fd", retrying short writes.
-void WriteAll(int fd, const std::string& bytes);
-
-// Reads the whole catalogue in a new process with a new connection, the way
-// the next program on the host would, and returns how each collection looks.
-struct Verdict {
-  Observed policies;
-  Observed datastores;
-  bool ok = false;  // the verifying process ran and listed both
-  std::string error;
-  std::string Describe() const;
-};
-Verdict VerifyInFreshProcess(double timeoutSeconds = 120);
-
-// While alive, every commit on this thread's cached store connection is
-// followed at once by a checkpoint (the copy of the log into the database
-// file), so a test can fail or crash inside one without writing the
-// thousand pages SQLite waits for by default.
-class CheckpointEveryCommit {
- public:
-  CheckpointEveryCommit();
-  ~CheckpointEveryCommit();
-  CheckpointEveryCommit(const CheckpointEveryCommit&) = delete;
-  CheckpointEveryCommit& operator=(const CheckpointEveryCommit&) = delete;
-};
-
-// Prints "line" and keeps it as this run's figures of "part", which the test
-// script prints at the end of the whole run.
-void ReportFigures(const std::string& part, const std::string& line);
-
-// Percentile of a set of durations in microseconds, e.g. 0.99.
-double Percentile(std::vector<double> values, double fraction);
+// Prints the line "format" makes and keeps it as this run's figures of
+// "part"; scripts/test prints them all at the end.
+void ReportFigures(const char* part, const char* format, ...) __attribute__((format(printf, 2, 3)));
 
 }  // namespace karst_reliability
-
-namespace TavoKarst {
-// Record comparison and printing for gtest, found by argument-dependent lookup.
-bool operator==(const KarstPolicyBlob& a, const KarstPolicyBlob& b);
-bool operator==(const KarstPolicyInfo& a, const KarstPolicyInfo& b);
-bool operator==(const KarstDatastoreInfo& a, const KarstDatastoreInfo& b);
-void PrintTo(const KarstPolicyInfo& p, std::ostream* os);
-void PrintTo(const KarstDatastoreInfo& d, std::ostream* os);
-}  // namespace TavoKarst
 
 #endif  // KARST_TESTS_RELIABILITY_RELIABILITY_UTIL_H_

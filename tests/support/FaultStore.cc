@@ -144,12 +144,6 @@ std::vector<std::string> FaultStore::Calls(const std::vector<std::string>& opera
   return out;
 }
 
-int FaultStore::Count(const std::string& operation) const {
-  std::lock_guard<std::mutex> lock(mu_);
-  auto it = counts_.find(operation);
-  return it == counts_.end() ? 0 : it->second;
-}
-
 void FaultStore::ClearLog() {
   std::lock_guard<std::mutex> lock(mu_);
   log_.clear();

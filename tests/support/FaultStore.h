@@ -61,7 +61,6 @@ class FaultStore : public TavoConfigStore::ForwardingStore {
   std::vector<std::string> Calls() const;
   // Those among "operations" only, e.g. StoreOperations().
   std::vector<std::string> Calls(const std::vector<std::string>& operations) const;
-  int Count(const std::string& operation) const;
   void ClearLog();
 
   // True between a BeginTransaction that returned and the next Commit or

@@ -36,9 +36,4 @@ std::string RawDb::QueryText(const std::string& sql) {
   return out;
 }
 
-long long RawDb::QueryInt(const std::string& sql) {
-  const std::string text = QueryText(sql);
-  return text.empty() ? 0 : std::stoll(text);
-}
-
 }  // namespace karst_test

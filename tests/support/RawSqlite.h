@@ -18,13 +18,11 @@ class RawDb {
   RawDb(const RawDb&) = delete;
   RawDb& operator=(const RawDb&) = delete;
 
-  sqlite3* Handle() const { return db_; }
-  // Each returns SQLite's result code; Exec ignores rows.
+  // SQLite's result code; rows are ignored.
   int Exec(const std::string& sql);
-  // The first column of the first row ("" or 0 when there is none); throws
+  // The first column of the first row ("" when there is none); throws
   // std::runtime_error when the statement fails.
   std::string QueryText(const std::string& sql);
-  long long QueryInt(const std::string& sql);
 
  private:
   sqlite3* db_ = nullptr;

@@ -1,22 +1,24 @@
 // A SQLite VFS that wraps the default one and can fail, or end the process
-// at, the Nth write, sync or truncate of any file SQLite opens through it.
+// at, the Nth write, sync, truncate or read of any file SQLite opens through
+// it.
 // Installed as the default VFS, it sits under every connection the store
 // opens afterwards, so the store is tested on the I/O errors SQLite itself
 // sees from a failing disk.
 
-#ifndef KARST_TESTS_RELIABILITY_FAULT_VFS_H_
-#define KARST_TESTS_RELIABILITY_FAULT_VFS_H_
+#ifndef KARST_TESTS_SUPPORT_FAULT_VFS_H_
+#define KARST_TESTS_SUPPORT_FAULT_VFS_H_
 
 #include <string>
 #include <vector>
 
-namespace karst_reliability {
+namespace karst_test {
 
 namespace io {
 constexpr unsigned kWrite = 1;
 constexpr unsigned kSync = 2;
 constexpr unsigned kTruncate = 4;
-constexpr unsigned kAll = kWrite | kSync | kTruncate;
+constexpr unsigned kRead = 8;
+constexpr unsigned kChanges = kWrite | kSync | kTruncate;
 }  // namespace io
 
 struct IoFault {
@@ -25,11 +27,11 @@ struct IoFault {
   // truncate it is kExit.
   enum Action { kNone, kFail, kExit, kTornExit };
   Action action = kNone;
-  unsigned ops = io::kAll;  // which calls are counted
-  int nth = 1;              // from 1, among the counted calls since arming
-  bool persistent = false;  // also every counted call after the Nth
+  unsigned ops = io::kChanges;  // which calls are counted
+  int nth = 1;                  // from 1, among the counted calls since arming
+  bool persistent = false;      // also every counted call after the Nth
   // For kFail: the result the call returns instead of running. 0 picks the
-  // matching SQLITE_IOERR_* code (write, fsync or truncate).
+  // matching SQLITE_IOERR_* code (write, fsync, truncate or read).
   int code = 0;
   int exitCode = 77;  // for kExit and kTornExit
 };
@@ -41,15 +43,14 @@ class FaultVfs {
   // Replaces the armed fault and restarts the count.
   static void Arm(const IoFault& fault);
   static void Disarm() { Arm(IoFault{}); }
-  // Counted calls since the last Arm, and how many of them failed.
-  static int Count();
+  // Counted calls since the last Arm that failed.
   static int Failed();
-  // "write wal", "sync db", ... for every counted call since the last Arm;
+  // "write wal", "read db", ... for every counted call since the last Arm;
   // only kept while "keep" is set, for finding the calls of one operation.
   static void KeepLog(bool keep);
   static std::vector<std::string> Log();
 };
 
-}  // namespace karst_reliability
+}  // namespace karst_test
 
-#endif  // KARST_TESTS_RELIABILITY_FAULT_VFS_H_
+#endif  // KARST_TESTS_SUPPORT_FAULT_VFS_H_

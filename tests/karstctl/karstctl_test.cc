@@ -1,0 +1,291 @@
+// karstctl end to end: the built binary against a store file of its own.
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "Child.h"
+#include "Files.h"
+#include "Records.h"
+
+#ifndef KARSTCTL_BINARY
+#error "KARSTCTL_BINARY must name the built karstctl"
+#endif
+
+namespace karst_test {
+namespace {
+
+using TavoKarst::KarstLib;
+using ::testing::HasSubstr;
+
+struct ToolResult {
+  int status;  // exit status; 128 + signal number when killed
+  std::string out, err;
+};
+
+// Each test has an empty store in its own folder; the library in this process
+// and any karstctl run without --store use it too.
+class Karstctl : public ::testing::Test {
+ protected:
+  void SetUp() override { UseStoreAt(store_); }
+  void TearDown() override { unsetenv("TAVO_CONFIGSTORE_PATH"); }
+
+  // Runs karstctl with "args" and "input" on stdin; stdout comes back through
+  // the child's result pipe unless "outPath" takes it. Killed after a minute.
+  ToolResult RunTool(std::vector<std::string> args, const std::string& input = "",
+                     const char* outPath = nullptr) {
+    WriteFile(dir_.File("stdin"), input);
+    const ChildResult child = RunChild(
+        [&](int resultFd) {
+          dup2(open(dir_.File("stdin").c_str(), O_RDONLY), 0);
+          dup2(outPath ? open(outPath, O_WRONLY) : resultFd, 1);
+          dup2(open(dir_.File("stderr").c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600), 2);
+          std::vector<char*> argv = {const_cast<char*>(KARSTCTL_BINARY)};
+          for (std::string& arg : args) argv.push_back(arg.data());
+          argv.push_back(nullptr);
+          execv(argv[0], argv.data());
+          _exit(126);
+        },
+        60);
+    return {child.exited ? child.code : 128 + child.code, child.output,
+            ReadFile(dir_.File("stderr"))};
+  }
+  ToolResult Run(std::vector<std::string> args, const std::string& input = "") {
+    args.insert(args.begin(), {"--store", store_});
+    return RunTool(args, input);
+  }
+  // A command that must succeed quietly; its stdout.
+  std::string Ok(const std::vector<std::string>& args, const std::string& input = "") {
+    const ToolResult result = Run(args, input);
+    EXPECT_EQ(result.status, 0) << result.err;
+    EXPECT_EQ(result.err, "");
+    return result.out;
+  }
+
+  ScratchDir dir_;
+  std::string store_ = dir_.File("store.db");
+};
+
+// A failure is one line on stderr, "karstctl: ..." and nothing on stdout.
+void ExpectFailure(const ToolResult& result, int status, const std::string& fragment) {
+  EXPECT_EQ(result.status, status);
+  EXPECT_THAT(result.err, ::testing::MatchesRegex("karstctl: [^\n]*\n"));
+  EXPECT_THAT(result.err, HasSubstr(fragment));
+  EXPECT_EQ(result.out, "");
+}
+
+// Exactly as export prints it: NUL, JSON escapes and UTF-8 as plain strings,
+// bytes that are not UTF-8 (FF 00 FE 01, a surrogate) as base64, and the
+// 64-bit number that has no positive twin. Which bytes are UTF-8 the encoding
+// test decides.
+const char kCatalogue[] = R"({
+  "policies": [
+    {
+      "name": "gold\u0000nul",
+      "policy_id": "p-gold",
+      "description": "café \"q\" \\ \n\t\u0001",
+      "generation_number": -9223372036854775808,
+      "blobs": [
+        {
+          "datastore_namespace": "CORRA",
+          "blob": {
+            "base64": "/wD+AQ=="
+          }
+        },
+        {
+          "datastore_namespace": "NFS",
+          "blob": "<nfs/>"
+        }
+      ]
+    }
+  ],
+  "datastores": [
+    {
+      "url": {
+        "base64": "7aCA"
+      },
+      "datastore_namespace": "NFS",
+      "drp_policy_id": "p-gold"
+    }
+  ]
+}
+)";
+
+TEST_F(Karstctl, ExportImportRoundTripIsByteExact) {
+  WriteFile(dir_.File("in.json"), kCatalogue);
+  Ok({"import", dir_.File("in.json")});
+  EXPECT_EQ(KarstLib::ListPolicyInfo(),
+            (std::vector<TavoKarst::KarstPolicyInfo>{
+                Policy(std::string("gold\0nul", 8), "p-gold",
+                       {{std::string("\xff\x00\xfe\x01", 4), "CORRA"}, {"<nfs/>", "NFS"}},
+                       "caf\xc3\xa9 \"q\" \\ \n\t\x01", INT64_MIN)}));
+  EXPECT_EQ(KarstLib::ListDatastoreInfo(),
+            std::vector<TavoKarst::KarstDatastoreInfo>{Datastore("\xed\xa0\x80", "NFS", "p-gold")});
+  EXPECT_EQ(Ok({"export"}), kCatalogue);
+  const auto hash = KarstLib::GetDbHash();
+  EXPECT_EQ(Ok({"hash"}), "{\n  \"policies\": \"" + hash.first + "\",\n  \"datastores\": \"" +
+                              hash.second + "\"\n}\n");
+
+  Ok({"reset"});
+  EXPECT_EQ(Ok({"export"}), "{\n  \"policies\": [],\n  \"datastores\": []\n}\n");
+}
+
+TEST_F(Karstctl, SetReplacesOneCatalogueAndImportOnlyThoseItHolds) {
+  // Missing fields take their defaults.
+  Ok({"policies", "set", "-"}, R"([{"name": "b", "generation_number": 9223372036854775807}])");
+  WriteFile(dir_.File("ds.json"), R"([{"url": "ds://z"}])");
+  Ok({"datastores", "set", dir_.File("ds.json")});
+  const std::string policies = Ok({"policies", "list"});
+  EXPECT_EQ(policies,
+            "[\n  {\n    \"name\": \"b\",\n    \"policy_id\": \"\",\n    \"description\": \"\",\n"
+            "    \"generation_number\": 9223372036854775807,\n    \"blobs\": []\n  }\n]\n");
+  EXPECT_EQ(Ok({"datastores", "list"}),
+            "[\n  {\n    \"url\": \"ds://z\",\n    \"datastore_namespace\": \"\",\n"
+            "    \"drp_policy_id\": \"\"\n  }\n]\n");
+
+  Ok({"import", "-"}, R"({"datastores": [{"url": "ds://new"}]})");
+  Ok({"import", "-"}, "{}");
+  EXPECT_EQ(Ok({"policies", "list"}), policies);
+  EXPECT_EQ(KarstLib::ListDatastoreInfo(),
+            std::vector<TavoKarst::KarstDatastoreInfo>{Datastore("ds://new", "", "")});
+  Ok({"policies", "set", "-"}, "[]");
+  EXPECT_EQ(Ok({"policies", "list"}), "[]\n");
+}
+
+TEST_F(Karstctl, BlobCommandsWriteTheRawBytesOrNothing) {
+  Ok({"import", "-"}, R"({
+    "policies": [
+      {"name": "gold", "policy_id": "p1",
+       "blobs": [{"datastore_namespace": "CORRA", "blob": {"base64": "AAr/Cg=="}},
+                 {"datastore_namespace": "NFS", "blob": "nfs-gold"}]},
+      {"name": "--store", "policy_id": "p2",
+       "blobs": [{"datastore_namespace": "CORRA", "blob": "dashes"}]}
+    ],
+    "datastores": [{"url": "ds://nfs", "datastore_namespace": "NFS", "drp_policy_id": "p1"}]})");
+  const std::pair<std::vector<std::string>, std::string> cases[] = {
+      {{"blob", "corra-by-id", "p1"}, std::string("\x00\n\xff\n", 4)},
+      {{"blob", "corra-by-name", "gold"}, std::string("\x00\n\xff\n", 4)},
+      {{"blob", "corra-by-name", "--store"}, "dashes"},  // operands are never options
+      {{"blob", "by-id", "p1", "ds://nfs"}, "nfs-gold"},
+      {{"blob", "default", "ds://nfs"}, "nfs-gold"},
+      {{"blob", "by-id", "p2", "ds://nfs"}, ""},  // finding nothing is no error
+  };
+  for (const auto& [args, bytes] : cases) EXPECT_EQ(Ok(args), bytes) << args[1];
+}
+
+TEST_F(Karstctl, StoreIsTheOptionElseTheEnvironment) {
+  const std::string other = dir_.File("other.db");
+  UseStoreAt(other);
+  EXPECT_EQ(RunTool({"import", "-"}, R"({"policies": [{"name": "env"}]})").status, 0);
+  EXPECT_THAT(RunTool({"--store=" + other, "policies", "list"}).out, HasSubstr("env"));
+  EXPECT_EQ(RunTool({"--store", store_, "policies", "list"}).out, "[]\n");
+}
+
+// Every rejected command line or input exits 2 naming what is wrong, and
+// leaves the store file as it was, byte for byte.
+TEST_F(Karstctl, BadCommandLinesAndInputsExitTwoAndLeaveTheStoreAlone) {
+  Ok({"import", "-"}, R"({"policies": [{"name": "kept"}], "datastores": [{"url": "kept"}]})");
+  const std::string before = ReadFile(store_);
+  const std::string file = dir_.File("bad.json");
+  WriteFile(file, "{\n  \"policies\": [\n    {\"name\": \"x\",}\n  ]\n}\n");
+  const std::vector<std::string> imp = {"import", "-"}, pset = {"policies", "set", "-"};
+  struct Case {
+    std::vector<std::string> args;  // after --store
+    std::string input;
+    std::string fragment;
+  };
+  const Case cases[] = {
+      {{}, "", "missing command"},
+      {{"--store"}, "", "--store needs a PATH"},
+      {{"--store=", "hash"}, "", "--store needs a non-empty PATH"},
+      {{"--colour", "hash"}, "", "unknown option '--colour'"},
+      {{"policies", "drop"}, "", "unknown command 'policies drop'"},
+      {{"blob", "by-id", "p1"}, "", "'blob by-id' needs POLICY_ID URL"},
+      {{"hash", "now"}, "", "too many arguments for 'hash'"},
+      {{"import", dir_.File("none")}, "", "cannot open " + dir_.File("none") + ": No such file"},
+      {{"import", dir_.Path()}, "", "cannot read " + dir_.Path()},
+      // Control bytes and bytes that are not UTF-8 keep the message on one line.
+      {{"import", "no\nsuch\xff"}, "", "cannot open no?such?: "},
+      // Text that is not JSON: the source, line and column.
+      {{"import", file}, "", "karstctl: " + file + ":3:18: syntax error while parsing object key"},
+      {pset, "[{\"name\": \"a\"}", "karstctl: <stdin>:1:15: "},
+      {{"datastores", "set", "-"}, "", "<stdin>:1:1: "},
+      {imp, "{\"policies\": [{\"name\": \"\xc0\x80\"}]}", "<stdin>:1:25: "},
+      {imp, "{} {}", "<stdin>:1:4: "},
+      {pset, "[\n  {\"generation_number\": 1e999}]", "<stdin>:2:29: number overflow"},
+      {imp, R"({"policies": [{"name": "a", "blobs": [], "name": "b"}]})",
+       "<stdin>: duplicate key \"name\""},
+      {imp, R"({"policies": [], "policies": []})", "duplicate key \"policies\""},
+      // Records that are not valid: the source, the record and the field.
+      {imp, R"({"policies": [{}, {"generation_number": 9223372036854775808}]})",
+       "karstctl: <stdin>: policies[1].generation_number: out of the signed 64-bit range"},
+      {pset, R"([{"generation_number": -9223372036854775809}])", "out of the signed 64-bit range"},
+      {pset, R"([{"generation_number": 18446744073709551616}])", "out of the signed 64-bit range"},
+      {pset, R"([{"generation_number": 1e30}])", "out of the signed 64-bit range"},
+      {pset, R"([{"generation_number": 1.5}])",
+       "policies[0].generation_number: expected an integer"},
+      {pset, R"([{"generation_number": "5"}])", "expected an integer, got string"},
+      {imp, "[]", "<stdin>: top level: expected object, got array"},
+      {imp, R"({"policies": [], "pollicies": []})", "top level: unknown key \"pollicies\""},
+      {imp, R"({"datastores": null})", "datastores: expected array, got null"},
+      {pset, R"({"policies": []})", "policies: expected array, got object"},
+      {pset, R"([{}, 7])", "policies[1]: expected object, got number"},
+      {pset, R"([{"name": "a", "colour": "red"}])", "policies[0]: unknown key \"colour\""},
+      {pset, R"([{"blobs": {}}])", "policies[0].blobs: expected array, got object"},
+      {pset, R"([{"blobs": [{}, {"blob": "a", "ns": "b"}]}])",
+       "policies[0].blobs[1]: unknown key \"ns\""},
+      {pset, R"([{"name": 5}])",
+       "policies[0].name: expected a string or {\"base64\": \"...\"}, got number"},
+      {pset, R"([{"name": {}}])", "policies[0].name: missing \"base64\""},
+      {pset, R"([{"name": {"base64": "AA==", "hex": "00"}}])",
+       "policies[0].name: unknown key \"hex\""},
+      {pset, R"([{"name": {"base64": 5}}])", "policies[0].name.base64: expected a string"},
+      {pset, R"([{"blobs": [{"blob": {"base64": "AB=="}}]}])",
+       "policies[0].blobs[0].blob.base64: invalid base64"},
+      {{"datastores", "set", "-"},
+       R"([{"url": "u"}, {"drp_policy_id": ["p"]}])",
+       "datastores[1].drp_policy_id: expected a string"},
+      // Good policies stay out when the datastores beside them are bad.
+      {imp, R"({"policies": [], "datastores": [{"url": "u", "policy": "p"}]})",
+       "datastores[0]: unknown key \"policy\""},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.fragment);
+    ExpectFailure(Run(c.args, c.input), 2, c.fragment);
+    ASSERT_EQ(ReadFile(store_), before);
+  }
+}
+
+TEST_F(Karstctl, StoreErrorsExitOneAndBadInputIsFoundFirst) {
+  const std::string garbage = dir_.File("garbage.db");
+  WriteFile(garbage, std::string(8192, 'G'));
+  ExpectFailure(RunTool({"--store", dir_.Path(), "export"}), 1, "karstctl: store error ");
+  ExpectFailure(RunTool({"--store", garbage, "reset"}), 1, "karstctl: store error ");
+  ExpectFailure(RunTool({"--store", garbage, "import", "-"}, "["), 2, "<stdin>:1:2: ");
+  EXPECT_EQ(ReadFile(garbage), std::string(8192, 'G'));
+}
+
+TEST_F(Karstctl, UnwritableOutputExitsOne) {
+  Ok({"import", "-"},
+     R"({"policies": [{"policy_id": "p", "blobs": [{"datastore_namespace": "CORRA", "blob": "b"}]}]})");
+  const std::vector<std::string> commands[] = {
+      {"--store", store_, "export"}, {"--store", store_, "blob", "corra-by-id", "p"}, {"--help"}};
+  for (const auto& args : commands) {
+    ExpectFailure(RunTool(args, "", "/dev/full"), 1, "cannot write standard output");
+  }
+}
+
+TEST_F(Karstctl, HelpAndVersionNeedNoStore) {
+  const ToolResult help = RunTool({"--store", dir_.Path(), "--help"});
+  EXPECT_EQ(help.status, 0);
+  EXPECT_THAT(help.out, HasSubstr("\n  blob corra-by-name "));
+  EXPECT_EQ(RunTool({"--store", dir_.Path(), "--version"}).out, "karstctl 1.0.0\n");
+}
+
+}  // namespace
+}  // namespace karst_test

@@ -1,0 +1,490 @@
+// The configuration store: what both backends share, run against each, then
+// the SQLite backend's own behaviour (other connections and their locks,
+// rollbacks SQLite makes by itself, foreign and damaged files, objects read
+// lazily from their stored bytes) and the default store's cached connection.
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include <atomic>
+#include <chrono>
+#include <climits>
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <memory>
+#include <random>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "FaultVfs.h"
+#include "Files.h"
+#include "RawSqlite.h"
+#include "TavoConfigStore/ConfigStore.h"
+
+namespace TavoConfigStore {
+namespace {
+
+using karst_test::RawDb;
+using ::testing::ElementsAre;
+using ::testing::ElementsAreArray;
+
+// An object, or a filter, with that identifier.
+template <typename T = ConfigStoreObject>
+std::shared_ptr<T> Obj(const std::string& key = "", const std::string& group = "",
+                       const std::string& component = "", const std::string& instance = "") {
+  return std::make_shared<T>(ConfigStoreObjectId(key, group, component, instance));
+}
+const auto Filter = [](const auto&... parts) { return Obj<FilterSpecObject>(parts...); };
+
+void Set(ConfigStore& store, const std::shared_ptr<ConfigStoreObject>& object) {
+  std::int32_t flags = 0;
+  store.SetObject(object, flags);
+}
+
+// The whole of an object, every byte in order, for exact comparisons.
+std::string Describe(const ConfigStoreObject& o) {
+  const ConfigStoreObjectId& id = o.Id();
+  std::string out = id.Key() + "|" + id.Group() + "|" + id.Component() + "|" + id.InstanceId();
+  auto values = [&out](const StoreObject& s) {
+    for (const StoreValue& v : s.Values()) {
+      const auto* str = std::get_if<std::string>(&v.value);
+      out += " " + v.name + (str ? "=s" + *str : "=i" + std::to_string(std::get<1>(v.value)));
+    }
+  };
+  values(o);
+  for (const SubObjectEntry& e : o.SubObjects()) {
+    out += " [" + e.id.Array() + "/" + e.id.Key();
+    values(*e.object);
+  }
+  return out;
+}
+
+// The store's whole state, in order.
+std::vector<std::string> Dump(ConfigStore& store) {
+  std::vector<std::string> out;
+  for (const auto& o : store.GetObjects(Filter())) out.push_back(Describe(*o));
+  return out;
+}
+
+// The instance ids the filter lists, in order.
+std::vector<std::string> List(ConfigStore& store,
+                              const std::shared_ptr<FilterSpecObject>& f = Filter()) {
+  std::vector<std::string> out;
+  for (const auto& o : store.GetObjects(f)) out.push_back(o->Id().InstanceId());
+  return out;
+}
+
+// The code of the ConfigStoreException "f" throws, or 0 when it returns.
+template <typename F>
+std::int32_t CodeOf(F&& f) {
+  try {
+    f();
+  } catch (const ConfigStoreException& e) {
+    return e.Code();
+  }
+  return 0;
+}
+
+class StoreConformance : public ::testing::TestWithParam<std::string> {
+ protected:
+  void SetUp() override {
+    store_ = GetParam() == "memory" ? NewMemoryStore() : NewSqliteStore(dir_.File("store.db"));
+  }
+
+  karst_test::ScratchDir dir_;
+  std::shared_ptr<ConfigStore> store_;  // closed before the folder goes
+};
+
+// "read" answers GetValue as "written" would, each value of either type.
+void ExpectValuesAs(const StoreObject& read, const StoreObject& written) {
+  for (const StoreValue& v : written.Values()) {
+    std::string s;
+    long long n = 0;
+    const bool isString = v.value.index() == 0;
+    EXPECT_EQ(read.GetValue(v.name.c_str(), &s), isString) << v.name;
+    EXPECT_EQ(read.GetValue(v.name.c_str(), &n), !isString) << v.name;
+    EXPECT_TRUE(v.value == (isString ? decltype(v.value)(s) : n)) << v.name;
+  }
+}
+
+// "read" answers every accessor as "written" does: in place first, then whole.
+void ExpectReadsAs(const ConfigStoreObject& read, const ConfigStoreObject& written) {
+  ExpectValuesAs(read, written);
+  for (const SubObjectEntry& e : written.SubObjects()) {
+    const auto sub = read.GetSubObject(e.id);
+    ASSERT_NE(sub, nullptr) << e.id.Array() << "/" << e.id.Key();
+    ExpectValuesAs(*sub, *e.object);
+    EXPECT_EQ(read.GetSubObjectInstances(Filter(e.id.Array())).size(),
+              written.GetSubObjectInstances(Filter(e.id.Array())).size());
+  }
+  EXPECT_EQ(read.GetSubObjectInstances(nullptr).size(), written.SubObjects().size());
+  EXPECT_EQ(Describe(read), Describe(written));
+}
+
+TEST_P(StoreConformance, ValuesAndSubObjectsRoundTripByteExact) {
+  std::string big(1 << 20, '\0');
+  for (std::size_t i = 0; i < big.size(); ++i) big[i] = static_cast<char>((i * 131 + 7) % 256);
+  const ConfigStoreObjectId id(std::string("k\0\xff", 3), "g\xc3\x28", "c", std::string("i\0", 2));
+  auto o = std::make_shared<ConfigStoreObject>(id);
+  o->SetValue("empty", std::string());
+  o->SetValue("bytes", std::string("a\0\xff\xfe\x80\x00", 6));
+  o->SetValue("big", big);
+  o->SetValue("min", static_cast<long long>(LLONG_MIN));
+  o->SetValue("max", static_cast<long long>(LLONG_MAX));
+  o->SetValue("kind", std::string("was a string"));
+  o->SetValue("kind", -1LL);  // changes kind, keeps its place
+  // More sub-objects than are built when an object is read.
+  for (int i = 0; i < 20; ++i) {
+    auto sub = o->CreateSubObject(SubObjectId(i % 3 ? "blobs" : "other", "s" + std::to_string(i)));
+    sub->SetValue("blob", std::string(i, static_cast<char>(i)));
+    sub->SetValue("n", static_cast<long long>(-i));
+  }
+  o->CreateSubObject(SubObjectId(std::string("a\0", 2), "\xff"))->SetValue("v", big);
+  o->CreateSubObject(SubObjectId("blobs", "s2"))->SetValue("replaced", 1LL);  // in s2's place
+  Set(*store_, o);
+  // A neighbour that differs only after a NUL, and one with few sub-objects.
+  Set(*store_, Obj("k", id.Group(), "c", id.InstanceId()));
+  auto small = Obj(id.Key(), "g", "c", "small");
+  small->CreateSubObject(SubObjectId("blobs", "b"))->SetValue("v", big);
+  Set(*store_, small);
+
+  const auto read = store_->GetObject(id);
+  ASSERT_NE(read, nullptr);
+  ExpectReadsAs(*read, *o);
+  const auto listed = store_->GetObjects(Filter(id.Key()));
+  ASSERT_EQ(listed.size(), 2u);
+  ExpectReadsAs(*listed[0], *o);
+  ExpectReadsAs(*listed[1], *small);
+  std::string s;
+  EXPECT_FALSE(read->GetValue("byte", &s));                            // a prefix is another name
+  EXPECT_EQ(read->GetSubObject(SubObjectId("blobs", "s0")), nullptr);  // s0 is in "other"
+}
+
+TEST_P(StoreConformance, FiltersMatchInWriteOrder) {
+  for (const char* id : {"a/g/c/1", "a/g/c/2", "b/g/c/3", "a/h/c/4", "a/g/d/5", "a/g/c/", "b/g/c/7",
+                         "c/g/c/8", "c/g/c/9", "a/g/c/1"}) {  // rewriting "1" moves it to the end
+    const std::string s(id);
+    Set(*store_, Obj(s.substr(0, 1), s.substr(2, 1), s.substr(4, 1), s.substr(6)));
+  }
+  // Empty filter parts match anything; elsewhere the empty instance id is
+  // an identifier like any other.
+  const struct {
+    const char* parts[4];
+    std::vector<std::string> expected;
+  } cases[] = {
+      {{"", "", "", ""}, {"2", "3", "4", "5", "", "7", "8", "9", "1"}},
+      {{"a", "", "", ""}, {"2", "4", "5", "", "1"}},
+      {{"a", "g", "c", ""}, {"2", "", "1"}},
+      {{"a", "g", "c", "2"}, {"2"}},
+      {{"", "g", "c", ""}, {"2", "3", "", "7", "8", "9", "1"}},
+      {{"", "", "d", ""}, {"5"}},
+      {{"", "", "", "7"}, {"7"}},
+  };
+  for (const auto& c : cases) {
+    EXPECT_THAT(List(*store_, Filter(c.parts[0], c.parts[1], c.parts[2], c.parts[3])),
+                ElementsAreArray(c.expected));
+  }
+  EXPECT_NE(store_->GetObject(ConfigStoreObjectId("a", "g", "c", "")), nullptr);
+  EXPECT_EQ(store_->GetObject(ConfigStoreObjectId("b", "g", "c", "")), nullptr);
+
+  // Deletions take only what matches, with rows of other collections between.
+  store_->DeleteObjects(Filter("a", "g"));
+  store_->DeleteObjects(Filter("", "", "", "4"));
+  store_->DeleteObjects(Filter("c", "g", "c", "9"));
+  store_->DeleteObjects(Filter("none"));
+  Set(*store_, Obj("c", "g", "c", "late"));
+  EXPECT_THAT(List(*store_), ElementsAre("3", "7", "8", "late"));
+  store_->DeleteObjects(Filter());
+  EXPECT_THAT(List(*store_), ElementsAre());
+}
+
+TEST_P(StoreConformance, TransactionsCommitOrRestoreExactlyAndMisuseFails) {
+  for (const char* instance : {"1", "2", "3"}) {
+    auto o = Obj("k", "g", "c", instance);
+    o->SetValue("v", std::string(instance));
+    o->CreateSubObject(SubObjectId("arr", instance))->SetValue("n", 1LL);
+    Set(*store_, o);
+  }
+  const std::vector<std::string> before = Dump(*store_);
+  auto replaced = Obj("k", "g", "c", "1");
+  replaced->SetValue("v", std::string("replaced"));
+  for (const bool commit : {false, true}) {
+    store_->BeginTransaction();
+    Set(*store_, replaced);
+    store_->DeleteObjects(Filter("k", "g", "c", "2"));
+    Set(*store_, Obj("k", "g", "c", "4"));
+    // The transaction reads its own writes.
+    EXPECT_THAT(List(*store_), ElementsAre("3", "1", "4"));
+    if (commit) {
+      store_->CommitTransaction();
+    } else {
+      store_->AbortTransaction();
+      EXPECT_EQ(Dump(*store_), before);
+    }
+    store_->AbortTransaction();  // none open: does nothing
+  }
+  EXPECT_EQ(Describe(*store_->GetObject(replaced->Id())), Describe(*replaced));
+
+  // Misuse fails with its code and leaves an open transaction alone.
+  EXPECT_EQ(CodeOf([&] { store_->CommitTransaction(); }), kErrorNoTransaction);
+  store_->BeginTransaction();
+  Set(*store_, Obj("k", "g", "c", "inside"));
+  EXPECT_EQ(CodeOf([&] { store_->BeginTransaction(); }), kErrorNestedTransaction);
+  std::int32_t flags = 0;
+  EXPECT_EQ(CodeOf([&] { store_->SetObject(nullptr, flags); }), kErrorNullArgument);
+  EXPECT_EQ(CodeOf([&] { store_->DeleteObjects(nullptr); }), kErrorNullArgument);
+  EXPECT_EQ(CodeOf([&] { store_->GetObjects(nullptr); }), kErrorNullArgument);
+  store_->AbortTransaction();
+  EXPECT_THAT(List(*store_), ElementsAre("3", "1", "4"));
+}
+
+TEST_P(StoreConformance, ObjectsHandedOutAreCopies) {
+  auto make = [] {
+    auto o = Obj("k", "g", "c", "i");
+    o->SetValue("count", 1LL);
+    for (int i = 0; i < 20; ++i) o->CreateSubObject(SubObjectId("arr", std::to_string(i)));
+    return o;
+  };
+  auto written = make();
+  Set(*store_, written);
+  const std::vector<std::string> stored = Dump(*store_);
+  auto read = store_->GetObjects(Filter()).at(0);
+  const auto sub = read->GetSubObject(SubObjectId("arr", "1"));
+  // Changing what was written or read changes only that copy; what was read
+  // writes back whole.
+  auto expected = make();
+  for (const auto& changed : {written, read, expected}) {
+    changed->GetSubObject(SubObjectId("arr", "1"))->SetValue("n", 3LL);
+    changed->SetValue("count", std::string("now a string"));
+    changed->SetValue("late", 1LL);
+    changed->CreateSubObject(SubObjectId("arr", "2"))->SetValue("fresh", 1LL);
+  }
+  EXPECT_EQ(Dump(*store_), stored);
+  ExpectReadsAs(*read, *expected);
+  Set(*store_, read);
+  read.reset();
+  EXPECT_THAT(Dump(*store_), ElementsAre(Describe(*expected)));
+  // A sub-object outlives the object it came from and the store's copy.
+  store_->DeleteObjects(Filter());
+  long long n = 0;
+  EXPECT_TRUE(sub->GetValue("n", &n) && n == 3);
+}
+
+INSTANTIATE_TEST_SUITE_P(Backends, StoreConformance, ::testing::Values("memory", "sqlite"));
+
+std::shared_ptr<ConfigStoreObject> Sample(const std::string& instance, int subs = 2) {
+  auto o = Obj("pool", "storage", "tavo", instance);
+  o->SetValue("name", std::string("sample\0\xff", 8));
+  o->SetValue("size", -1234567890123LL);
+  for (int i = 0; i < subs; ++i) {
+    o->CreateSubObject(SubObjectId("blobs", "b" + std::to_string(i)))->SetValue("n", 0LL + i);
+  }
+  return o;
+}
+
+class SqliteStoreTest : public ::testing::Test {
+ protected:
+  std::string Path(const std::string& name = "store.db") const { return dir_.File(name); }
+
+  karst_test::ScratchDir dir_;
+};
+
+TEST_F(SqliteStoreTest, ConnectionsSeeOnlyCommittedWrites) {
+  auto writer = NewSqliteStore(Path("new/dirs/store.db"));
+  auto reader = NewSqliteStore(Path("new/dirs/store.db"));
+  Set(*writer, Sample("x"));
+  writer->BeginTransaction();
+  Set(*writer, Sample("y"));
+  writer->DeleteObjects(Filter("", "", "", "x"));
+  // The reader is not blocked by the open write and sees the state before it.
+  EXPECT_THAT(List(*reader), ElementsAre("x"));
+  writer->CommitTransaction();
+  EXPECT_THAT(List(*reader), ElementsAre("y"));
+  Set(*reader, Sample("from reader"));
+  EXPECT_THAT(List(*writer), ElementsAre("y", "from reader"));
+}
+
+TEST_F(SqliteStoreTest, WriterWaitsForAnotherConnectionsLock) {
+  auto store = NewSqliteStore(Path());
+  RawDb other(Path());
+  ASSERT_EQ(other.Exec("BEGIN IMMEDIATE"), SQLITE_OK);
+  std::thread release([&] {
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));
+    EXPECT_EQ(other.Exec("COMMIT"), SQLITE_OK);
+  });
+  const auto start = std::chrono::steady_clock::now();
+  const std::int32_t code = CodeOf([&] { store->BeginTransaction(); });
+  EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(250));
+  release.join();
+  ASSERT_EQ(code, 0);
+  Set(*store, Sample("after the wait"));
+  store->CommitTransaction();
+  EXPECT_THAT(List(*NewSqliteStore(Path())), ElementsAre("after the wait"));
+}
+
+// After an I/O error SQLite rolls the transaction back by itself. A write
+// after that would be committed alone at once, beyond the caller's Abort,
+// and a Commit reporting success would lose the earlier writes silently.
+TEST_F(SqliteStoreTest, RefusesToCarryOnAfterSqliteRolledBack) {
+  karst_test::FaultVfs::Install();
+  auto store = NewSqliteStore(Path());
+  Set(*store, Sample("kept"));
+  const auto before = Dump(*store);
+  auto big = Sample("big");
+  big->SetValue("fills the page cache", std::string(8 << 20, 'x'));
+  for (const bool commit : {true, false}) {
+    store->BeginTransaction();
+    Set(*store, Sample("lost"));
+    karst_test::FaultVfs::Arm({karst_test::IoFault::kFail, karst_test::io::kWrite, 1, true});
+    const std::int32_t failed = CodeOf([&] { Set(*store, big); });
+    karst_test::FaultVfs::Disarm();
+    ASSERT_EQ(failed & 0xff, SQLITE_IOERR) << failed;
+    EXPECT_EQ(CodeOf([&] { Set(*store, Sample("after")); }), SQLITE_ABORT_ROLLBACK);
+    EXPECT_EQ(CodeOf([&] { store->DeleteObjects(Filter()); }), SQLITE_ABORT_ROLLBACK);
+    if (commit) {
+      EXPECT_EQ(CodeOf([&] { store->CommitTransaction(); }), SQLITE_ABORT_ROLLBACK);
+      EXPECT_EQ(CodeOf([&] { store->CommitTransaction(); }), kErrorNoTransaction);
+    } else {
+      store->AbortTransaction();
+    }
+    EXPECT_EQ(Dump(*NewSqliteStore(Path())), before);
+  }
+  store->BeginTransaction();
+  Set(*store, Sample("next"));
+  store->CommitTransaction();
+  EXPECT_THAT(List(*store), ElementsAre("kept", "next"));
+}
+
+// Truncated, garbled and foreign files in general are refused at the
+// library's level; these are the store's own checks of its schema.
+TEST_F(SqliteStoreTest, RefusesFilesThatAreNotStoresAndLeavesThemAlone) {
+  NewSqliteStore(Path("future"));
+  karst_test::WriteFile(Path("random"), std::string(8192, 'Z'));
+  const struct {
+    const char* name;
+    const char* sql;
+    std::int32_t code;
+  } cases[] = {
+      {"random", "", SQLITE_NOTADB},
+      {"foreign-id", "PRAGMA application_id = 4242;", kErrorNotAStore},
+      {"foreign-version", "PRAGMA user_version = 7;", kErrorNotAStore},
+      {"future", "PRAGMA user_version = 2;", kErrorNotAStore},
+      {"no-table", "PRAGMA application_id = 1413568079; PRAGMA user_version = 1;", kErrorNotAStore},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    if (*c.sql) RawDb(Path(c.name), SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE).Exec(c.sql);
+    const std::string before = karst_test::ReadFile(Path(c.name));
+    for (int attempt = 0; attempt < 2; ++attempt) {  // nothing was half set up
+      EXPECT_EQ(CodeOf([&] { NewSqliteStore(Path(c.name)); }), c.code);
+    }
+    EXPECT_EQ(karst_test::ReadFile(Path(c.name)), before);
+    EXPECT_FALSE(std::filesystem::exists(Path(c.name) + "-wal"));
+  }
+}
+
+TEST_F(SqliteStoreTest, DamagedBodiesFailAsCorruptObjects) {
+  auto store = NewSqliteStore(Path());
+  const auto sample = Sample("s");
+  Set(*store, sample);
+  RawDb raw(Path());
+  raw.Exec("PRAGMA synchronous = OFF");
+  const std::string body = raw.QueryText("SELECT hex(body) FROM objects");  // two digits a byte
+  // How many of the two reads report the damage; both check the whole body.
+  auto reads = [&](const std::string& hex) {
+    EXPECT_EQ(raw.Exec("UPDATE objects SET body = X'" + hex + "'"), SQLITE_OK);
+    const int get = CodeOf([&] { store->GetObject(sample->Id()); });
+    const int list = CodeOf([&] { store->GetObjects(Filter()); });
+    EXPECT_TRUE((get == 0 || get == kErrorCorruptObject) &&
+                (list == 0 || list == kErrorCorruptObject))
+        << hex << ": " << get << ", " << list;
+    return (get != 0) + (list != 0);
+  };
+  std::vector<std::string> damaged = {
+      body + "00",
+      "02" + body.substr(2),                 // unknown format
+      "01FFFFFFFF0F",                        // more values than bytes
+      "0101016E0700",                        // unknown kind
+      "0101016E0080808080808080808080807F",  // a length wider than 64 bits
+      "0101016E01FFFFFFFFFFFFFFFFFFFF01",    // an eleven-byte integer
+      "0101016E01FFFFFFFFFFFFFFFFFF7F00",    // complete but for a too wide integer
+  };
+  for (std::size_t n = 0; n < body.size(); n += 2) damaged.push_back(body.substr(0, n));
+  for (const std::string& hex : damaged) EXPECT_EQ(reads(hex), 2) << hex;
+  // A failed listing left no read transaction open.
+  store->BeginTransaction();
+  store->AbortTransaction();
+
+  // Random damage either still decodes or is reported by both reads.
+  std::mt19937 rng(7);
+  int reported = 0;
+  for (int round = 0; round < 300; ++round) {
+    std::string hex = body;
+    hex[rng() % hex.size()] = "0123456789ABCDEF"[rng() % 16];
+    hex[rng() % hex.size()] = "0123456789ABCDEF"[rng() % 16];
+    const int r = reads(hex);
+    EXPECT_NE(r, 1) << hex;
+    reported += r != 0;
+  }
+  EXPECT_GT(reported, 0);
+  EXPECT_EQ(reads(body), 0);
+}
+
+// The lazily built parts of an object read from the store may be built by
+// several threads at once, each taking the lazy paths in another order.
+TEST_F(SqliteStoreTest, ThreadsMayReadOneObjectTogether) {
+  auto store = NewSqliteStore(Path());
+  const auto written = Sample("t", 40);
+  Set(*store, written);
+  const std::function<bool(const ConfigStoreObject&)> checks[] = {
+      [&](const ConfigStoreObject& o) { return Describe(o) == Describe(*written); },
+      [](const ConfigStoreObject& o) { return o.GetSubObjectInstances(nullptr).size() == 40; },
+      [](const ConfigStoreObject& o) {
+        std::string s;
+        return o.GetValue("name", &s) && s == std::string("sample\0\xff", 8);
+      },
+      [](const ConfigStoreObject& o) { return !!o.GetSubObject(SubObjectId("blobs", "b39")); },
+  };
+  for (int round = 0; round < 20; ++round) {
+    const auto read = store->GetObject(written->Id());
+    std::atomic<int> failures{0};
+    std::vector<std::thread> threads;
+    for (int t = 0; t < 4; ++t) {
+      threads.emplace_back([&, t] {
+        for (int k = 0; k < 4; ++k) failures += !checks[(t + k) % 4](*read);
+      });
+    }
+    for (auto& thread : threads) thread.join();
+    EXPECT_EQ(failures, 0);
+  }
+}
+
+// GetStore's per-thread connection follows TAVO_CONFIGSTORE_PATH. A
+// transaction open on it is abandoned when an exception unwinds past the
+// last handle given out, and kept when a handle is merely dropped.
+TEST_F(SqliteStoreTest, DefaultStoreAbandonsTransactionsOnlyWhenUnwinding) {
+  EXPECT_EQ(CodeOf([] { ConfigStore::GetStore("elsewhere"); }), kErrorUnknownNamespace);
+  karst_test::UseStoreAt(Path("a.db"));
+  try {
+    auto store = ConfigStore::GetStore(sGlobalNamespace);
+    store->BeginTransaction();
+    Set(*store, Sample("unwound"));
+    throw std::runtime_error("not a store error");
+  } catch (const std::runtime_error&) {
+  }
+  EXPECT_EQ(RawDb(Path("a.db")).Exec("BEGIN IMMEDIATE; ROLLBACK;"), SQLITE_OK);  // no lock held
+  ConfigStore::GetStore(sGlobalNamespace)->BeginTransaction();
+  Set(*ConfigStore::GetStore(sGlobalNamespace), Sample("kept"));
+  ConfigStore::GetStore(sGlobalNamespace)->CommitTransaction();
+  karst_test::UseStoreAt(Path("b.db"));
+  Set(*ConfigStore::GetStore(sGlobalNamespace), Sample("b"));
+  EXPECT_THAT(List(*NewSqliteStore(Path("a.db"))), ElementsAre("kept"));
+  EXPECT_THAT(List(*NewSqliteStore(Path("b.db"))), ElementsAre("b"));
+}
+
+}  // namespace
+}  // namespace TavoConfigStore
