@@ -87,6 +87,7 @@ TEST_F(WriteTest, AStoreErrorReachesTheCallerAsACopyAndOthersUnchanged) {
   store_->FailWith("SetObject", 2, [detail] { throw ConfigStoreException("", 517, detail); });
   try {
     KarstLib::AddPolicyInfo(kNew.policies);
+    ADD_FAILURE() << "nothing thrown";
   } catch (const ConfigStoreException& e) {
     EXPECT_EQ(e.Detail(), detail);
   }
@@ -96,6 +97,7 @@ TEST_F(WriteTest, AStoreErrorReachesTheCallerAsACopyAndOthersUnchanged) {
   store_->FailWith("DeleteObjects", 1, [] { throw Velk::Lib::VelkException("core"); });
   try {
     KarstLib::AddDatastoreInfo(kNew.datastores);
+    ADD_FAILURE() << "nothing thrown";
   } catch (const Velk::Lib::VelkException& e) {
     EXPECT_EQ(dynamic_cast<const ConfigStoreException*>(&e), nullptr) << "made a store error";
   }
