@@ -7,7 +7,6 @@
 #include <exception>
 #include <mutex>
 
-
 namespace TavoConfigStore {
 
 const std::string sGlobalNamespace = "global";

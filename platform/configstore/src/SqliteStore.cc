@@ -184,7 +184,8 @@ class SqliteStore final : public ConfigStore {
   }
 
   void DeleteObjects(const std::shared_ptr<FilterSpecObject>& filter) override {
-    if (!filter) throw ConfigStoreException(Where() + ": DeleteObjects of null", kErrorNullArgument);
+    if (!filter)
+      throw ConfigStoreException(Where() + ": DeleteObjects of null", kErrorNullArgument);
     std::lock_guard<std::mutex> lock(mu_);
     RefuseWriteAfterRollback();
     const unsigned shape = ShapeOf(filter->Id());
@@ -296,7 +297,6 @@ class SqliteStore final : public ConfigStore {
     inTransaction_ = sqlite3_get_autocommit(db_) == 0;
     if (rc != SQLITE_DONE) Fail("rolling back");
   }
-
 
  private:
   std::string Where() const { return "configuration store " + path_; }
