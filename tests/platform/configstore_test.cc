@@ -118,8 +118,11 @@ void ExpectReadsAs(const ConfigStoreObject& read, const ConfigStoreObject& writt
     const auto sub = read.GetSubObject(e.id);
     ASSERT_NE(sub, nullptr) << e.id.Array() << "/" << e.id.Key();
     ExpectValuesAs(*sub, *e.object);
-    EXPECT_EQ(read.GetSubObjectInstances(Filter(e.id.Array())).size(),
-              written.GetSubObjectInstances(Filter(e.id.Array())).size());
+    // A filter's key selects the array, its instance id the sub-object's key.
+    for (const auto& f : {Filter(e.id.Array()), Filter("", "", "", e.id.Key()),
+                          Filter(e.id.Array(), "", "", e.id.Key())}) {
+      EXPECT_EQ(read.GetSubObjectInstances(f).size(), written.GetSubObjectInstances(f).size());
+    }
   }
   EXPECT_EQ(read.GetSubObjectInstances(nullptr).size(), written.SubObjects().size());
   EXPECT_EQ(Describe(read), Describe(written));
