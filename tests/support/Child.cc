@@ -2,6 +2,7 @@
 
 #include <poll.h>
 #include <signal.h>
+#include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -81,8 +82,12 @@ ChildResult RunChild(const std::function<void(int resultFd)>& body, double timeo
   }
   std::cout.flush();
   std::cerr.flush();
+  const pid_t parent = getpid();
   const pid_t pid = fork();
   if (pid == 0) {
+    // A child must not outlive a test that was killed (a timeout, say).
+    prctl(PR_SET_PDEATHSIG, SIGKILL);
+    if (getppid() != parent) _exit(4);
     close(fds[0]);
     RunInChild(body, fds[1]);
   }
