@@ -3,6 +3,8 @@
 #include <unistd.h>
 
 #include <cstdint>
+#include <set>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -284,6 +286,15 @@ TEST_F(Karstctl, HelpAndVersionNeedNoStore) {
   const ToolResult help = RunTool({"--store", dir_.Path(), "--help"});
   EXPECT_EQ(help.status, 0);
   EXPECT_THAT(help.out, HasSubstr("\n  blob corra-by-name "));
+  // Every command's summary starts in one column.
+  std::set<std::size_t> columns;
+  std::istringstream lines(help.out.substr(help.out.find("Commands:\n")));
+  std::string line;
+  for (std::getline(lines, line); std::getline(lines, line) && !line.empty();) {
+    columns.insert(line.find_first_not_of(' ', line.find("  ", 2)));
+  }
+  EXPECT_EQ(columns.size(), 1u) << help.out;
+  EXPECT_EQ(columns.count(std::string::npos), 0u) << help.out;
   EXPECT_EQ(RunTool({"--store", dir_.Path(), "--version"}).out, "karstctl 1.0.0\n");
 }
 
