@@ -20,42 +20,37 @@ using TavoConfigStore::SubObjectId;
 
 namespace {
 
-// A sub-object that reports its reads to the store that handed it out.
-class WatchedSub final : public StoreObject {
+// An object of type "Base" that reports its value reads to the store that
+// handed it out. It must not outlive the store.
+template <typename Base>
+class ReportsValueReads : public Base {
  public:
-  WatchedSub(FaultStore* store, const StoreObject& sub)
-      : StoreObject(sub.Values()), store_(store) {}
+  template <typename... Args>
+  explicit ReportsValueReads(FaultStore* store, Args&&... args)
+      : Base(std::forward<Args>(args)...), store_(store) {}
   bool GetValue(const char* name, std::string* value) const override {
     store_->OnCall("GetValue");
-    return StoreObject::GetValue(name, value);
+    return Base::GetValue(name, value);
   }
   bool GetValue(const char* name, long long* value) const override {
     store_->OnCall("GetValue");
-    return StoreObject::GetValue(name, value);
+    return Base::GetValue(name, value);
   }
 
- private:
+ protected:
   FaultStore* store_;
 };
 
 std::shared_ptr<StoreObject> WatchSub(FaultStore* store, const std::shared_ptr<StoreObject>& sub) {
-  return sub ? std::make_shared<WatchedSub>(store, *sub) : nullptr;
+  return sub ? std::make_shared<ReportsValueReads<StoreObject>>(store, sub->Values()) : nullptr;
 }
 
 // A copy of a stored object that reports its reads, and those of its
-// sub-objects, to the store that handed it out. It must not outlive the store.
-class WatchedObject final : public ConfigStoreObject {
+// sub-objects, to the store that handed it out.
+class WatchedObject final : public ReportsValueReads<ConfigStoreObject> {
  public:
   WatchedObject(FaultStore* store, const ConfigStoreObject& object)
-      : ConfigStoreObject(object.Id(), object.Values(), object.SubObjects()), store_(store) {}
-  bool GetValue(const char* name, std::string* value) const override {
-    store_->OnCall("GetValue");
-    return ConfigStoreObject::GetValue(name, value);
-  }
-  bool GetValue(const char* name, long long* value) const override {
-    store_->OnCall("GetValue");
-    return ConfigStoreObject::GetValue(name, value);
-  }
+      : ReportsValueReads(store, object.Id(), object.Values(), object.SubObjects()) {}
   std::shared_ptr<StoreObject> GetSubObject(const SubObjectId& id) const override {
     store_->OnCall("GetSubObject");
     return WatchSub(store_, ConfigStoreObject::GetSubObject(id));
@@ -68,9 +63,6 @@ class WatchedObject final : public ConfigStoreObject {
     for (auto& sub : out) sub = WatchSub(store_, sub);
     return out;
   }
-
- private:
-  FaultStore* store_;
 };
 
 std::function<void()> ThrowerFor(FaultKind kind) {

@@ -108,7 +108,6 @@ class ScopedFaultStore {
   ScopedFaultStore& operator=(const ScopedFaultStore&) = delete;
   FaultStore& operator*() const { return *store_; }
   FaultStore* operator->() const { return store_.get(); }
-  const std::shared_ptr<FaultStore>& Get() const { return store_; }
 
  private:
   std::shared_ptr<FaultStore> store_;
