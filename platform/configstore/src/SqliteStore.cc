@@ -43,8 +43,6 @@ constexpr int kSchemaVersion = 1;
 // writes several times as many pages. The cost is that the smallest write
 // puts 16 KiB pages into the log rather than 4 KiB ones.
 constexpr int kPageSize = 16384;
-// Other processes may hold the write lock for a while; wait rather than fail.
-constexpr int kBusyTimeoutMs = 10000;
 
 // A filter's shape: which identifier parts it constrains, one bit per part in
 // the order of the statement parameters ?1..?4.
@@ -89,7 +87,7 @@ struct OneShot {
 
 class SqliteStore final : public ConfigStore {
  public:
-  explicit SqliteStore(const std::string& path) : path_(path) {
+  SqliteStore(const std::string& path, const SqliteStoreOptions& options) : path_(path) {
     const std::filesystem::path parent = std::filesystem::path(path).parent_path();
     if (!parent.empty()) {
       std::error_code ec;
@@ -111,7 +109,7 @@ class SqliteStore final : public ConfigStore {
       Fail("cannot open");
     }
     sqlite3_extended_result_codes(db_, 1);
-    sqlite3_busy_timeout(db_, kBusyTimeoutMs);
+    sqlite3_busy_timeout(db_, options.busyTimeoutMs);
 
     // Takes effect only on a file without tables yet; an existing store
     // keeps the page size it was created with.
@@ -561,7 +559,12 @@ class SqliteStore final : public ConfigStore {
 }  // namespace
 
 std::shared_ptr<ConfigStore> NewSqliteStore(const std::string& path) {
-  return std::make_shared<SqliteStore>(path);
+  return std::make_shared<SqliteStore>(path, SqliteStoreOptions());
+}
+
+std::shared_ptr<ConfigStore> NewSqliteStore(const std::string& path,
+                                            const SqliteStoreOptions& options) {
+  return std::make_shared<SqliteStore>(path, options);
 }
 
 }  // namespace TavoConfigStore

@@ -26,8 +26,13 @@ extern CONFIGSTORE_EXPORT const std::string sGlobalNamespace;
 //  - An empty instance id is an ordinary identifier: it can be stored and
 //    fetched. In a filter, an empty part matches anything.
 //  - Inside a transaction the caller sees its own writes; AbortTransaction
-//    restores exactly the state at BeginTransaction. Begin while a transaction
-//    is open, and Commit without one, fail; Abort without one does nothing.
+//    restores exactly the state at BeginTransaction. Commit without a
+//    transaction fails; Abort without one does nothing.
+//  - Transactions nest: Begin while one is open starts an inner one (a
+//    savepoint). Committing the inner one keeps its writes as part of the
+//    outer one, aborting it undoes only its own writes; nothing is durable or
+//    visible to others until the outermost Commit. So a caller can bracket
+//    several operations that each begin and commit their own transaction.
 //  - Outside a transaction each write is committed at once.
 class CONFIGSTORE_EXPORT ConfigStore {
  public:
@@ -55,13 +60,30 @@ class CONFIGSTORE_EXPORT ConfigStore {
   virtual void AbortTransaction() = 0;
 };
 
+// How a SQLite store waits for another process's write lock.
+struct SqliteStoreOptions {
+  // A writer (and a reader during another's crash recovery) waits this long
+  // for the lock before failing with SQLITE_BUSY.
+  int busyTimeoutMs = 10000;
+};
+
 // Backends. Each call returns a new, independent connection.
+//
+// The SQLite store takes "path" literally (no URI, no ":memory:"). A store
+// that does not exist reads as empty and is created by the first write, with
+// missing directories made 0700 and the file, its -wal and -shm 0600 (the
+// umask may remove bits only). A path whose last component is a symbolic
+// link is refused. A file the process may read but not write is opened
+// read-only: reads work, writes fail with SQLite's SQLITE_READONLY.
 CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewSqliteStore(const std::string& path);
+CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewSqliteStore(const std::string& path,
+                                                               const SqliteStoreOptions& options);
 CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewMemoryStore();
 
 // $TAVO_CONFIGSTORE_PATH, else $XDG_STATE_HOME/tavo/configstore.db, else
-// $HOME/.local/state/tavo/configstore.db. Missing directories are created
-// when the store is opened, not here.
+// $HOME/.local/state/tavo/configstore.db (each of the last two only when the
+// variable holds an absolute path). Without any of them there is no default:
+// throws ConfigStoreException with kErrorNoStorePath rather than guess.
 CONFIGSTORE_EXPORT std::string DefaultStorePath();
 
 // Makes GetStore return "store" for the whole process (null restores the

@@ -33,8 +33,10 @@ enum StoreErrorCode : std::int32_t {
   kErrorNotAStore = 1002,          // a file that is not a store, or of an unknown schema version
   kErrorCorruptObject = 1003,      // an object whose stored encoding cannot be read
   kErrorNoTransaction = 1004,      // Commit or Abort with no open transaction
-  kErrorNestedTransaction = 1005,  // Begin while a transaction is open
+  kErrorNestedTransaction = 1005,  // no longer raised: transactions nest
   kErrorNullArgument = 1007,       // a null object or filter handed to an operation
+  kErrorNoStorePath = 1008,        // no store path given and no default to derive one from
+  kErrorSymlink = 1009,            // a store path that names a symbolic link
 };
 
 }  // namespace TavoConfigStore
