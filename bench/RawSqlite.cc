@@ -81,10 +81,14 @@ std::string ConnectionSettings::Describe() const {
 }
 
 ConnectionSettings StoreConnectionSettings() {
-  // Opening the store creates its file with the page size and journal mode it
-  // keeps there; of the per-connection settings the store changes only
-  // synchronous, to FULL, and leaves the rest at SQLite's defaults.
-  TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace);
+  // The first write creates the store file with the page size and journal
+  // mode it keeps there; of the per-connection settings that bear on speed
+  // the store changes only synchronous, to FULL, and leaves the rest at
+  // SQLite's defaults (its log size limit acts when the last connection
+  // closes).
+  auto store = TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace);
+  store->BeginTransaction();
+  store->CommitTransaction();
   sqlite3* db = nullptr;
   if (sqlite3_open_v2(TavoConfigStore::DefaultStorePath().c_str(), &db, SQLITE_OPEN_READWRITE,
                       nullptr) != SQLITE_OK) {
