@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <chrono>
 #include <cstdint>
+#include <regex>
 #include <set>
 #include <sstream>
 #include <string>
@@ -14,6 +15,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include "Args.h"
 #include "Child.h"
 #include "Cli.h"
 #include "FaultVfs.h"
@@ -340,6 +342,25 @@ TEST_F(Karstctl, HelpAndVersionNeedNoStore) {
   EXPECT_EQ(columns.size(), 1u) << help.out;
   EXPECT_EQ(columns.count(std::string::npos), 0u) << help.out;
   EXPECT_EQ(RunTool({"--store", dir_.Path(), "--version"}).out, "karstctl 1.0.0\n");
+
+  // The help, the manual page and the completion know every command and option.
+  std::string man = ReadFile(KARSTCTL_SOURCE_DIR "/karstctl.1");
+  for (std::size_t at; (at = man.find("\\-")) != std::string::npos;) man.erase(at, 1);
+  const std::string completion = ReadFile(KARSTCTL_SOURCE_DIR "/karstctl.bash-completion");
+  std::vector<std::string> names = {"--store", "--wait", "--help", "--version"};
+  for (const auto& spec : karstctl::CommandTable()) {
+    names.push_back(spec.words[0] + (spec.words.size() > 1 ? " " + spec.words[1] : ""));
+    EXPECT_THAT(completion, HasSubstr(spec.words.back()));
+  }
+  for (const auto& name : names) {
+    EXPECT_THAT(help.out, HasSubstr("  " + name + " "));
+    // An entry of its own: ".TP", then ".B name", ".BI \"name ...", ".BR name ...".
+    EXPECT_TRUE(std::regex_search(man, std::regex("\\.TP\n\\.B[IR]? \"?" + name + "[ \"\n]")))
+        << name;
+    if (name[0] == '-') {
+      EXPECT_THAT(completion, HasSubstr(name + " "));
+    }
+  }
 }
 
 // Valid records the store would collapse, drop or leave dangling are
@@ -389,7 +410,7 @@ TEST_F(Karstctl, OptionsGoAnywhereAndEachCommandHasItsHelp) {
   const ToolResult group = RunTool({"--store", dir_.File("none.db"), "blob", "--help"});
   EXPECT_EQ(group.status, 0);
   EXPECT_EQ(std::count(group.out.begin(), group.out.end(), '\n'), 4 * 3 - 1) << group.out;
-  Ok({"import", "-"}, R"({"policies": [{"name": "-n", "policy_id": "p"}]})");
+  Ok({"policies", "set", "-"}, R"([{"name": "-n", "policy_id": "p"}])");
   EXPECT_THAT(RunTool({"policies", "list", "--store", store_}).out, HasSubstr("\"-n\""));
   EXPECT_EQ(RunTool({"export", "--store=" + store_, "--wait", "2.5"}).status, 0);
 }
