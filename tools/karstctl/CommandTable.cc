@@ -28,8 +28,7 @@ const std::vector<CommandSpec>& CommandTable() {
       {Command::kImport,
        {"import"},
        {"FILE|-"},
-       "replace each catalogue present in {\"policies\": [...], \"datastores\": [...]}, "
-       "all or none",
+       "replace each catalogue the file holds, as export prints them; all or none",
        StoreUse::kWrite},
       {Command::kExport,
        {"export"},

@@ -43,9 +43,9 @@ std::string HelpText() {
   out += line("", "else ~/.local/state/tavo/configstore.db");
   out += line("--wait SECONDS", "how long to wait for another process's write lock");
   out += line("", "(default 10, fractions allowed)");
-  out += line("--help", "print this help, or with a COMMAND that command's");
-  out += line("--", "ends the options: later words starting with - are operands");
+  out += line("--help", "print this help, or with a COMMAND that command's usage");
   out += line("--version", "print the version");
+  out += line("--", "ends the options: later words starting with - are operands");
   out +=
       "\n"
       "Options may come anywhere on the line.\n"
@@ -55,7 +55,8 @@ std::string HelpText() {
       "  datastore  {\"url\": S, \"datastore_namespace\": S, \"drp_policy_id\": S}\n"
       "S is a string standing for its UTF-8 bytes, or {\"base64\": \"...\"} for any bytes;\n"
       "output uses the base64 form only for bytes that are not valid UTF-8. I is a\n"
-      "signed 64-bit integer. A missing field is \"\", 0 or []; an unknown key is an error.\n"
+      "signed 64-bit integer. A missing field is \"\", 0 or []; an unknown or repeated key is\n"
+      "an error.\n"
       "A blob is written raw with nothing added; finding none prints nothing.\n"
       "Reading commands fail when there is no store; writing ones create it. Writing\n"
       "commands and check warn about records the store would collapse, drop or leave\n"
