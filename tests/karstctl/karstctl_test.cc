@@ -384,7 +384,8 @@ TEST_F(Karstctl, WritesWarnAboutRecordsTheStoreCollapses) {
       "datastores[1].drp_policy_id \"p3\" names no policy in the file\n" + w +
       "datastores[2].url is empty; look-ups by url cannot find it\n";
   const std::string none = dir_.File("none.db");
-  for (const auto& args : {std::vector<std::string>{"import", "-"}, {"check", "-"}}) {
+  for (const auto& args : {std::vector<std::string>{"check", "-"}, {"import", "-"}}) {
+    EXPECT_NE(access(none.c_str(), F_OK), 0) << "check opened the store";
     const ToolResult result = RunTool({"--store", none, args[0], args[1]}, file);
     EXPECT_EQ(result.status, 0);
     EXPECT_EQ(result.err, warnings);
