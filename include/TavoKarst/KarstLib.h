@@ -43,8 +43,10 @@ struct KarstDatastoreInfo {
 // it before returning; nothing is kept between calls, and no set-up is needed.
 //
 // Errors are exceptions; the library raises none of its own. Store failures
-// arrive as TavoConfigStore::ConfigStoreException with the store's message
-// and code. Exceptions of any other type (std::bad_alloc, say) pass unchanged.
+// arrive as TavoConfigStore::ConfigStoreException (declared in
+// "TavoConfigStore/ConfigStoreException.h", a Velk::Lib::VelkException) with
+// the store's message and code. Exceptions of any other type (std::bad_alloc,
+// say) pass unchanged.
 class KARST_EXPORT KarstLib {
  public:
   KarstLib() = delete;
@@ -107,6 +109,9 @@ class KARST_EXPORT KarstLib {
   // Two CRC-32 digests in lower-case hex: first over the policies, second
   // over the datastores; "" for an empty catalogue. Independent of the order
   // in which the store lists records. Throws what the listings throw.
+  // Blind spots: fields are joined without separators, a NUL ends a name, id
+  // or description, and numbers carry no leading zeros, so some changes keep
+  // the digest; compare the listings where every change must count.
   static std::pair<std::string, std::string> GetDbHash();
 };
 

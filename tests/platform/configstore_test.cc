@@ -6,6 +6,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sqlite3.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <chrono>
@@ -29,6 +31,8 @@ namespace TavoConfigStore {
 namespace {
 
 using karst_test::RawDb;
+using karst_test::ReadFile;
+using karst_test::WriteFile;
 using ::testing::ElementsAre;
 using ::testing::ElementsAreArray;
 
@@ -236,13 +240,38 @@ TEST_P(StoreConformance, TransactionsCommitOrRestoreExactlyAndMisuseFails) {
   EXPECT_EQ(CodeOf([&] { store_->CommitTransaction(); }), kErrorNoTransaction);
   store_->BeginTransaction();
   Set(*store_, Obj("k", "g", "c", "inside"));
-  EXPECT_EQ(CodeOf([&] { store_->BeginTransaction(); }), kErrorNestedTransaction);
   std::int32_t flags = 0;
   EXPECT_EQ(CodeOf([&] { store_->SetObject(nullptr, flags); }), kErrorNullArgument);
   EXPECT_EQ(CodeOf([&] { store_->DeleteObjects(nullptr); }), kErrorNullArgument);
   EXPECT_EQ(CodeOf([&] { store_->GetObjects(nullptr); }), kErrorNullArgument);
   store_->AbortTransaction();
   EXPECT_THAT(List(*store_), ElementsAre("3", "1", "4"));
+}
+
+// An inner transaction's abort undoes its own writes only; its commit keeps
+// them for the outer one to commit or abort.
+TEST_P(StoreConformance, TransactionsNest) {
+  Set(*store_, Obj("k", "g", "c", "before"));
+  for (const bool commitOuter : {false, true}) {
+    store_->BeginTransaction();
+    Set(*store_, Obj("k", "g", "c", "outer"));
+    store_->BeginTransaction();
+    Set(*store_, Obj("k", "g", "c", "undone"));
+    store_->DeleteObjects(Filter("k", "g", "c", "before"));
+    store_->AbortTransaction();
+    store_->BeginTransaction();
+    Set(*store_, Obj("k", "g", "c", "inner"));
+    store_->CommitTransaction();
+    EXPECT_THAT(List(*store_), ElementsAre("before", "outer", "inner"));
+    if (commitOuter) {
+      store_->CommitTransaction();
+    } else {
+      store_->AbortTransaction();
+      EXPECT_THAT(List(*store_), ElementsAre("before"));
+    }
+  }
+  EXPECT_EQ(CodeOf([&] { store_->CommitTransaction(); }), kErrorNoTransaction);
+  EXPECT_THAT(List(*store_), ElementsAre("before", "outer", "inner"));
 }
 
 TEST_P(StoreConformance, ObjectsHandedOutAreCopies) {
@@ -311,8 +340,92 @@ TEST_F(SqliteStoreTest, ConnectionsSeeOnlyCommittedWrites) {
   EXPECT_THAT(List(*writer), ElementsAre("y", "from reader"));
 }
 
+// The catalogue is private whatever the umask: directories the store makes
+// 0700, the file and its -wal and -shm 0600.
+TEST_F(SqliteStoreTest, NewStoreIsPrivateUnderAnyUmask) {
+  for (const mode_t mask : {022, 0}) {
+    const mode_t old = umask(mask);
+    const std::string top = Path("u" + std::to_string(mask)), path = top + "/a/store.db";
+    Set(*NewSqliteStore(path), Sample("x"));
+    umask(old);
+    for (const auto& [file, mode] : {std::pair{top, 0700},
+                                     {top + "/a", 0700},
+                                     {path, 0600},
+                                     {path + "-wal", 0600},
+                                     {path + "-shm", 0600}}) {
+      struct stat st {};
+      ASSERT_EQ(stat(file.c_str(), &st), 0) << file;
+      EXPECT_EQ(st.st_mode & 07777, static_cast<mode_t>(mode)) << file << " umask " << mask;
+    }
+  }
+}
+
+// Reading a store nobody has written finds it empty and creates nothing; a
+// write creates it.
+TEST_F(SqliteStoreTest, ReadsOfAMissingStoreCreateNothing) {
+  auto store = NewSqliteStore(Path("missing/store.db"));
+  EXPECT_TRUE(store->GetObjects(Filter()).empty());
+  EXPECT_EQ(store->GetObject(Sample("x")->Id()), nullptr);
+  EXPECT_FALSE(std::filesystem::exists(Path("missing")));
+  Set(*store, Sample("x"));
+  EXPECT_THAT(List(*NewSqliteStore(Path("missing/store.db"))), ElementsAre("x"));
+}
+
+// A link at the store's name (or its log's) is refused, the target untouched:
+// in a shared folder it would let another user choose where the catalogue
+// goes. Other names are taken literally, never as a URI or in-memory store.
+TEST_F(SqliteStoreTest, PathIsALiteralFileNeverALink) {
+  WriteFile(Path("target"), "theirs");
+  for (const auto& [link, store] : {std::pair{"link.db", "link.db"},
+                                    {"dangling.db", "dangling.db"},
+                                    {"log.db-wal", "log.db"}}) {
+    const std::string target = link == std::string("dangling.db") ? Path("none") : Path("target");
+    ASSERT_EQ(symlink(target.c_str(), Path(link).c_str()), 0);
+    EXPECT_EQ(CodeOf([&] { Set(*NewSqliteStore(Path(store)), Sample("x")); }), kErrorSymlink)
+        << link;
+  }
+  EXPECT_EQ(ReadFile(Path("target")), "theirs");
+  EXPECT_FALSE(std::filesystem::exists(Path("none")));
+
+  const std::string cwd = std::filesystem::current_path();
+  std::filesystem::current_path(dir_.Path());
+  for (const std::string name : {":memory:", "file:x.db?mode=memory"}) {
+    Set(*NewSqliteStore(name), Sample(name));
+    EXPECT_THAT(List(*NewSqliteStore(Path(name))), ElementsAre(name));
+  }
+  std::filesystem::current_path(cwd);
+}
+
+// Without a path and without a home there is no default: a store in the
+// current folder would be a different, empty catalogue each time.
+TEST(DefaultStorePathTest, FromTheEnvironmentOrNot) {
+  struct Case {
+    const char *explicitPath, *state, *home, *expected;  // expected null: throws
+  };
+  const Case cases[] = {{"/p/s.db", "/st", "/h", "/p/s.db"},
+                        {"rel.db", nullptr, nullptr, "rel.db"},
+                        {"", "/st", "/h", "/st/tavo/configstore.db"},
+                        {nullptr, "st", "/h", "/h/.local/state/tavo/configstore.db"},
+                        {nullptr, nullptr, "h", nullptr},
+                        {nullptr, "", "", nullptr}};
+  for (const Case& c : cases) {
+    const std::pair<const char*, const char*> vars[] = {
+        {"TAVO_CONFIGSTORE_PATH", c.explicitPath}, {"XDG_STATE_HOME", c.state}, {"HOME", c.home}};
+    for (const auto& [name, value] : vars) {
+      value ? setenv(name, value, 1) : unsetenv(name);
+    }
+    if (c.expected) {
+      EXPECT_EQ(DefaultStorePath(), c.expected);
+    } else {
+      EXPECT_EQ(CodeOf([] { DefaultStorePath(); }), kErrorNoStorePath);
+    }
+  }
+}
+
 TEST_F(SqliteStoreTest, WriterWaitsForAnotherConnectionsLock) {
   auto store = NewSqliteStore(Path());
+  store->BeginTransaction();  // creates the store
+  store->CommitTransaction();
   RawDb other(Path());
   ASSERT_EQ(other.Exec("BEGIN IMMEDIATE"), SQLITE_OK);
   std::thread release([&] {

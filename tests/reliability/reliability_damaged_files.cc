@@ -56,7 +56,7 @@ class DamagedFileTest : public ::testing::Test {
     UseStoreAt(good_);
     TavoConfigStore::SetGlobalStore(TavoConfigStore::NewSqliteStore(good_));
     StoreCatalogue({PoliciesFor(kGood), DatastoresFor(kGood)});
-    TavoConfigStore::SetGlobalStore(nullptr);  // closes: one file, no log
+    TavoConfigStore::SetGlobalStore(nullptr);  // closes: the file, an empty log and its index
     bytes_ = ReadFile(good_);
   }
 
@@ -96,8 +96,10 @@ TEST_F(DamagedFileTest, TruncatedGarbledAndForeignFiles) {
   for (const auto& [name, path] : cases) {
     const std::string before = std::filesystem::is_regular_file(path) ? ReadFile(path) : "";
     const std::string outcome = Probe(path);
-    refused += outcome == "refused";
-    EXPECT_EQ(outcome, "refused") << name;
+    // No store can be under a file: reads find none, the write is refused.
+    const bool underFile = path == good_ + "/store.db";
+    refused += outcome == (underFile ? "empty looked-up refused" : "refused");
+    EXPECT_EQ(outcome, underFile ? "empty looked-up refused" : "refused") << name;
     // A file the store refuses is left as it was.
     EXPECT_TRUE(before.empty() || ReadFile(path) == before) << name;
   }
@@ -168,8 +170,8 @@ TEST_F(DamagedFileTest, DamagedLog) {
 }
 
 // Permissions only bind a user that is not root: the cases run as "nobody".
-// Either the store is refused with an error naming the file, or it lists
-// intact and only the write is refused.
+// Each case either lists intact and only the write is refused, or is refused
+// with an error naming the file.
 TEST_F(DamagedFileTest, UnreadableAndReadOnlyPaths) {
   const passwd* nobody = getuid() == 0 ? getpwnam("nobody") : getpwuid(getuid());
   if (nobody == nullptr) GTEST_SKIP() << "no user \"nobody\" to run the permission cases as";
@@ -181,27 +183,32 @@ TEST_F(DamagedFileTest, UnreadableAndReadOnlyPaths) {
   struct Case {
     const char* folder;
     mode_t folderMode, fileMode;  // 0: a store to be created
-    bool readable;                // the listing may work
+    bool withLog;                 // the -wal and -shm a writer leaves, readable as the file
+    const char* outcome;
   };
-  // In "closed" there is no room for the log next to the file.
-  const Case cases[] = {{"noread", 0777, 0000, false},
-                        {"readonly", 0777, 0444, true},
-                        {"closed", 0555, 0666, true},
-                        {"locked", 0700, 0666, false},
-                        {"closed/new", 0, 0, false}};
+  // In "closed" there is no room for the log next to the file; "shared" is
+  // a store others may read but not write, as an operator would set it up.
+  const Case cases[] = {{"noread", 0777, 0000, false, "refused"},
+                        {"readonly", 0777, 0444, false, "intact looked-up refused"},
+                        {"closed", 0555, 0666, false, "refused"},
+                        {"locked", 0700, 0666, false, "refused"},
+                        {"shared", 0755, 0644, true, "intact looked-up refused"},
+                        {"closed/new", 0, 0, false, "empty looked-up refused"}};
   int wrong = 0;
   std::string detail;
   for (const Case& c : cases) {
     const std::string folder = dir_.File(c.folder), path = folder + "/store.db";
     if (c.folderMode != 0) {
       std::filesystem::create_directories(folder);
-      std::filesystem::copy_file(good_, path);
-      chmod(path.c_str(), c.fileMode);
+      for (const char* suffix : {"", "-wal", "-shm"}) {
+        if (*suffix != '\0' && !c.withLog) continue;
+        std::filesystem::copy_file(good_ + suffix, path + suffix);
+        chmod((path + suffix).c_str(), c.fileMode);
+      }
       chmod(folder.c_str(), c.folderMode);
     }
     const std::string outcome = Probe(path, becomeUser);
-    const bool right =
-        outcome == "refused" || (c.readable && outcome == "intact looked-up refused");
+    const bool right = outcome == c.outcome;
     wrong += !right;
     EXPECT_TRUE(right) << c.folder << ": " << outcome;
     detail += "; " + std::string(c.folder) + ": " + outcome;

@@ -98,8 +98,13 @@ std::string DefaultStorePath() {
   const char* state = std::getenv("XDG_STATE_HOME");
   if (state != nullptr && *state == '/') return std::string(state) + "/tavo/configstore.db";
   const char* home = std::getenv("HOME");
-  std::string base = (home != nullptr && *home != '\0') ? home : ".";
-  return base + "/.local/state/tavo/configstore.db";
+  if (home != nullptr && *home == '/')
+    return std::string(home) + "/.local/state/tavo/configstore.db";
+  // A store in whatever directory the process happens to run in would be a
+  // different, empty catalogue each time.
+  throw ConfigStoreException(
+      "configuration store: no store path: set TAVO_CONFIGSTORE_PATH, XDG_STATE_HOME or HOME",
+      kErrorNoStorePath);
 }
 
 }  // namespace TavoConfigStore

@@ -2,8 +2,8 @@
 
 #include <map>
 #include <mutex>
-#include <optional>
 #include <tuple>
+#include <vector>
 
 #include "TavoConfigStore/ConfigStore.h"
 
@@ -74,27 +74,24 @@ class MemoryStore final : public ConfigStore {
 
   void BeginTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    if (saved_) {
-      throw ConfigStoreException("configuration store: a transaction is already open",
-                                 kErrorNestedTransaction);
-    }
-    saved_ = state_;
+    saved_.push_back(state_);
   }
 
+  // An inner commit keeps its writes in the enclosing transaction.
   void CommitTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    if (!saved_) {
+    if (saved_.empty()) {
       throw ConfigStoreException("configuration store: no transaction to commit",
                                  kErrorNoTransaction);
     }
-    saved_.reset();
+    saved_.pop_back();
   }
 
   void AbortTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    if (!saved_) return;
-    state_ = std::move(*saved_);
-    saved_.reset();
+    if (saved_.empty()) return;
+    state_ = std::move(saved_.back());
+    saved_.pop_back();
   }
 
  private:
@@ -107,7 +104,7 @@ class MemoryStore final : public ConfigStore {
 
   std::mutex mu_;
   State state_;
-  std::optional<State> saved_;  // the state at BeginTransaction, while one is open
+  std::vector<State> saved_;  // the state at each open BeginTransaction, outermost first
 };
 
 }  // namespace

@@ -18,14 +18,24 @@
 // A file of zero bytes is what SQLite sees as an empty database, so it is
 // treated as a new, empty store and gets the schema. Any other file that does
 // not carry our application id and schema version is refused untouched.
+//
+// The file is the catalogue, so it is handled as a secret: created 0600 in
+// directories made 0700, never through a symbolic link, and not at all by a
+// reader (a store nobody wrote reads as empty). A process that may read but
+// not write it gets a read-only connection; for that SQLite needs the -wal
+// and -shm to exist already, so they are kept when the last connection
+// closes.
 
+#include <fcntl.h>
 #include <sqlite3.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <array>
-#include <filesystem>
+#include <cerrno>
+#include <cstring>
 #include <mutex>
 #include <string>
-#include <system_error>
 #include <utility>
 #include <vector>
 
@@ -87,76 +97,17 @@ struct OneShot {
 
 class SqliteStore final : public ConfigStore {
  public:
-  SqliteStore(const std::string& path, const SqliteStoreOptions& options) : path_(path) {
-    const std::filesystem::path parent = std::filesystem::path(path).parent_path();
-    if (!parent.empty()) {
-      std::error_code ec;
-      std::filesystem::create_directories(parent, ec);
-      if (ec) {
-        throw ConfigStoreException(
-            Where() + ": cannot create directory " + parent.string() + ": " + ec.message(),
-            SQLITE_CANTOPEN);
-      }
+  SqliteStore(const std::string& path, const SqliteStoreOptions& options)
+      : path_(path), options_(options) {
+    if (path.empty()) {
+      throw ConfigStoreException("configuration store: empty path", kErrorNoStorePath);
     }
-    const int rc =
-        sqlite3_open_v2(path.c_str(), &conn_.db,
-                        SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX, nullptr);
-    db_ = conn_.db;
-    if (rc != SQLITE_OK) {
-      if (conn_.db == nullptr) {
-        throw ConfigStoreException(Where() + ": cannot open: " + sqlite3_errstr(rc), rc);
-      }
-      Fail("cannot open");
-    }
-    sqlite3_extended_result_codes(db_, 1);
-    sqlite3_busy_timeout(db_, options.busyTimeoutMs);
-
-    // Takes effect only on a file without tables yet; an existing store
-    // keeps the page size it was created with.
-    ExecOnce(("PRAGMA page_size=" + std::to_string(kPageSize)).c_str(), "setting the page size");
-    begin_ = Prepare("BEGIN");
-    beginImmediate_ = Prepare("BEGIN IMMEDIATE");
-    commit_ = Prepare("COMMIT");
-    rollback_ = Prepare("ROLLBACK");
-
-    // Look first under a read lock, and only take the write lock when the
-    // schema has to be created; checking again under it settles a race with
-    // another process creating the same store.
-    Step(begin_, "reading the store header");
-    bool isNew;
-    try {
-      isNew = Inspect();
-    } catch (...) {
-      RollbackQuietly();
-      throw;
-    }
-    Step(commit_, "reading the store header");
-    if (isNew) {
-      Step(beginImmediate_, "creating the store");
-      try {
-        if (Inspect()) CreateSchema();
-      } catch (...) {
-        RollbackQuietly();
-        throw;
-      }
-      Step(commit_, "creating the store");
-    }
-    // Only now, once the file is known to be ours: switching to WAL rewrites
-    // the header. The mode is persistent, so this is a no-op after creation;
-    // should the file system refuse WAL, the store carries on in rollback mode.
-    ExecOnce("PRAGMA journal_mode=WAL", "setting the journal mode");
-    ExecOnce("PRAGMA synchronous=FULL", "setting the sync mode");
-
-    get_ = Prepare(
-        "SELECT body FROM objects WHERE key = ?1 AND grp = ?2 AND component = ?3 AND "
-        "instance = ?4");
-    put_ = Prepare(
-        "INSERT OR REPLACE INTO objects(key, grp, component, instance, body) "
-        "VALUES(?1, ?2, ?3, ?4, ?5)");
+    Open(false);
   }
 
   std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
     std::lock_guard<std::mutex> lock(mu_);
+    if (!Open(false)) return nullptr;
     Resetter reset(get_);
     BindId(get_, id, kAllParts);
     const int rc = sqlite3_step(get_);
@@ -174,7 +125,7 @@ class SqliteStore final : public ConfigStore {
     body.clear();
     codec::EncodeObject(*object, &body);
     std::lock_guard<std::mutex> lock(mu_);
-    RefuseWriteAfterRollback();
+    OpenForWriting();
     Resetter reset(put_);
     BindId(put_, object->Id(), kAllParts);
     Bind(put_, 5, body);
@@ -185,7 +136,7 @@ class SqliteStore final : public ConfigStore {
     if (!filter)
       throw ConfigStoreException(Where() + ": DeleteObjects of null", kErrorNullArgument);
     std::lock_guard<std::mutex> lock(mu_);
-    RefuseWriteAfterRollback();
+    OpenForWriting();
     const unsigned shape = ShapeOf(filter->Id());
     sqlite3_stmt*& s = deletes_[shape];
     if (s == nullptr) {
@@ -214,12 +165,13 @@ class SqliteStore final : public ConfigStore {
       const std::shared_ptr<FilterSpecObject>& filter) override {
     if (!filter) throw ConfigStoreException(Where() + ": GetObjects of null", kErrorNullArgument);
     std::lock_guard<std::mutex> lock(mu_);
+    std::vector<std::shared_ptr<ConfigStoreObject>> out;
+    if (!Open(false)) return out;
     const unsigned shape = ShapeOf(filter->Id());
     // Outside a transaction, an explicit read transaction pins one snapshot
     // for the whole listing.
     const bool ownRead = sqlite3_get_autocommit(db_) != 0;
     if (ownRead) Step(begin_, "starting a read");
-    std::vector<std::shared_ptr<ConfigStoreObject>> out;
     try {
       sqlite3_stmt* s = ListStatement(filter->Id(), shape);
       if (s != nullptr) {
@@ -248,55 +200,255 @@ class SqliteStore final : public ConfigStore {
     return out;
   }
 
+  // The outermost transaction is SQLite's; each one begun inside it is a
+  // savepoint, so an inner abort undoes only its own writes.
   void BeginTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    if (inTransaction_) {
-      throw ConfigStoreException(Where() + ": a transaction is already open",
-                                 kErrorNestedTransaction);
+    if (depth_ > 0) {
+      RefuseWriteAfterRollback();
+      Step(savepoint_, "starting a nested transaction");
+      ++depth_;
+      return;
     }
+    OpenForWriting();
     // IMMEDIATE takes the write lock now, so a writer waits here (busy
     // timeout) instead of failing on its first write with a stale snapshot.
     Step(beginImmediate_, "starting a transaction");
-    inTransaction_ = true;
+    depth_ = 1;
   }
 
   void CommitTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    if (!inTransaction_) {
+    if (depth_ == 0) {
       throw ConfigStoreException(Where() + ": no transaction to commit", kErrorNoTransaction);
     }
     if (sqlite3_get_autocommit(db_)) {
       // SQLite rolled back by itself after an error (full disk, I/O error):
-      // the caller's writes are gone and must not be reported as committed.
-      inTransaction_ = false;
+      // the caller's writes, at every level, are gone and must not be
+      // reported as committed.
+      depth_ = 0;
       throw ConfigStoreException(
           Where() + ": the transaction was rolled back after an earlier error; nothing committed",
           SQLITE_ABORT_ROLLBACK);
     }
+    if (depth_ > 1) {
+      Step(release_, "ending a nested transaction");
+      --depth_;
+      return;
+    }
     Resetter reset(commit_);
     if (sqlite3_step(commit_) != SQLITE_DONE) {
       // A failed COMMIT may leave the transaction open (then Abort ends it).
-      inTransaction_ = sqlite3_get_autocommit(db_) == 0;
+      depth_ = sqlite3_get_autocommit(db_) == 0 ? 1 : 0;
       Fail("committing");
     }
-    inTransaction_ = false;
+    depth_ = 0;
   }
 
   void AbortTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    if (!inTransaction_) return;
+    if (depth_ == 0) return;
     // SQLite may already have rolled back by itself; there is nothing left.
     if (sqlite3_get_autocommit(db_)) {
-      inTransaction_ = false;
+      depth_ = 0;
+      return;
+    }
+    if (depth_ > 1) {
+      Step(rollbackTo_, "undoing a nested transaction");
+      Step(release_, "undoing a nested transaction");
+      --depth_;
       return;
     }
     Resetter reset(rollback_);
     const int rc = sqlite3_step(rollback_);
-    inTransaction_ = sqlite3_get_autocommit(db_) == 0;
+    depth_ = sqlite3_get_autocommit(db_) == 0 ? 1 : 0;
     if (rc != SQLITE_DONE) Fail("rolling back");
   }
 
  private:
+  // Connects to the store file when there is one; with "create", makes it
+  // first. False when there is none and "create" is not set: a reader of a
+  // store nobody has written yet sees it empty, and leaves nothing behind.
+  bool Open(bool create) {
+    if (db_ != nullptr) return true;
+    if (!Exists(path_)) {
+      if (!create) return false;
+      CreateFile();
+    }
+    Connect();
+    return true;
+  }
+
+  void OpenForWriting() {
+    Open(true);
+    RefuseWriteAfterRollback();
+    if (depth_ == 0 && sqlite3_db_readonly(db_, "main") == 1) {
+      throw ConfigStoreException(
+          Where() + ": opened read-only (no write permission on the file or its directory)",
+          SQLITE_READONLY);
+    }
+  }
+
+  // Whether something is at "file" that is not a symbolic link: following a
+  // link planted in a shared directory would write the catalogue wherever
+  // its owner chose.
+  bool Exists(const std::string& file) const {
+    struct stat st {};
+    if (lstat(file.c_str(), &st) == 0) {
+      if (S_ISLNK(st.st_mode)) {
+        throw ConfigStoreException(
+            Where() + ": " + file + " is a symbolic link; the store does not follow links",
+            kErrorSymlink);
+      }
+      return true;
+    }
+    if (errno == ENOENT || errno == ENOTDIR) return false;
+    throw ConfigStoreException(Where() + ": cannot look up " + file + ": " + std::strerror(errno),
+                               SQLITE_CANTOPEN);
+  }
+
+  // Missing directories 0700 and the file 0600, whatever the umask allows:
+  // the catalogue is nobody else's to read. SQLite gives the -wal and -shm it
+  // creates the mode of the database file.
+  void CreateFile() {
+    std::string dir;
+    const std::size_t lastSlash = path_.rfind('/');
+    std::size_t at = 0;
+    while (lastSlash != std::string::npos && at < lastSlash) {
+      const std::size_t next = path_.find('/', at + 1);
+      dir = path_.substr(0, next);
+      at = next;
+      if (dir.empty() || dir.back() == '/') continue;  // "/" or "a//b"
+      if (mkdir(dir.c_str(), 0700) != 0 && errno != EEXIST) {
+        throw ConfigStoreException(
+            Where() + ": cannot create directory " + dir + ": " + std::strerror(errno),
+            SQLITE_CANTOPEN);
+      }
+    }
+    // Made under a name of its own and linked into place: closing a
+    // descriptor of the store file itself would drop the POSIX locks of any
+    // connection to it in this process (another thread may connect the
+    // moment the name appears), and link() never replaces what another
+    // process put there first.
+    std::string temp = path_ + ".new-XXXXXX";
+    const int fd = mkostemp(temp.data(), O_CLOEXEC);  // 0600
+    if (fd < 0) {
+      throw ConfigStoreException(Where() + ": cannot create: " + std::strerror(errno),
+                                 SQLITE_CANTOPEN);
+    }
+    close(fd);
+    const int linked = link(temp.c_str(), path_.c_str());
+    const int linkErrno = errno;
+    unlink(temp.c_str());
+    if (linked != 0 && linkErrno != EEXIST) {
+      throw ConfigStoreException(Where() + ": cannot create: " + std::strerror(linkErrno),
+                                 SQLITE_CANTOPEN);
+    }
+  }
+
+  // A relative name goes to SQLite as "./name": SQLite reads ":memory:" and,
+  // in some builds, "file:..." as something other than a file name.
+  std::string SqliteName() const { return path_[0] == '/' ? path_ : "./" + path_; }
+
+  void Connect() {
+    for (const char* suffix : {"-wal", "-shm"}) Exists(path_ + suffix);
+    // Without SQLITE_OPEN_CREATE: the file exists, and should it vanish
+    // meanwhile, SQLite must not make one with its own default mode.
+    Connection conn;
+    const int rc = sqlite3_open_v2(SqliteName().c_str(), &conn.db,
+                                   SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
+    if (conn.db == nullptr) {
+      throw ConfigStoreException(Where() + ": cannot open: " + sqlite3_errstr(rc), rc);
+    }
+    db_ = conn.db;
+    try {
+      if (rc != SQLITE_OK) Fail("cannot open");
+      Configure();
+    } catch (...) {
+      db_ = nullptr;  // closed with "conn"
+      throw;
+    }
+    std::swap(conn_.db, conn.db);
+  }
+
+  void Configure() {
+    sqlite3_extended_result_codes(db_, 1);
+    sqlite3_busy_timeout(db_, options_.busyTimeoutMs);
+    // The -wal and -shm stay when the last connection closes, so that a
+    // reader without write access to the directory can still open the
+    // store; the log is truncated at that close (journal_size_limit).
+    int persist = 1;
+    sqlite3_file_control(db_, "main", SQLITE_FCNTL_PERSIST_WAL, &persist);
+
+    // Takes effect only on a file without tables yet; an existing store
+    // keeps the page size it was created with.
+    ExecOnce(("PRAGMA page_size=" + std::to_string(kPageSize)).c_str(), "setting the page size");
+    begin_ = Prepare("BEGIN");
+    beginImmediate_ = Prepare("BEGIN IMMEDIATE");
+    commit_ = Prepare("COMMIT");
+    rollback_ = Prepare("ROLLBACK");
+    savepoint_ = Prepare("SAVEPOINT nested");
+    release_ = Prepare("RELEASE nested");
+    rollbackTo_ = Prepare("ROLLBACK TO nested");
+
+    // Look first under a read lock, and only take the write lock when the
+    // schema has to be created; checking again under it settles a race with
+    // another process creating the same store.
+    Step(begin_, "reading the store header");
+    bool isNew;
+    try {
+      isNew = Inspect();
+    } catch (...) {
+      RollbackQuietly();
+      throw;
+    }
+    Step(commit_, "reading the store header");
+    if (isNew) {
+      Step(beginImmediate_, "creating the store");
+      try {
+        if (Inspect()) CreateSchema();
+      } catch (...) {
+        RollbackQuietly();
+        throw;
+      }
+      Step(commit_, "creating the store");
+    }
+    // Only now, once the file is known to be ours: switching to WAL rewrites
+    // the header. The mode is persistent, so this is a no-op after creation;
+    // should the file system refuse WAL, the store carries on in rollback mode.
+    ExecOnce("PRAGMA journal_mode=WAL", "setting the journal mode");
+    ExecOnce("PRAGMA synchronous=FULL", "setting the sync mode");
+    ExecOnce("PRAGMA journal_size_limit=67108864", "setting the log size limit");
+
+    get_ = Prepare(
+        "SELECT body FROM objects WHERE key = ?1 AND grp = ?2 AND component = ?3 AND "
+        "instance = ?4");
+    put_ = Prepare(
+        "INSERT OR REPLACE INTO objects(key, grp, component, instance, body) "
+        "VALUES(?1, ?2, ?3, ?4, ?5)");
+    FollowStoreMode();
+  }
+
+  // SQLite gives a new -wal and -shm the mode of the store file; after a
+  // chmod of the file (to let a group read it, say) they follow it here, so
+  // that whoever may read the file may read the store.
+  void FollowStoreMode() const {
+    if (sqlite3_db_readonly(db_, "main") == 1) return;
+    struct stat store {};
+    if (stat(path_.c_str(), &store) != 0) return;
+    for (const char* suffix : {"-wal", "-shm"}) {
+      const std::string file = path_ + suffix;
+      struct stat st {};
+      if (lstat(file.c_str(), &st) != 0 || st.st_uid != geteuid() ||
+          (st.st_mode & 0777) == (store.st_mode & 0777)) {
+        continue;
+      }
+      // By name, not through a descriptor: closing one would drop this
+      // process's locks on the file. Never through a link.
+      fchmodat(AT_FDCWD, file.c_str(), store.st_mode & 0777, AT_SYMLINK_NOFOLLOW);
+    }
+  }
+
   std::string Where() const { return "configuration store " + path_; }
 
   // Once SQLite has rolled the caller's transaction back by itself (full
@@ -305,7 +457,7 @@ class SqliteStore final : public ConfigStore {
   // AbortTransaction could no longer undo it. Refused until the caller ends
   // the transaction.
   void RefuseWriteAfterRollback() const {
-    if (inTransaction_ && sqlite3_get_autocommit(db_)) {
+    if (depth_ > 0 && sqlite3_get_autocommit(db_)) {
       throw ConfigStoreException(
           Where() +
               ": the transaction was rolled back after an earlier error; nothing is "
@@ -542,11 +694,15 @@ class SqliteStore final : public ConfigStore {
   std::string path_;
   Connection conn_;
   sqlite3* db_ = nullptr;
-  bool inTransaction_ = false;  // between a successful Begin and Commit/Abort
+  SqliteStoreOptions options_;
+  int depth_ = 0;  // open transactions: 0, or 1 plus the savepoints inside it
   sqlite3_stmt* begin_ = nullptr;
   sqlite3_stmt* beginImmediate_ = nullptr;
   sqlite3_stmt* commit_ = nullptr;
   sqlite3_stmt* rollback_ = nullptr;
+  sqlite3_stmt* savepoint_ = nullptr;
+  sqlite3_stmt* release_ = nullptr;
+  sqlite3_stmt* rollbackTo_ = nullptr;
   sqlite3_stmt* get_ = nullptr;
   sqlite3_stmt* put_ = nullptr;
   std::array<sqlite3_stmt*, kShapes> selects_{};
