@@ -1,8 +1,12 @@
 // karstctl end to end: the built binary against a store file of its own.
 #include <fcntl.h>
+#include <sqlite3.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <chrono>
 #include <cstdint>
+#include <regex>
 #include <set>
 #include <sstream>
 #include <string>
@@ -11,8 +15,12 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include "Args.h"
 #include "Child.h"
+#include "Cli.h"
+#include "FaultVfs.h"
 #include "Files.h"
+#include "RawSqlite.h"
 #include "Records.h"
 
 #ifndef KARSTCTL_BINARY
@@ -172,7 +180,7 @@ TEST_F(Karstctl, BlobCommandsWriteTheRawBytesOrNothing) {
   const std::pair<std::vector<std::string>, std::string> cases[] = {
       {{"blob", "corra-by-id", "p1"}, std::string("\x00\n\xff\n", 4)},
       {{"blob", "corra-by-name", "gold"}, std::string("\x00\n\xff\n", 4)},
-      {{"blob", "corra-by-name", "--store"}, "dashes"},  // operands are never options
+      {{"blob", "corra-by-name", "--", "--store"}, "dashes"},  // -- ends the options
       {{"blob", "by-id", "p1", "ds://nfs"}, "nfs-gold"},
       {{"blob", "default", "ds://nfs"}, "nfs-gold"},
       {{"blob", "by-id", "p2", "ds://nfs"}, ""},  // finding nothing is no error
@@ -181,6 +189,7 @@ TEST_F(Karstctl, BlobCommandsWriteTheRawBytesOrNothing) {
 }
 
 TEST_F(Karstctl, StoreIsTheOptionElseTheEnvironment) {
+  Ok({"reset"});
   const std::string other = dir_.File("other.db");
   UseStoreAt(other);
   EXPECT_EQ(RunTool({"import", "-"}, R"({"policies": [{"name": "env"}]})").status, 0);
@@ -205,8 +214,16 @@ TEST_F(Karstctl, BadCommandLinesAndInputsExitTwoAndLeaveTheStoreAlone) {
       {{}, "", "missing command"},
       {{"--store"}, "", "--store needs a PATH"},
       {{"--store=", "hash"}, "", "--store needs a non-empty PATH"},
-      {{"--colour", "hash"}, "", "unknown option '--colour'"},
+      {{"hash", "--colour"}, "", "unknown option '--colour'"},
+      {{"--wait", "-1", "hash"}, "", "--wait needs a non-negative number of SECONDS, not '-1'"},
+      {{"hash", "--wait=1e3"}, "", "not '1e3'"},
+      {{"hash", "--wait"}, "", "--wait needs SECONDS"},
+      {{"blob"},
+       "",
+       "karstctl: missing subcommand: blob needs one of by-id, corra-by-id, "
+       "corra-by-name, default\n"},
       {{"policies", "drop"}, "", "unknown command 'policies drop'"},
+      {{"frob", "--help"}, "", "unknown command 'frob'"},
       {{"blob", "by-id", "p1"}, "", "'blob by-id' needs POLICY_ID URL"},
       {{"hash", "now"}, "", "too many arguments for 'hash'"},
       {{"import", dir_.File("none")}, "", "cannot open " + dir_.File("none") + ": No such file"},
@@ -216,13 +233,14 @@ TEST_F(Karstctl, BadCommandLinesAndInputsExitTwoAndLeaveTheStoreAlone) {
       // Text that is not JSON: the source, line and column.
       {{"import", file}, "", "karstctl: " + file + ":3:18: syntax error while parsing object key"},
       {pset, "[{\"name\": \"a\"}", "karstctl: <stdin>:1:15: "},
+      {{"check", "-"}, "{\"policies\": 1}", "<stdin>: policies: expected array, got number"},
       {{"datastores", "set", "-"}, "", "<stdin>:1:1: "},
       {imp, "{\"policies\": [{\"name\": \"\xc0\x80\"}]}", "<stdin>:1:25: "},
       {imp, "{} {}", "<stdin>:1:4: "},
       {pset, "[\n  {\"generation_number\": 1e999}]", "<stdin>:2:29: number overflow"},
       {imp, R"({"policies": [{"name": "a", "blobs": [], "name": "b"}]})",
-       "<stdin>: duplicate key \"name\""},
-      {imp, R"({"policies": [], "policies": []})", "duplicate key \"policies\""},
+       "<stdin>:1:42: duplicate key \"name\""},
+      {imp, "{\"policies\": [],\n \"policies\": []}", "<stdin>:2:2: duplicate key \"policies\""},
       // Records that are not valid: the source, the record and the field.
       {imp, R"({"policies": [{}, {"generation_number": 9223372036854775808}]})",
        "karstctl: <stdin>: policies[1].generation_number: out of the signed 64-bit range"},
@@ -263,18 +281,46 @@ TEST_F(Karstctl, BadCommandLinesAndInputsExitTwoAndLeaveTheStoreAlone) {
   }
 }
 
-TEST_F(Karstctl, StoreErrorsExitOneAndBadInputIsFoundFirst) {
-  const std::string garbage = dir_.File("garbage.db");
+// Store failures exit 1 in the store's words with the code's name; a read
+// where there is no store says just that and creates nothing.
+TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
+  const std::string garbage = dir_.File("garbage.db"), none = dir_.File("none.db");
   WriteFile(garbage, std::string(8192, 'G'));
-  ExpectFailure(RunTool({"--store", dir_.Path(), "export"}), 1, "karstctl: store error ");
-  ExpectFailure(RunTool({"--store", garbage, "reset"}), 1, "karstctl: store error ");
+  Ok({"reset"});
+  RawDb locker(store_);
+  ASSERT_EQ(locker.Exec("BEGIN IMMEDIATE"), SQLITE_OK);
+  const std::pair<std::vector<std::string>, std::string> cases[] = {
+      {{"--store", none, "export"}, "karstctl: no store at " + none + "\n"},
+      {{"blob", "default", "u", "--store", none}, "karstctl: no store at " + none + "\n"},
+      {{"--store", garbage + "/x.db", "hash"}, "karstctl: no store at " + garbage + "/x.db\n"},
+      {{"--store", dir_.Path(), "export"}, "(SQLITE_CANTOPEN, 14)\n"},
+      {{"--store", garbage, "reset"}, "(SQLITE_NOTADB, 26)\n"},
+      {{"--store", store_, "--wait", "0.2", "reset"},
+       "karstctl: configuration store " + store_ +
+           ": starting a transaction: database is locked (SQLITE_BUSY, 5)\n"},
+  };
+  for (const auto& [args, err] : cases) {
+    const auto start = std::chrono::steady_clock::now();
+    ExpectFailure(RunTool(args), 1, err);
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));  // not 10 s
+  }
+  EXPECT_NE(access(none.c_str(), F_OK), 0);
   ExpectFailure(RunTool({"--store", garbage, "import", "-"}, "["), 2, "<stdin>:1:2: ");
   EXPECT_EQ(ReadFile(garbage), std::string(8192, 'G'));
+
+  // Without a store path nor anything to derive one from, nothing is guessed.
+  std::vector<std::pair<std::string, std::string>> saved;
+  for (const char* name : {"TAVO_CONFIGSTORE_PATH", "XDG_STATE_HOME", "HOME"}) {
+    if (const char* value = getenv(name)) saved.emplace_back(name, value);
+    unsetenv(name);
+  }
+  ExpectFailure(RunTool({"export"}), 1, "(no store path, 1008)\n");
+  for (const auto& [name, value] : saved) setenv(name.c_str(), value.c_str(), 1);
 }
 
 TEST_F(Karstctl, UnwritableOutputExitsOne) {
   Ok({"import", "-"},
-     R"({"policies": [{"policy_id": "p", "blobs": [{"datastore_namespace": "CORRA", "blob": "b"}]}]})");
+     R"({"policies": [{"name": "n", "policy_id": "p", "blobs": [{"datastore_namespace": "CORRA", "blob": "b"}]}]})");
   const std::vector<std::string> commands[] = {
       {"--store", store_, "export"}, {"--store", store_, "blob", "corra-by-id", "p"}, {"--help"}};
   for (const auto& args : commands) {
@@ -296,6 +342,112 @@ TEST_F(Karstctl, HelpAndVersionNeedNoStore) {
   EXPECT_EQ(columns.size(), 1u) << help.out;
   EXPECT_EQ(columns.count(std::string::npos), 0u) << help.out;
   EXPECT_EQ(RunTool({"--store", dir_.Path(), "--version"}).out, "karstctl 1.0.0\n");
+
+  // The help, the manual page and the completion know every command and option.
+  std::string man = ReadFile(KARSTCTL_SOURCE_DIR "/karstctl.1");
+  for (std::size_t at; (at = man.find("\\-")) != std::string::npos;) man.erase(at, 1);
+  const std::string completion = ReadFile(KARSTCTL_SOURCE_DIR "/karstctl.bash-completion");
+  std::vector<std::string> names = {"--store", "--wait", "--help", "--version"};
+  for (const auto& spec : karstctl::CommandTable()) {
+    names.push_back(spec.words[0] + (spec.words.size() > 1 ? " " + spec.words[1] : ""));
+    EXPECT_THAT(completion, HasSubstr(spec.words.back()));
+  }
+  for (const auto& name : names) {
+    EXPECT_THAT(help.out, HasSubstr("  " + name + " "));
+    // An entry of its own: ".TP", then ".B name", ".BI \"name ...", ".BR name ...".
+    EXPECT_TRUE(std::regex_search(man, std::regex("\\.TP\n\\.B[IR]? \"?" + name + "[ \"\n]")))
+        << name;
+    if (name[0] == '-') {
+      EXPECT_THAT(completion, HasSubstr(name + " "));
+    }
+  }
+}
+
+// Valid records the store would collapse, drop or leave dangling are
+// written anyway, each with one warning; check finds the same without a store.
+TEST_F(Karstctl, WritesWarnAboutRecordsTheStoreCollapses) {
+  const std::string file = R"({"policies": [
+      {"name": "gold", "policy_id": "p1", "blobs": [{"datastore_namespace": "NFS"},
+          {"datastore_namespace": ""}, {"datastore_namespace": "NFS", "blob": "b"}]},
+      {"policy_id": "p1"}, {"name": "gold", "policy_id": "p2"}],
+    "datastores": [{"url": "u", "drp_policy_id": "p1"}, {"url": "u", "drp_policy_id": "p3"},
+                   {"drp_policy_id": ""}]})";
+  const std::string w = "karstctl: warning: ";
+  const std::string warnings =
+      w + "policies[0].blobs[1].datastore_namespace is empty; the store drops this blob\n" + w +
+      "policies[0].blobs[2].datastore_namespace \"NFS\" repeats policies[0].blobs[0]; the store "
+      "keeps only the last\n" +
+      w + "policies[1].name is empty; look-ups by name cannot find it\n" + w +
+      "policies[1].policy_id \"p1\" repeats policies[0]; look-ups by id find only one of them\n" +
+      w + "policies[2].name \"gold\" repeats policies[0]; the store keeps only the last\n" + w +
+      "datastores[1].url \"u\" repeats datastores[0]; the store keeps only the last\n" + w +
+      "datastores[1].drp_policy_id \"p3\" names no policy in the file\n" + w +
+      "datastores[2].url is empty; look-ups by url cannot find it\n";
+  const std::string none = dir_.File("none.db");
+  for (const auto& args : {std::vector<std::string>{"check", "-"}, {"import", "-"}}) {
+    EXPECT_NE(access(none.c_str(), F_OK), 0) << "check opened the store";
+    const ToolResult result = RunTool({"--store", none, args[0], args[1]}, file);
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.err, warnings);
+  }
+
+  // Without policies beside them, datastores are checked against the stored
+  // ones, and by check (which opens no store) not at all.
+  Ok({"policies", "set", "-"}, R"([{"name": "s", "policy_id": "p1"}])");
+  const std::string datastores = R"([{"url": "a", "drp_policy_id": "p1"},
+                                     {"url": "b", "drp_policy_id": "p9"}])";
+  const std::string dangling =
+      w + "datastores[1].drp_policy_id \"p9\" names no policy in the store\n";
+  EXPECT_EQ(Run({"datastores", "set", "-"}, datastores).err, dangling);
+  EXPECT_EQ(Run({"import", "-"}, "{\"datastores\": " + datastores + "}").err, dangling);
+  EXPECT_EQ(Run({"check", "-"}, "{\"datastores\": " + datastores + "}").err, "");
+  EXPECT_EQ(KarstLib::ListDatastoreInfo().size(), 2u);
+}
+
+TEST_F(Karstctl, OptionsGoAnywhereAndEachCommandHasItsHelp) {
+  EXPECT_EQ(RunTool({"blob", "corra-by-name", "--help"}).out,
+            "Usage: karstctl [OPTIONS] blob corra-by-name NAME\n"
+            "  CORRA blob of the policy named NAME\n");
+  const ToolResult group = RunTool({"--store", dir_.File("none.db"), "blob", "--help"});
+  EXPECT_EQ(group.status, 0);
+  EXPECT_EQ(std::count(group.out.begin(), group.out.end(), '\n'), 4 * 3 - 1) << group.out;
+  Ok({"policies", "set", "-"}, R"([{"name": "-n", "policy_id": "p"}])");
+  EXPECT_THAT(RunTool({"policies", "list", "--store", store_}).out, HasSubstr("\"-n\""));
+  EXPECT_EQ(RunTool({"export", "--store=" + store_, "--wait", "2.5"}).status, 0);
+}
+
+// However the disk fails while an import commits, the store holds both old
+// catalogues or both new ones, never new policies beside old datastores.
+TEST_F(Karstctl, ImportReplacesBothCataloguesOrNeitherAtEveryFailedSync) {
+  Ok({"import", "-"}, R"({"policies": [{"name": "old"}], "datastores": [{"url": "old"}]})");
+  const auto oldPolicies = KarstLib::ListPolicyInfo();
+  const auto oldDatastores = KarstLib::ListDatastoreInfo();
+  const std::string file = dir_.File("new.json");
+  WriteFile(file, R"({"policies": [{"name": "new"}], "datastores": [{"url": "new"}]})");
+  FaultVfs::Install();
+  int failures = 0;
+  for (int nth = 1;; ++nth) {
+    ASSERT_LT(nth, 100) << "the import never succeeded";
+    FaultVfs::Arm({IoFault::kFail, io::kSync, nth});
+    ::testing::internal::CaptureStderr();
+    const int status = karstctl::RunKarstctl({"--store", store_, "import", file});
+    const std::string err = ::testing::internal::GetCapturedStderr();
+    const bool fired = FaultVfs::Failed() > 0;
+    FaultVfs::Disarm();
+    if (status == 0) {
+      EXPECT_EQ(KarstLib::ListPolicyInfo(), std::vector{Policy("new", "", {}, "", 0)});
+      EXPECT_EQ(KarstLib::ListDatastoreInfo(), std::vector{Datastore("new", "", "")});
+      if (!fired) break;
+      Ok({"import", "-"}, R"({"policies": [{"name": "old"}], "datastores": [{"url": "old"}]})");
+      continue;
+    }
+    ++failures;
+    EXPECT_EQ(status, 1) << err;
+    EXPECT_THAT(err, HasSubstr("(SQLITE_IOERR"));
+    EXPECT_EQ(KarstLib::ListPolicyInfo(), oldPolicies) << "sync " << nth;
+    EXPECT_EQ(KarstLib::ListDatastoreInfo(), oldDatastores) << "sync " << nth;
+  }
+  EXPECT_GT(failures, 0);
 }
 
 }  // namespace

@@ -1,6 +1,10 @@
 #include "Args.h"
 
+#include <algorithm>
+#include <climits>
+#include <cmath>
 #include <cstddef>
+#include <cstdlib>
 
 #include "Errors.h"
 
@@ -10,125 +14,127 @@ namespace {
 
 constexpr char kSeeHelp[] = " (see karstctl --help)";
 
-std::string Join(const std::vector<std::string>& words) {
+std::string Join(const std::vector<std::string>& words, const std::string& separator = " ") {
   std::string out;
-  for (const auto& word : words) out += (out.empty() ? "" : " ") + word;
+  for (const auto& word : words) out += (out.empty() ? "" : separator) + word;
   return out;
 }
 
-bool StartsWith(const std::vector<std::string>& args, std::size_t at,
-                const std::vector<std::string>& words) {
-  if (args.size() - at < words.size()) return false;
+bool StartsWith(const std::vector<std::string>& args, const std::vector<std::string>& words) {
+  if (args.size() < words.size()) return false;
   for (std::size_t i = 0; i < words.size(); ++i) {
-    if (args[at + i] != words[i]) return false;
+    if (args[i] != words[i]) return false;
   }
   return true;
 }
 
-}  // namespace
-
-const std::vector<CommandSpec>& CommandTable() {
-  static const std::vector<CommandSpec> table = {
-      {Command::kReset, {"reset"}, {}, "clear both catalogues"},
-      {Command::kPoliciesSet,
-       {"policies", "set"},
-       {"FILE|-"},
-       "replace the policy catalogue with a JSON array of policies"},
-      {Command::kPoliciesList,
-       {"policies", "list"},
-       {},
-       "print the policy catalogue as a JSON array"},
-      {Command::kDatastoresSet,
-       {"datastores", "set"},
-       {"FILE|-"},
-       "replace the datastore catalogue with a JSON array of datastores"},
-      {Command::kDatastoresList,
-       {"datastores", "list"},
-       {},
-       "print the datastore catalogue as a JSON array"},
-      {Command::kImport,
-       {"import"},
-       {"FILE|-"},
-       "replace each catalogue present in {\"policies\": [...], \"datastores\": [...]}"},
-      {Command::kExport, {"export"}, {}, "print {\"policies\": [...], \"datastores\": [...]}"},
-      {Command::kBlobById,
-       {"blob", "by-id"},
-       {"POLICY_ID", "URL"},
-       "blob of the first policy POLICY_ID for datastore URL's namespace"},
-      {Command::kBlobCorraById,
-       {"blob", "corra-by-id"},
-       {"POLICY_ID"},
-       "CORRA blob of the first policy POLICY_ID"},
-      {Command::kBlobCorraByName,
-       {"blob", "corra-by-name"},
-       {"NAME"},
-       "CORRA blob of the policy named NAME"},
-      {Command::kBlobDefault,
-       {"blob", "default"},
-       {"URL"},
-       "blob of datastore URL's default policy for its namespace"},
-      {Command::kHash,
-       {"hash"},
-       {},
-       "print {\"policies\": \"<crc32>\", \"datastores\": \"<crc32>\"}"},
-  };
-  return table;
+// Digits with at most one '.', so "inf", "nan", "1e3" and "0x10" are refused
+// rather than read in some surprising way.
+int ParseWaitMs(const std::string& text) {
+  const bool valid = text.find_first_not_of("0123456789.") == std::string::npos &&
+                     std::count(text.begin(), text.end(), '.') <= 1 && text != "." && !text.empty();
+  if (!valid) {
+    throw UsageError("--wait needs a non-negative number of SECONDS, not '" + text + "'");
+  }
+  const double ms = std::strtod(text.c_str(), nullptr) * 1000;
+  return ms >= INT_MAX ? INT_MAX : static_cast<int>(std::lround(ms));
 }
+
+// The value of "--name VALUE" or "--name=VALUE" at args[at], or nullopt when
+// args[at] is not that option. Advances "at" past a separate value.
+std::optional<std::string> OptionValue(const std::vector<std::string>& args, std::size_t& at,
+                                       const std::string& name, const std::string& what) {
+  const std::string& arg = args[at];
+  if (arg.compare(0, name.size() + 1, name + "=") == 0) return arg.substr(name.size() + 1);
+  if (arg != name) return std::nullopt;
+  if (++at == args.size()) throw UsageError(name + " needs " + what + kSeeHelp);
+  return args[at];
+}
+
+// The group word ("blob") of commands named by two words.
+bool IsGroup(const std::string& word) {
+  for (const auto& spec : CommandTable()) {
+    if (spec.words.size() > 1 && spec.words[0] == word) return true;
+  }
+  return false;
+}
+
+std::vector<const CommandSpec*> SpecsStartingWith(const std::vector<std::string>& words) {
+  std::vector<const CommandSpec*> specs;
+  for (const auto& spec : CommandTable()) {
+    if (StartsWith(spec.words, words)) specs.push_back(&spec);
+  }
+  return specs;
+}
+
+const CommandSpec& MatchCommand(const std::vector<std::string>& words) {
+  if (words.empty()) throw UsageError(std::string("missing command") + kSeeHelp);
+  for (const auto& spec : CommandTable()) {
+    if (StartsWith(words, spec.words)) return spec;
+  }
+  if (IsGroup(words[0]) && words.size() == 1) {
+    std::vector<std::string> subcommands;
+    for (const CommandSpec* spec : SpecsStartingWith({words[0]})) {
+      subcommands.push_back(spec->words[1]);
+    }
+    throw UsageError("missing subcommand: " + words[0] + " needs one of " +
+                     Join(subcommands, ", "));
+  }
+  const std::string command = IsGroup(words[0]) ? words[0] + " " + words[1] : words[0];
+  throw UsageError("unknown command '" + command + "'" + kSeeHelp);
+}
+
+}  // namespace
 
 Invocation ParseArgs(const std::vector<std::string>& args) {
   Invocation invocation;
-  std::size_t at = 0;
-  // Options come before the command.
-  for (; at < args.size() && args[at].compare(0, 1, "-") == 0 && args[at] != "-"; ++at) {
+  std::vector<std::string> words;  // the command and its operands
+  bool help = false, version = false, optionsEnded = false;
+  for (std::size_t at = 0; at < args.size(); ++at) {
     const std::string& arg = args[at];
-    if (arg == "--help" || arg == "-h") {
-      invocation.command = Command::kHelp;
-      return invocation;
-    }
-    if (arg == "--version") {
-      invocation.command = Command::kVersion;
-      return invocation;
-    }
-    std::string path;
-    if (arg == "--store") {
-      if (++at == args.size()) throw UsageError(std::string("--store needs a PATH") + kSeeHelp);
-      path = args[at];
-    } else if (arg.compare(0, 8, "--store=") == 0) {
-      path = arg.substr(8);
+    if (optionsEnded || arg == "-" || arg.compare(0, 1, "-") != 0) {
+      words.push_back(arg);
+    } else if (arg == "--") {
+      optionsEnded = true;
+    } else if (arg == "--help" || arg == "-h") {
+      help = true;
+    } else if (arg == "--version") {
+      version = true;
+    } else if (auto path = OptionValue(args, at, "--store", "a PATH")) {
+      if (path->empty()) throw UsageError("--store needs a non-empty PATH");
+      invocation.store = *path;
+    } else if (auto seconds = OptionValue(args, at, "--wait", "SECONDS")) {
+      invocation.waitMs = ParseWaitMs(*seconds);
     } else {
       throw UsageError("unknown option '" + arg + "'" + kSeeHelp);
     }
-    if (path.empty()) throw UsageError("--store needs a non-empty PATH");
-    invocation.store = path;
   }
-  if (at == args.size()) throw UsageError(std::string("missing command") + kSeeHelp);
+  if (version && !help) {
+    invocation.command = Command::kVersion;
+    return invocation;
+  }
+  if (help) {
+    invocation.command = Command::kHelp;
+    if (words.empty()) return invocation;
+    // A group word alone asks about the whole group.
+    invocation.helpTopics = SpecsStartingWith({words[0]});
+    if (words.size() == 1 && IsGroup(words[0])) return invocation;
+    invocation.helpTopics = {&MatchCommand(words)};
+    return invocation;
+  }
 
-  const CommandSpec* match = nullptr;
-  for (const auto& spec : CommandTable()) {
-    if (StartsWith(args, at, spec.words)) {
-      match = &spec;
-      break;
-    }
+  const CommandSpec& match = MatchCommand(words);
+  const std::string name = Join(match.words);
+  const std::size_t given = words.size() - match.words.size();
+  if (given < match.operands.size()) {
+    throw UsageError("'" + name + "' needs " + Join(match.operands) + kSeeHelp);
   }
-  if (match == nullptr) {
-    std::string command = args[at];
-    if ((command == "policies" || command == "datastores" || command == "blob") &&
-        at + 1 < args.size()) {
-      command += " " + args[at + 1];
-    }
-    throw UsageError("unknown command '" + command + "'" + kSeeHelp);
-  }
-  at += match->words.size();
-  const std::string name = Join(match->words);
-  const std::size_t given = args.size() - at;
-  if (given < match->operands.size()) {
-    throw UsageError("'" + name + "' needs " + Join(match->operands) + kSeeHelp);
-  }
-  if (given > match->operands.size()) {
+  if (given > match.operands.size()) {
     throw UsageError("too many arguments for '" + name + "'" + kSeeHelp);
   }
-  invocation.command = match->command;
-  invocation.operands.assign(args.begin() + static_cast<std::ptrdiff_t>(at), args.end());
+  invocation.command = match.command;
+  invocation.operands.assign(words.begin() + static_cast<std::ptrdiff_t>(match.words.size()),
+                             words.end());
   return invocation;
 }
 

@@ -17,12 +17,17 @@ enum class Command {
   kDatastoresList,
   kImport,
   kExport,
+  kCheck,
   kBlobById,
   kBlobCorraById,
   kBlobCorraByName,
   kBlobDefault,
   kHash,
 };
+
+// What a command needs of the store: a read fails when there is no store
+// (so a mistyped path is not an empty catalogue), a write creates it.
+enum class StoreUse { kNone, kRead, kWrite };
 
 // One line of the command table: the words that select the command, the
 // operands it takes, and what it does (for --help).
@@ -31,6 +36,7 @@ struct CommandSpec {
   std::vector<std::string> words;
   std::vector<std::string> operands;
   std::string summary;
+  StoreUse store;
 };
 
 const std::vector<CommandSpec>& CommandTable();
@@ -38,10 +44,15 @@ const std::vector<CommandSpec>& CommandTable();
 struct Invocation {
   Command command = Command::kHelp;
   std::optional<std::string> store;   // --store PATH
+  std::optional<int> waitMs;          // --wait SECONDS
   std::vector<std::string> operands;  // in the order CommandSpec lists them
+  // For kHelp: the commands asked about ("blob --help" names all blob
+  // commands); empty for the general help.
+  std::vector<const CommandSpec*> helpTopics;
 };
 
-// Parses the arguments after the program name. Throws UsageError.
+// Parses the arguments after the program name. Options may come anywhere;
+// "--" ends them. Throws UsageError.
 Invocation ParseArgs(const std::vector<std::string>& args);
 
 }  // namespace karstctl

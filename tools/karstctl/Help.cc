@@ -30,7 +30,8 @@ std::string HelpText() {
   };
 
   std::string out =
-      "Usage: karstctl [--store PATH] COMMAND [ARGS]\n"
+      "Usage: karstctl [--store PATH] [--wait SECONDS] COMMAND [ARGS]\n"
+      "       karstctl COMMAND --help\n"
       "\n"
       "Reads and replaces the storage policy and datastore catalogues.\n"
       "\n"
@@ -40,23 +41,40 @@ std::string HelpText() {
   out += line("--store PATH", "the store file; by default $TAVO_CONFIGSTORE_PATH,");
   out += line("", "else $XDG_STATE_HOME/tavo/configstore.db,");
   out += line("", "else ~/.local/state/tavo/configstore.db");
-  out += line("--help", "print this help");
+  out += line("--wait SECONDS", "how long to wait for another process's write lock");
+  out += line("", "(default 10, fractions allowed)");
+  out += line("--help", "print this help, or with a COMMAND that command's usage");
   out += line("--version", "print the version");
+  out += line("--", "ends the options: later words starting with - are operands");
   out +=
       "\n"
+      "Options may come anywhere on the line.\n"
       "FILE - reads standard input. Records, as read and printed:\n"
       "  policy     {\"name\": S, \"policy_id\": S, \"description\": S, \"generation_number\": I,\n"
       "              \"blobs\": [{\"datastore_namespace\": S, \"blob\": S}, ...]}\n"
       "  datastore  {\"url\": S, \"datastore_namespace\": S, \"drp_policy_id\": S}\n"
       "S is a string standing for its UTF-8 bytes, or {\"base64\": \"...\"} for any bytes;\n"
       "output uses the base64 form only for bytes that are not valid UTF-8. I is a\n"
-      "signed 64-bit integer. A missing field is \"\", 0 or []; an unknown key is an error.\n"
+      "signed 64-bit integer. A missing field is \"\", 0 or []; an unknown or repeated key is\n"
+      "an error.\n"
       "A blob is written raw with nothing added; finding none prints nothing.\n"
+      "Reading commands fail when there is no store; writing ones create it. Writing\n"
+      "commands and check warn about records the store would collapse, drop or leave\n"
+      "dangling (repeated names, ids or urls, empty names, unknown drp_policy_id).\n"
       "\n"
       "Exit status:\n"
       "  0  success\n"
       "  1  store error, or any other failure\n"
       "  2  usage or input error; the input is checked whole before the store is touched\n";
+  return out;
+}
+
+std::string CommandHelpText(const std::vector<const CommandSpec*>& topics) {
+  std::string out;
+  for (const CommandSpec* spec : topics) {
+    out += (out.empty() ? "" : "\n") + std::string("Usage: karstctl [OPTIONS] ") + Synopsis(*spec) +
+           "\n  " + spec->summary + "\n";
+  }
   return out;
 }
 

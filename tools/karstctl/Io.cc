@@ -6,6 +6,7 @@
 #include <stdexcept>
 
 #include "Errors.h"
+#include "Utf8.h"
 
 namespace karstctl {
 
@@ -51,6 +52,17 @@ void WriteOutput(const std::string& bytes) {
       std::fflush(stdout) != 0) {
     throw std::runtime_error(std::string("cannot write standard output: ") + std::strerror(errno));
   }
+}
+
+void WriteDiagnostic(const std::string& message) {
+  const bool utf8 = IsValidUtf8(message);
+  std::string line = "karstctl: ";
+  for (char c : message) {
+    auto byte = static_cast<unsigned char>(c);
+    line += (byte < 0x20 || byte == 0x7F || (!utf8 && byte >= 0x80)) ? '?' : c;
+  }
+  line += '\n';
+  std::fwrite(line.data(), 1, line.size(), stderr);
 }
 
 }  // namespace karstctl

@@ -16,6 +16,11 @@ std::string ReadInput(const std::string& fileOrDash);
 // std::runtime_error when the write fails, so a full disk is not a success.
 void WriteOutput(const std::string& bytes);
 
+// Writes "karstctl: <message>" to standard error as exactly one line: control
+// bytes (a newline in a store message, say) become '?', and so does every
+// byte of a message that is not UTF-8.
+void WriteDiagnostic(const std::string& message);
+
 }  // namespace karstctl
 
 #endif  // KARSTCTL_IO_H_

@@ -50,6 +50,41 @@ std::string WithoutTag(const std::string& what) {
   return end == std::string::npos ? what : what.substr(end + 2);
 }
 
+// The offset of the opening quote of the key numbered "index" (from 0, in
+// document order). Only called for text the parser has accepted up to that
+// key, so a string is a key exactly when it follows '{' or ',' in an object.
+std::size_t KeyOffset(const std::string& text, std::size_t index) {
+  std::vector<char> open;  // '{' or '[' of each enclosing container
+  char previous = 0;       // the last byte outside strings and whitespace
+  for (std::size_t i = 0; i < text.size(); ++i) {
+    const char c = text[i];
+    if (c == '"') {
+      if (!open.empty() && open.back() == '{' && (previous == '{' || previous == ',') &&
+          index-- == 0) {
+        return i;
+      }
+      for (++i; i < text.size() && text[i] != '"'; ++i) {
+        if (text[i] == '\\') ++i;
+      }
+      previous = '"';
+    } else if (c == '{' || c == '[') {
+      open.push_back(c);
+      previous = c;
+    } else if (c == '}' || c == ']') {
+      if (!open.empty()) open.pop_back();
+      previous = c;
+    } else if (c != ' ' && c != '\t' && c != '\n' && c != '\r') {
+      previous = c;
+    }
+  }
+  return text.size();
+}
+
+std::string At(const std::string& source, const std::string& text, std::size_t offset) {
+  const TextPosition at = PositionOf(text, offset);
+  return source + ":" + std::to_string(at.line) + ":" + std::to_string(at.column) + ": ";
+}
+
 }  // namespace
 
 TextPosition PositionOf(const std::string& text, std::size_t offset) {
@@ -69,6 +104,7 @@ TextPosition PositionOf(const std::string& text, std::size_t offset) {
 Json ParseJsonText(const std::string& text, const std::string& source) {
   // The keys seen so far in each object being parsed, innermost last.
   std::vector<std::set<std::string>> open;
+  std::size_t keys = 0;  // keys parsed so far, to find a repeat in the text
   auto checkKeys = [&](int, Json::parse_event_t event, Json& parsed) {
     switch (event) {
       case Json::parse_event_t::object_start:
@@ -80,8 +116,10 @@ Json ParseJsonText(const std::string& text, const std::string& source) {
       case Json::parse_event_t::key: {
         const auto& key = parsed.get_ref<const std::string&>();
         if (!open.back().insert(key).second) {
-          throw InputError(source + ": duplicate key " + parsed.dump());
+          throw InputError(At(source, text, KeyOffset(text, keys)) + "duplicate key " +
+                           parsed.dump());
         }
+        ++keys;
         break;
       }
       default:
@@ -93,15 +131,12 @@ Json ParseJsonText(const std::string& text, const std::string& source) {
     return Json::parse(text, checkKeys);
   } catch (const Json::parse_error& e) {
     // e.byte counts from 1 and points at the last byte read.
-    TextPosition at = PositionOf(text, e.byte == 0 ? 0 : e.byte - 1);
-    throw InputError(source + ":" + std::to_string(at.line) + ":" + std::to_string(at.column) +
-                     ": " + ParseErrorReason(e.what()));
+    throw InputError(At(source, text, e.byte == 0 ? 0 : e.byte - 1) + ParseErrorReason(e.what()));
   } catch (const Json::out_of_range& e) {
     ErrorLocator locator;
     Json::sax_parse(text, &locator);
-    TextPosition at = PositionOf(text, locator.offset == 0 ? 0 : locator.offset - 1);
-    throw InputError(source + ":" + std::to_string(at.line) + ":" + std::to_string(at.column) +
-                     ": " + WithoutTag(e.what()));
+    throw InputError(At(source, text, locator.offset == 0 ? 0 : locator.offset - 1) +
+                     WithoutTag(e.what()));
   }
 }
 

@@ -7,7 +7,10 @@
 #include "Io.h"
 #include "JsonCodec.h"
 #include "JsonText.h"
+#include "StoreSession.h"
+#include "TavoConfigStore/ConfigStore.h"
 #include "TavoKarst/KarstLib.h"
+#include "Warnings.h"
 
 namespace karstctl {
 
@@ -30,34 +33,39 @@ auto ReadRecords(const std::string& fileOrDash, Decode decode) {
 
 void PrintJson(const Json& value) { WriteOutput(DumpJsonText(value)); }
 
-}  // namespace
+void Warn(const std::vector<std::string>& warnings) {
+  for (const auto& warning : warnings) WriteDiagnostic("warning: " + warning);
+}
 
-void RunCommand(const Invocation& invocation) {
+// Each replace commits its own transaction; begun inside this one, it is a
+// savepoint of it, so both catalogues become durable together or not at all.
+void ReplaceBoth(const Catalogue& catalogue) {
+  auto store = TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace);
+  store->BeginTransaction();
+  try {
+    if (catalogue.policies) KarstLib::AddPolicyInfo(*catalogue.policies);
+    if (catalogue.datastores) KarstLib::AddDatastoreInfo(*catalogue.datastores);
+    store->CommitTransaction();
+  } catch (...) {
+    try {
+      store->AbortTransaction();
+    } catch (...) {
+      // The first failure is the one to report.
+    }
+    throw;
+  }
+}
+
+void RunRead(const Invocation& invocation) {
   const std::vector<std::string>& operands = invocation.operands;
+  StoreSession session(invocation, StoreUse::kRead);
   switch (invocation.command) {
-    case Command::kReset:
-      KarstLib::Reset();
-      break;
-    case Command::kPoliciesSet:
-      KarstLib::AddPolicyInfo(ReadRecords(
-          operands[0], [](const Json& json) { return PoliciesFromJson(json, "policies"); }));
-      break;
     case Command::kPoliciesList:
       PrintJson(PoliciesToJson(KarstLib::ListPolicyInfo()));
-      break;
-    case Command::kDatastoresSet:
-      KarstLib::AddDatastoreInfo(ReadRecords(
-          operands[0], [](const Json& json) { return DatastoresFromJson(json, "datastores"); }));
       break;
     case Command::kDatastoresList:
       PrintJson(DatastoresToJson(KarstLib::ListDatastoreInfo()));
       break;
-    case Command::kImport: {
-      Catalogue catalogue = ReadRecords(operands[0], CatalogueFromJson);
-      if (catalogue.policies) KarstLib::AddPolicyInfo(*catalogue.policies);
-      if (catalogue.datastores) KarstLib::AddDatastoreInfo(*catalogue.datastores);
-      break;
-    }
     case Command::kExport: {
       auto policies = KarstLib::ListPolicyInfo();
       auto datastores = KarstLib::ListDatastoreInfo();
@@ -84,9 +92,55 @@ void RunCommand(const Invocation& invocation) {
       PrintJson(out);
       break;
     }
+    default:
+      break;
+  }
+}
+
+}  // namespace
+
+void RunCommand(const Invocation& invocation) {
+  const std::vector<std::string>& operands = invocation.operands;
+  switch (invocation.command) {
+    case Command::kReset: {
+      StoreSession session(invocation, StoreUse::kWrite);
+      KarstLib::Reset();
+      break;
+    }
+    case Command::kPoliciesSet: {
+      auto policies = ReadRecords(
+          operands[0], [](const Json& json) { return PoliciesFromJson(json, "policies"); });
+      Warn(PolicyWarnings(policies));
+      StoreSession session(invocation, StoreUse::kWrite);
+      KarstLib::AddPolicyInfo(policies);
+      break;
+    }
+    case Command::kDatastoresSet: {
+      auto datastores = ReadRecords(
+          operands[0], [](const Json& json) { return DatastoresFromJson(json, "datastores"); });
+      StoreSession session(invocation, StoreUse::kWrite);
+      const auto stored = KarstLib::ListPolicyInfo();
+      Warn(DatastoreWarnings(datastores, &stored, "the store"));
+      KarstLib::AddDatastoreInfo(datastores);
+      break;
+    }
+    case Command::kImport: {
+      Catalogue catalogue = ReadRecords(operands[0], CatalogueFromJson);
+      StoreSession session(invocation, StoreUse::kWrite);
+      std::vector<TavoKarst::KarstPolicyInfo> stored;
+      if (catalogue.datastores && !catalogue.policies) stored = KarstLib::ListPolicyInfo();
+      Warn(CatalogueWarnings(catalogue, &stored));
+      ReplaceBoth(catalogue);
+      break;
+    }
+    case Command::kCheck:
+      Warn(CatalogueWarnings(ReadRecords(operands[0], CatalogueFromJson), nullptr));
+      break;
     case Command::kHelp:
     case Command::kVersion:
       break;  // answered before the store is chosen
+    default:
+      RunRead(invocation);
   }
 }
 

@@ -5,10 +5,12 @@
 
 namespace karstctl {
 
-// Carries out a store command (not --help or --version) against the store
-// the library opens. Input is read and decoded whole before the first
-// library call. Throws InputError, the store's ConfigStoreException, or
-// std::runtime_error when output cannot be written.
+// Carries out a store command (not --help or --version), opening the store
+// itself. Input is read and decoded whole before the store is opened;
+// warnings about records the store would collapse go to standard error.
+// Throws InputError, the store's ConfigStoreException, or
+// std::runtime_error when there is no store to read or output cannot be
+// written.
 void RunCommand(const Invocation& invocation);
 
 }  // namespace karstctl

@@ -1,0 +1,16 @@
+#ifndef KARSTCTL_CLI_H_
+#define KARSTCTL_CLI_H_
+
+#include <string>
+#include <vector>
+
+namespace karstctl {
+
+// The whole tool: parses "args" (without the program name), runs the
+// command, reports any failure as one line on standard error and returns
+// the exit status: 0 success, 1 store or other failure, 2 usage or input.
+int RunKarstctl(const std::vector<std::string>& args);
+
+}  // namespace karstctl
+
+#endif  // KARSTCTL_CLI_H_
