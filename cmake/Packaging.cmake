@@ -1,5 +1,5 @@
-# Installation, the CMake package (find_package(karst)), karst.pc and the
-# Debian package.
+# Installation, the CMake package (find_package(karst)), karst.pc; the Debian
+# packages are in cmake/DebianPackages.cmake.
 
 include(CMakePackageConfigHelpers)
 
@@ -30,15 +30,4 @@ configure_file(cmake/karst.pc.in ${CMAKE_CURRENT_BINARY_DIR}/karst.pc @ONLY)
 install(FILES ${CMAKE_CURRENT_BINARY_DIR}/karst.pc
   DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig COMPONENT development)
 
-set(CPACK_PACKAGE_NAME libkarst)
-set(CPACK_PACKAGE_VENDOR "libkarst developers")
-set(CPACK_PACKAGE_CONTACT "libkarst developers <karst@localhost>")
-set(CPACK_PACKAGE_DESCRIPTION_SUMMARY "${PROJECT_DESCRIPTION}")
-set(CPACK_DEBIAN_PACKAGE_SECTION libs)
-set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
-# dpkg-shlibdeps derives the SQLite and C++ runtime dependencies from the
-# binaries themselves.
-set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
-set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS ON)
-set(CPACK_PACKAGING_INSTALL_PREFIX /usr)
-include(CPack)
+include(cmake/DebianPackages.cmake)
