@@ -257,7 +257,9 @@ TEST_P(StoreConformance, TransactionsNest) {
     Set(*store_, Obj("k", "g", "c", "outer"));
     store_->BeginTransaction();
     Set(*store_, Obj("k", "g", "c", "undone"));
+    store_->BeginTransaction();  // committed into the one then aborted
     store_->DeleteObjects(Filter("k", "g", "c", "before"));
+    store_->CommitTransaction();
     store_->AbortTransaction();
     store_->BeginTransaction();
     Set(*store_, Obj("k", "g", "c", "inner"));

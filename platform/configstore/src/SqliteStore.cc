@@ -444,8 +444,10 @@ class SqliteStore final : public ConfigStore {
         continue;
       }
       // By name, not through a descriptor: closing one would drop this
-      // process's locks on the file. Never through a link.
-      fchmodat(AT_FDCWD, file.c_str(), store.st_mode & 0777, AT_SYMLINK_NOFOLLOW);
+      // process's locks on the file. Never through a link. Best effort: the
+      // owner reads the store either way.
+      [[maybe_unused]] const int ignored =
+          fchmodat(AT_FDCWD, file.c_str(), store.st_mode & 0777, AT_SYMLINK_NOFOLLOW);
     }
   }
 
