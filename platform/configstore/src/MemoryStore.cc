@@ -5,6 +5,7 @@
 #include <tuple>
 #include <vector>
 
+#include "DamagedObject.h"
 #include "TavoConfigStore/ConfigStore.h"
 
 namespace TavoConfigStore {
@@ -35,6 +36,7 @@ class MemoryStore final : public ConfigStore {
   void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
                  std::int32_t& /*flags*/) override {
     RefuseNull(object.get(), "SetObject");
+    DamagedObject::RefuseWrite(*object);
     std::shared_ptr<const ConfigStoreObject> copy = object->Clone();
     std::lock_guard<std::mutex> lock(mu_);
     IdKey key = KeyOf(object->Id());

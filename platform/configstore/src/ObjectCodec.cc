@@ -194,7 +194,7 @@ void EncodeObject(const ConfigStoreObject& object, std::string* out) {
   }
 }
 
-std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId id, const unsigned char* data,
+std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId&& id, const unsigned char* data,
                                                 std::size_t size, BodyArena* arena) {
   // Check everything now, so that damage is reported by the read that
   // fetched it and the object's lazy readers only meet sound bytes. The walk

@@ -38,9 +38,9 @@ class BodyArena;
 // A new object with identifier "id" and the contents encoded in
 // data[0, size), which is copied into memory from "arena" (or, when null, an
 // allocation of its own). Throws ConfigStoreException(kErrorCorruptObject)
-// when the bytes are not a complete, well-formed encoding; never reads past
-// "size".
-std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId id, const unsigned char* data,
+// when the bytes are not a complete, well-formed encoding, and then leaves
+// "id" as it was; never reads past "size".
+std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId&& id, const unsigned char* data,
                                                 std::size_t size, BodyArena* arena = nullptr);
 
 // ---- Readers of a checked "values" section ---------------------------------

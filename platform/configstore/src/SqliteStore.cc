@@ -39,6 +39,7 @@
 #include <utility>
 #include <vector>
 
+#include "DamagedObject.h"
 #include "ObjectCodec.h"
 #include "TavoConfigStore/ConfigStore.h"
 
@@ -119,6 +120,7 @@ class SqliteStore final : public ConfigStore {
   void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
                  std::int32_t& /*flags*/) override {
     if (!object) throw ConfigStoreException(Where() + ": SetObject of null", kErrorNullArgument);
+    DamagedObject::RefuseWrite(*object);
     // Encoded outside the lock into a buffer that keeps its capacity, so a
     // run of writes allocates nothing here.
     thread_local std::string body;
@@ -686,7 +688,10 @@ class SqliteStore final : public ConfigStore {
       return codec::DecodeObject(std::move(id), static_cast<const unsigned char*>(data),
                                  data == nullptr ? 0 : static_cast<std::size_t>(size), arena);
     } catch (const ConfigStoreException& e) {
-      throw ConfigStoreException(Where() + ": " + e.Message(), e.Code());
+      // The object still lists: a caller going through a collection loses
+      // this one record, not the catalogue.
+      return std::make_shared<DamagedObject>(
+          std::move(id), ConfigStoreException(Where() + ": " + e.Message(), e.Code()));
     }
   }
 

@@ -46,7 +46,11 @@ class CONFIGSTORE_EXPORT ConfigStore {
 
   virtual ~ConfigStore();
 
-  // The object with that identifier, or null when there is none.
+  // The object with that identifier, or null when there is none. An object
+  // whose stored encoding is damaged is returned all the same, and every read
+  // of its values or sub-objects (and a SetObject of it) throws
+  // ConfigStoreException with kErrorCorruptObject; the same goes for the
+  // objects of GetObjects, so damage to one object fails only its reads.
   virtual std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) = 0;
   // Writes a copy of the object with its values and sub-objects. "flags" is
   // reserved and must be 0.
