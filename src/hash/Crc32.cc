@@ -255,7 +255,10 @@ std::uint32_t Crc32(const void* data, std::size_t size, std::uint32_t crc) {
 
 std::string Crc32Hex(const std::string& text) {
   if (text.empty()) return std::string();
-  std::uint32_t value = Crc32(text.data(), text.size());
+  return HexOfCrc32(Crc32(text.data(), text.size()));
+}
+
+std::string HexOfCrc32(std::uint32_t value) {
   static constexpr char kDigits[] = "0123456789abcdef";
   char buffer[8];
   int pos = 8;

@@ -26,6 +26,8 @@ bool CpuHasAvx512Clmul();
 // The digest of a text: "" for the empty text, otherwise its CRC-32 in
 // lower-case hex without leading zeros ("c" gives "6b9df6f").
 std::string Crc32Hex(const std::string& text);
+// The same hex form of a CRC-32 already computed (of a non-empty text).
+std::string HexOfCrc32(std::uint32_t crc);
 
 }  // namespace TavoKarst
 

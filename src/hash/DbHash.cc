@@ -1,6 +1,7 @@
 #include "hash/DbHash.h"
 
 #include <algorithm>
+#include <charconv>
 #include <cstdint>
 #include <cstring>
 #include <vector>
@@ -30,15 +31,16 @@ std::uint64_t KeyPrefix(const std::string& key, std::size_t from) {
 
 // Orders "count" records by key, then (for tied keys) by text, and digests
 // their texts' digests in that order. "keyOf(i)" is record i's key;
-// "textOf(i)" builds its text, once per record.
+// "digestOf(i)" is Crc32Hex of its text, asked once per record; "textOf(i)"
+// builds the text itself, asked only for records whose keys tie.
 //
 // The order is found through a compact index: sorting the records in place
 // compares keys scattered over the heap, a cache miss or two per comparison
 // once there are many. The bytes every key shares decide nothing, so each
 // entry carries the 8 that follow them. A text is kept only while its key is
 // tied with another's; the others are digested as soon as they are built.
-template <typename KeyOf, typename TextOf>
-std::string DigestOfDigests(std::size_t count, KeyOf keyOf, TextOf textOf) {
+template <typename KeyOf, typename DigestOf, typename TextOf>
+std::string DigestOfDigests(std::size_t count, KeyOf keyOf, DigestOf digestOf, TextOf textOf) {
   std::size_t common = count == 0 ? 0 : keyOf(0).size();
   for (std::size_t i = 1; i < count; ++i) {
     const std::string& first = keyOf(0);
@@ -74,11 +76,10 @@ std::string DigestOfDigests(std::size_t count, KeyOf keyOf, TextOf textOf) {
   std::vector<std::string> digests(count);
   std::vector<std::string> texts;  // sized only when some keys tie
   for (std::size_t i = 0; i < count; ++i) {
-    const std::string& text = textOf(i);
-    digests[i] = Crc32Hex(text);
+    digests[i] = digestOf(i);
     if (tied[i]) {
       if (texts.empty()) texts.resize(count);
-      texts[i] = text;
+      texts[i] = textOf(i);
     }
   }
   for (std::size_t begin = 0; begin < count;) {
@@ -103,14 +104,19 @@ std::string DigestOfDigests(std::size_t count, KeyOf keyOf, TextOf textOf) {
   return Crc32Hex(accumulator);
 }
 
-// Builds a policy's text into "*text", whose capacity is reused from one
-// policy to the next.
-void PolicyText(const KarstPolicyInfo& policy, std::string* text) {
-  // "%s" stops at a NUL: name, policy_id and description count only up to it.
-  text->assign(Velk::Misc::StrPrintf("%s%s%s%ld", policy.name.c_str(), policy.policy_id.c_str(),
-                                     policy.description.c_str(), policy.generation_number));
-  // Blob entries in ascending order of namespace; tied namespaces by blob. The
-  // usual handful of indices is sorted on the stack.
+// Hands each piece of a policy's text to "append", in order: name,
+// policy_id and description, each up to its first NUL (as "%s" would take
+// them), the generation number in decimal, then each blob's namespace and
+// bytes in ascending order of namespace, tied namespaces by blob.
+template <typename Append>
+void ForEachPolicyPiece(const KarstPolicyInfo& policy, Append append) {
+  for (const std::string* field : {&policy.name, &policy.policy_id, &policy.description}) {
+    append(field->data(), std::strlen(field->c_str()));
+  }
+  char number[24];
+  const auto printed = std::to_chars(number, number + sizeof number, policy.generation_number);
+  append(number, static_cast<std::size_t>(printed.ptr - number));
+  // The usual handful of indices is sorted on the stack.
   constexpr std::size_t kFew = 8;
   std::uint32_t few[kFew];
   std::vector<std::uint32_t> many;
@@ -124,10 +130,31 @@ void PolicyText(const KarstPolicyInfo& policy, std::string* text) {
     return byKey != 0 ? byKey < 0 : blobs[a].blob < blobs[b].blob;
   });
   for (std::size_t i = 0; i < count; ++i) {
-    *text += blobs[order[i]].datastore_namespace;
-    *text += blobs[order[i]].blob;
+    const KarstPolicyBlob& blob = blobs[order[i]];
+    append(blob.datastore_namespace.data(), blob.datastore_namespace.size());
+    append(blob.blob.data(), blob.blob.size());
   }
 }
+
+std::string PolicyText(const KarstPolicyInfo& policy) {
+  std::string text;
+  ForEachPolicyPiece(policy,
+                     [&text](const char* data, std::size_t size) { text.append(data, size); });
+  return text;
+}
+
+// Crc32Hex of the policy's text, without building it: the CRC runs on
+// across the pieces where they lie, so the blobs are not copied first.
+std::string PolicyDigest(const KarstPolicyInfo& policy) {
+  std::uint32_t crc = 0;
+  std::size_t length = 0;
+  ForEachPolicyPiece(policy, [&](const char* data, std::size_t size) {
+    crc = Crc32(data, size, crc);
+    length += size;
+  });
+  return length == 0 ? std::string() : HexOfCrc32(crc);
+}
+
 // A large catalogue is far bigger than the caches, and each policy's strings
 // sit behind two or three pointers: fetched one after another, every one
 // costs a trip to memory. Asking for the next policies' memory ahead lets
@@ -150,27 +177,27 @@ void PrefetchBlobs(const KarstPolicyInfo& policy) {
 
 std::string GetPolicyDbHash() {
   const std::vector<KarstPolicyInfo> policies = ListPolicies();
-  std::string text;
   return DigestOfDigests(
       policies.size(), [&](std::size_t i) -> const std::string& { return policies[i].policy_id; },
-      [&](std::size_t i) -> const std::string& {
+      [&](std::size_t i) {
         if (i + 2 < policies.size()) PrefetchBlobList(policies[i + 2]);
         if (i + 1 < policies.size()) PrefetchBlobs(policies[i + 1]);
-        PolicyText(policies[i], &text);
-        return text;
-      });
+        return PolicyDigest(policies[i]);
+      },
+      [&](std::size_t i) { return PolicyText(policies[i]); });
 }
 
 std::string GetDatastoreDbHash() {
   std::vector<KarstDatastoreInfo> datastores = ListDatastores();
+  auto textOf = [&](std::size_t i) {
+    const KarstDatastoreInfo& d = datastores[i];
+    return Velk::Misc::StrCat(d.url.data(), d.url.size(), d.datastore_namespace.data(),
+                              d.datastore_namespace.size(), d.drp_policy_id.data(),
+                              d.drp_policy_id.size());
+  };
   return DigestOfDigests(
       datastores.size(), [&](std::size_t i) -> const std::string& { return datastores[i].url; },
-      [&](std::size_t i) {
-        const KarstDatastoreInfo& d = datastores[i];
-        return Velk::Misc::StrCat(d.url.data(), d.url.size(), d.datastore_namespace.data(),
-                                  d.datastore_namespace.size(), d.drp_policy_id.data(),
-                                  d.drp_policy_id.size());
-      });
+      [&](std::size_t i) { return Crc32Hex(textOf(i)); }, textOf);
 }
 
 std::pair<std::string, std::string> ComputeDbHash() {
