@@ -17,8 +17,8 @@ namespace TavoConfigStore {
 
 class DamagedObject final : public ConfigStoreObject {
  public:
-  DamagedObject(ConfigStoreObjectId&& id, ConfigStoreException error)
-      : ConfigStoreObject(std::move(id)), error_(std::move(error)) {}
+  DamagedObject(ConfigStoreObjectId&& id, const ConfigStoreException& error)
+      : ConfigStoreObject(std::move(id)), error_(error) {}
 
   bool GetValue(const char* /*name*/, std::string* /*value*/) const override { throw error_; }
   bool GetValue(const char* /*name*/, long long* /*value*/) const override { throw error_; }
