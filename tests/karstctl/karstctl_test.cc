@@ -348,9 +348,9 @@ TEST_F(Karstctl, HelpAndVersionNeedNoStore) {
   for (std::size_t at; (at = man.find("\\-")) != std::string::npos;) man.erase(at, 1);
   const std::string completion = ReadFile(KARSTCTL_SOURCE_DIR "/karstctl.bash-completion");
   std::vector<std::string> names = {"--store", "--wait", "--help", "--version"};
-  for (const auto& spec : karstctl::CommandTable()) {
-    names.push_back(spec.words[0] + (spec.words.size() > 1 ? " " + spec.words[1] : ""));
-    EXPECT_THAT(completion, HasSubstr(spec.words.back()));
+  for (const auto& entry : karstctl::CommandTable()) {
+    names.push_back(entry.words[0] + (entry.words.size() > 1 ? " " + entry.words[1] : ""));
+    EXPECT_THAT(completion, HasSubstr(entry.words.back()));
   }
   for (const auto& name : names) {
     EXPECT_THAT(help.out, HasSubstr("  " + name + " "));

@@ -53,29 +53,29 @@ std::optional<std::string> OptionValue(const std::vector<std::string>& args, std
 
 // The group word ("blob") of commands named by two words.
 bool IsGroup(const std::string& word) {
-  for (const auto& spec : CommandTable()) {
-    if (spec.words.size() > 1 && spec.words[0] == word) return true;
+  for (const auto& entry : CommandTable()) {
+    if (entry.words.size() > 1 && entry.words[0] == word) return true;
   }
   return false;
 }
 
-std::vector<const CommandSpec*> SpecsStartingWith(const std::vector<std::string>& words) {
-  std::vector<const CommandSpec*> specs;
-  for (const auto& spec : CommandTable()) {
-    if (StartsWith(spec.words, words)) specs.push_back(&spec);
+std::vector<const CommandEntry*> EntriesStartingWith(const std::vector<std::string>& words) {
+  std::vector<const CommandEntry*> entries;
+  for (const auto& entry : CommandTable()) {
+    if (StartsWith(entry.words, words)) entries.push_back(&entry);
   }
-  return specs;
+  return entries;
 }
 
-const CommandSpec& MatchCommand(const std::vector<std::string>& words) {
+const CommandEntry& MatchCommand(const std::vector<std::string>& words) {
   if (words.empty()) throw UsageError(std::string("missing command") + kSeeHelp);
-  for (const auto& spec : CommandTable()) {
-    if (StartsWith(words, spec.words)) return spec;
+  for (const auto& entry : CommandTable()) {
+    if (StartsWith(words, entry.words)) return entry;
   }
   if (IsGroup(words[0]) && words.size() == 1) {
     std::vector<std::string> subcommands;
-    for (const CommandSpec* spec : SpecsStartingWith({words[0]})) {
-      subcommands.push_back(spec->words[1]);
+    for (const CommandEntry* entry : EntriesStartingWith({words[0]})) {
+      subcommands.push_back(entry->words[1]);
     }
     throw UsageError("missing subcommand: " + words[0] + " needs one of " +
                      Join(subcommands, ", "));
@@ -117,13 +117,13 @@ Invocation ParseArgs(const std::vector<std::string>& args) {
     invocation.command = Command::kHelp;
     if (words.empty()) return invocation;
     // A group word alone asks about the whole group.
-    invocation.helpTopics = SpecsStartingWith({words[0]});
+    invocation.helpTopics = EntriesStartingWith({words[0]});
     if (words.size() == 1 && IsGroup(words[0])) return invocation;
     invocation.helpTopics = {&MatchCommand(words)};
     return invocation;
   }
 
-  const CommandSpec& match = MatchCommand(words);
+  const CommandEntry& match = MatchCommand(words);
   const std::string name = Join(match.words);
   const std::size_t given = words.size() - match.words.size();
   if (given < match.operands.size()) {

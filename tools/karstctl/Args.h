@@ -31,7 +31,7 @@ enum class StoreUse { kNone, kRead, kWrite };
 
 // One line of the command table: the words that select the command, the
 // operands it takes, and what it does (for --help).
-struct CommandSpec {
+struct CommandEntry {
   Command command;
   std::vector<std::string> words;
   std::vector<std::string> operands;
@@ -39,16 +39,16 @@ struct CommandSpec {
   StoreUse store;
 };
 
-const std::vector<CommandSpec>& CommandTable();
+const std::vector<CommandEntry>& CommandTable();
 
 struct Invocation {
   Command command = Command::kHelp;
   std::optional<std::string> store;   // --store PATH
   std::optional<int> waitMs;          // --wait SECONDS
-  std::vector<std::string> operands;  // in the order CommandSpec lists them
+  std::vector<std::string> operands;  // in the order CommandEntry lists them
   // For kHelp: the commands asked about ("blob --help" names all blob
   // commands); empty for the general help.
-  std::vector<const CommandSpec*> helpTopics;
+  std::vector<const CommandEntry*> helpTopics;
 };
 
 // Parses the arguments after the program name. Options may come anywhere;

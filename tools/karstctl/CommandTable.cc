@@ -2,8 +2,8 @@
 
 namespace karstctl {
 
-const std::vector<CommandSpec>& CommandTable() {
-  static const std::vector<CommandSpec> table = {
+const std::vector<CommandEntry>& CommandTable() {
+  static const std::vector<CommandEntry> table = {
       {Command::kReset, {"reset"}, {}, "clear both catalogues", StoreUse::kWrite},
       {Command::kPoliciesSet,
        {"policies", "set"},

@@ -12,10 +12,10 @@ namespace karstctl {
 
 namespace {
 
-std::string Synopsis(const CommandSpec& spec) {
+std::string Synopsis(const CommandEntry& entry) {
   std::string out;
-  for (const auto& word : spec.words) out += (out.empty() ? "" : " ") + word;
-  for (const auto& operand : spec.operands) out += " " + operand;
+  for (const auto& word : entry.words) out += (out.empty() ? "" : " ") + word;
+  for (const auto& operand : entry.operands) out += " " + operand;
   return out;
 }
 
@@ -23,7 +23,7 @@ std::string Synopsis(const CommandSpec& spec) {
 
 std::string HelpText() {
   std::size_t width = 0;
-  for (const auto& spec : CommandTable()) width = std::max(width, Synopsis(spec).size());
+  for (const auto& entry : CommandTable()) width = std::max(width, Synopsis(entry).size());
   auto line = [width](std::string left, const std::string& right) {
     left.resize(std::max(width + 2, left.size()), ' ');
     return "  " + left + right + "\n";
@@ -36,7 +36,7 @@ std::string HelpText() {
       "Reads and replaces the storage policy and datastore catalogues.\n"
       "\n"
       "Commands:\n";
-  for (const auto& spec : CommandTable()) out += line(Synopsis(spec), spec.summary);
+  for (const auto& entry : CommandTable()) out += line(Synopsis(entry), entry.summary);
   out += "\nOptions:\n";
   out += line("--store PATH", "the store file; by default $TAVO_CONFIGSTORE_PATH,");
   out += line("", "else $XDG_STATE_HOME/tavo/configstore.db,");
@@ -69,11 +69,11 @@ std::string HelpText() {
   return out;
 }
 
-std::string CommandHelpText(const std::vector<const CommandSpec*>& topics) {
+std::string CommandHelpText(const std::vector<const CommandEntry*>& topics) {
   std::string out;
-  for (const CommandSpec* spec : topics) {
-    out += (out.empty() ? "" : "\n") + std::string("Usage: karstctl [OPTIONS] ") + Synopsis(*spec) +
-           "\n  " + spec->summary + "\n";
+  for (const CommandEntry* entry : topics) {
+    out += (out.empty() ? "" : "\n") + std::string("Usage: karstctl [OPTIONS] ") +
+           Synopsis(*entry) + "\n  " + entry->summary + "\n";
   }
   return out;
 }

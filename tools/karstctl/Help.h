@@ -13,7 +13,7 @@ namespace karstctl {
 std::string HelpText();
 
 // Each command's usage line and summary, for "karstctl COMMAND --help".
-std::string CommandHelpText(const std::vector<const CommandSpec*>& topics);
+std::string CommandHelpText(const std::vector<const CommandEntry*>& topics);
 
 // "karstctl <version>\n".
 std::string VersionText();
