@@ -359,6 +359,16 @@ TEST_F(SqliteStoreTest, NewStoreIsPrivateUnderAnyUmask) {
       ASSERT_EQ(stat(file.c_str(), &st), 0) << file;
       EXPECT_EQ(st.st_mode & 07777, static_cast<mode_t>(mode)) << file << " umask " << mask;
     }
+    // Shared with a group by a chmod of the file: the next writer to open
+    // the store gives the -wal and -shm the same mode, or the group could
+    // not read it.
+    chmod(path.c_str(), 0640);
+    NewSqliteStore(path);
+    for (const char* suffix : {"-wal", "-shm"}) {
+      struct stat st {};
+      ASSERT_EQ(stat((path + suffix).c_str(), &st), 0);
+      EXPECT_EQ(st.st_mode & 07777, 0640u) << suffix;
+    }
   }
 }
 
