@@ -34,10 +34,10 @@ class RawPolicyDb {
     // policies(id, name UNIQUE, policy_id, description, generation) and
     // blobs(policy, seq, ns, blob) clustered on (policy, seq).
     kTwoTables,
-    // Not a contender: the configuration store's own table (every collection
-    // in one table, a four-part identifier index, a body per object) used
-    // the least wasteful way, with a packed body. It shows what that layout
-    // itself costs against the two above.
+    // Not a contender: the configuration store's former single table (every
+    // collection in one table, a four-part identifier index, a body per
+    // object) used the least wasteful way, with a packed body. It shows what
+    // that layout cost, against which the table per collection is measured.
     kStoreSchema,
   };
 

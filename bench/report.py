@@ -132,7 +132,7 @@ def main():
                           ("keyed read", "BM_KarstBlobByName/10000",
                            "BM_RawBlobByName_storeschema/10000")):
         if ms(runs, mine) is not None and ms(runs, raw) is not None:
-            info.append(f"{op} against raw SQLite on the store's own table layout: "
+            info.append(f"{op} against raw SQLite on the store's former single-table layout: "
                         f"{ms(runs, mine) / ms(runs, raw):.2f}")
     for layout in ("onerow", "twotables", "storeschema"):
         a, b = ms(runs, f"BM_RawReplace_{layout}/10000"), ms(runs, f"BM_RawList_{layout}/10000")

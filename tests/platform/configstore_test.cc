@@ -500,7 +500,7 @@ TEST_F(SqliteStoreTest, RefusesFilesThatAreNotStoresAndLeavesThemAlone) {
       {"random", "", SQLITE_NOTADB},
       {"foreign-id", "PRAGMA application_id = 4242;", kErrorNotAStore},
       {"foreign-version", "PRAGMA user_version = 7;", kErrorNotAStore},
-      {"future", "PRAGMA user_version = 2;", kErrorNotAStore},
+      {"future", "PRAGMA user_version = 3;", kErrorNotAStore},
       {"no-table", "PRAGMA application_id = 1413568079; PRAGMA user_version = 1;", kErrorNotAStore},
   };
   for (const auto& c : cases) {
@@ -525,8 +525,9 @@ TEST_F(SqliteStoreTest, DamagedBodiesFailOnlyTheirOwnReads) {
   Set(*store, neighbour);
   RawDb raw(Path());
   raw.Exec("PRAGMA synchronous = OFF");
+  const std::string table = raw.QueryText("SELECT 'c' || id FROM collections");
   const std::string body =
-      raw.QueryText("SELECT hex(body) FROM objects WHERE instance = CAST('s' AS BLOB)");
+      raw.QueryText("SELECT hex(body) FROM " + table + " WHERE instance = CAST('s' AS BLOB)");
   // The code every read of the object throws, 0 when none does; a mix fails.
   auto contents = [](const ConfigStoreObject& o) {
     std::string text;
@@ -537,9 +538,9 @@ TEST_F(SqliteStoreTest, DamagedBodiesFailOnlyTheirOwnReads) {
     return codes[0];
   };
   auto reads = [&](const std::string& hex) {
-    EXPECT_EQ(
-        raw.Exec("UPDATE objects SET body = X'" + hex + "' WHERE instance = CAST('s' AS BLOB)"),
-        SQLITE_OK);
+    EXPECT_EQ(raw.Exec("UPDATE " + table + " SET body = X'" + hex +
+                       "' WHERE instance = CAST('s' AS BLOB)"),
+              SQLITE_OK);
     const auto got = store->GetObject(sample->Id());
     const auto listed = store->GetObjects(Filter());
     EXPECT_EQ(listed.size(), 2u);

@@ -252,4 +252,74 @@ TEST(IoErrors, FileSizeLimitAndFullTmpfs) {
   }
 }
 
+// A store file of the earlier format, as that build wrote it, is upgraded in
+// place by the first process that opens it, in one transaction: a crash at
+// any write, sync or truncate of the upgrade, or an I/O error there, leaves
+// a file from which the next process reads the whole catalogue in its order.
+TEST(IoErrors, UpgradeOfAnOldStoreFileIsAllOrNothing) {
+  FaultVfs::Install();
+  ScratchDir dir;
+  const std::string path = dir.File("store.db");
+  const std::string fixture = ReadFile(KARST_FIXTURES_DIR "/store-format1.db");
+  auto restore = [&] {
+    for (const char* suffix : {"", "-wal", "-shm"}) std::filesystem::remove(path + suffix);
+    WriteFile(path, fixture);
+  };
+  // What a new process lists (names in order and both digests), and the
+  // format the file has after it.
+  auto readAfresh = [&] {
+    const ChildResult r = RunChild([&](int fd) {
+      UseStoreAt(path);
+      std::string seen;
+      for (const auto& p : KarstLib::ListPolicyInfo()) seen += p.name + ",";
+      for (const auto& d : KarstLib::ListDatastoreInfo()) seen += d.url + ",";
+      const auto hash = KarstLib::GetDbHash();
+      WriteAll(fd, seen + hash.first + " " + hash.second);
+    });
+    return (r.Ok() ? r.output : r.Describe()) + " format " +
+           RawDb(path).QueryText("PRAGMA user_version");
+  };
+  const std::string whole =
+      "gold,silver,bronze,ds://cluster-a/pool-ssd,ds://archive-01/export,"
+      "ds://cluster-b/pool-ssd,42207bee 14fc1308 format 2";
+
+  restore();
+  FaultVfs::KeepLog(true);
+  FaultVfs::Arm({IoFault::kNone, io::kChanges});
+  TavoConfigStore::NewSqliteStore(path);  // upgrades, and closes
+  const int calls = static_cast<int>(FaultVfs::Log().size());
+  FaultVfs::KeepLog(false);
+  FaultVfs::Disarm();
+  ASSERT_EQ(readAfresh(), whole);
+
+  int points = 0, refused = 0, wrong = 0;
+  for (const IoFault::Action action : {IoFault::kExit, IoFault::kTornExit, IoFault::kFail}) {
+    for (int k = 1; k <= calls; ++k) {
+      restore();
+      const ChildResult r = RunChild([&](int fd) {
+        FaultVfs::Arm({action, io::kChanges, k});
+        try {
+          TavoConfigStore::NewSqliteStore(path);
+        } catch (const ConfigStoreException& e) {
+          WriteAll(fd, e.Message().find(path) != std::string::npos ? "refused" : e.Message());
+        }
+        _exit(0);
+      });
+      const bool died = action != IoFault::kFail;
+      EXPECT_EQ(r.code, died ? 77 : 0) << k << " " << r.Describe();
+      EXPECT_TRUE(r.output.empty() || r.output == "refused") << r.output;
+      refused += r.output == "refused";
+      const std::string seen = readAfresh();
+      wrong += seen != whole;
+      EXPECT_EQ(seen, whole) << "action " << action << " at I/O call " << k;
+      ++points;
+    }
+  }
+  ReportFigures("upgrade",
+                "upgrade: an old store file, a crash (whole or torn write) or an I/O error at "
+                "each of the %d writes, syncs and truncates of its upgrade: %d points, errors "
+                "naming the file %d, next process read the catalogue whole %d, wrong %d",
+                calls, points, refused, points - wrong, wrong);
+}
+
 }  // namespace karst_reliability

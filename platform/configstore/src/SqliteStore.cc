@@ -1,12 +1,10 @@
-// The SQLite backend: one row per object, its identifier in four indexed BLOB
-// columns and its values and sub-objects encoded (ObjectCodec) in a fifth.
+// The SQLite backend: a table per collection, each object a row of its
+// instance id and its values and sub-objects encoded (ObjectCodec) in one
+// BLOB; SqliteSchema.h has the tables and the upgrade from format 1.
 //
-//   objects(seq INTEGER PRIMARY KEY, key BLOB, grp BLOB, component BLOB,
-//           instance BLOB, body BLOB), UNIQUE (key, grp, component, instance)
-//
-// "seq" is the rowid: a new row gets one above the largest present, so
-// ordering by seq is write order, and INSERT OR REPLACE moves a rewritten
-// object to the end.
+// Write order: every object written gets the next "seq" of the whole store,
+// so a rewritten object moves to the end and objects of several collections
+// list in the order they were written.
 //
 // Durability: WAL with synchronous=FULL, which fsyncs the log at every
 // commit. synchronous=NORMAL would already keep a committed transaction
@@ -17,7 +15,7 @@
 //
 // A file of zero bytes is what SQLite sees as an empty database, so it is
 // treated as a new, empty store and gets the schema. Any other file that does
-// not carry our application id and schema version is refused untouched.
+// not carry our application id and a known format is refused untouched.
 //
 // The file is the catalogue, so it is handled as a secret: created 0600 in
 // directories made 0700, never through a symbolic link, and not at all by a
@@ -31,40 +29,31 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstring>
+#include <map>
 #include <mutex>
 #include <string>
+#include <tuple>
 #include <utility>
 #include <vector>
 
 #include "DamagedObject.h"
 #include "ObjectCodec.h"
+#include "SqliteSchema.h"
 #include "TavoConfigStore/ConfigStore.h"
 
 namespace TavoConfigStore {
 namespace {
 
-constexpr int kApplicationId = 0x5441564f;  // "TAVO"
-constexpr int kSchemaVersion = 1;
 // Pages of 16 KiB for new stores: an object with a few 256-byte blobs takes
 // well over 1 KiB, so a 4 KiB page holds only two or three of them and leaves
 // much of itself empty, and a listing reads (one system call each) and
 // writes several times as many pages. The cost is that the smallest write
 // puts 16 KiB pages into the log rather than 4 KiB ones.
 constexpr int kPageSize = 16384;
-
-// A filter's shape: which identifier parts it constrains, one bit per part in
-// the order of the statement parameters ?1..?4.
-constexpr unsigned kAllParts = 0xf;
-constexpr std::size_t kShapes = 16;
-const char* const kColumns[] = {"key", "grp", "component", "instance"};
-
-unsigned ShapeOf(const ConfigStoreObjectId& id) {
-  return (id.Key().empty() ? 0u : 1u) | (id.Group().empty() ? 0u : 2u) |
-         (id.Component().empty() ? 0u : 4u) | (id.InstanceId().empty() ? 0u : 8u);
-}
 
 // Owns the connection, so that it is closed even when the store's
 // constructor throws after opening it.
@@ -109,12 +98,17 @@ class SqliteStore final : public ConfigStore {
   std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
     std::lock_guard<std::mutex> lock(mu_);
     if (!Open(false)) return nullptr;
-    Resetter reset(get_);
-    BindId(get_, id, kAllParts);
-    const int rc = sqlite3_step(get_);
+    // A collection, once made, is never dropped: finding it and then its
+    // object need not share a snapshot.
+    Collection* c = FindCollection(id.Key(), id.Group(), id.Component(), false);
+    if (c == nullptr) return nullptr;
+    sqlite3_stmt* s = StatementOf(c, kListOne);
+    Resetter reset(s);
+    Bind(s, 1, id.InstanceId());
+    const int rc = sqlite3_step(s);
     if (rc == SQLITE_DONE) return nullptr;
     if (rc != SQLITE_ROW) Fail("reading an object");
-    return Decode(ConfigStoreObjectId(id), get_, 0);
+    return Decode(ConfigStoreObjectId(id), s, 2);
   }
 
   void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
@@ -128,10 +122,16 @@ class SqliteStore final : public ConfigStore {
     codec::EncodeObject(*object, &body);
     std::lock_guard<std::mutex> lock(mu_);
     OpenForWriting();
-    Resetter reset(put_);
-    BindId(put_, object->Id(), kAllParts);
-    Bind(put_, 5, body);
-    if (sqlite3_step(put_) != SQLITE_DONE) Fail("writing an object");
+    Write([&] {
+      const ConfigStoreObjectId& id = object->Id();
+      Collection* c = FindCollection(id.Key(), id.Group(), id.Component(), true);
+      sqlite3_stmt* s = StatementOf(c, kPut);
+      Resetter reset(s);
+      if (sqlite3_bind_int64(s, 1, NextSeq()) != SQLITE_OK) Fail("binding a value");
+      Bind(s, 2, id.InstanceId());
+      Bind(s, 3, body);
+      if (sqlite3_step(s) != SQLITE_DONE) Fail("writing an object");
+    });
   }
 
   void DeleteObjects(const std::shared_ptr<FilterSpecObject>& filter) override {
@@ -139,28 +139,17 @@ class SqliteStore final : public ConfigStore {
       throw ConfigStoreException(Where() + ": DeleteObjects of null", kErrorNullArgument);
     std::lock_guard<std::mutex> lock(mu_);
     OpenForWriting();
-    const unsigned shape = ShapeOf(filter->Id());
-    sqlite3_stmt*& s = deletes_[shape];
-    if (s == nullptr) {
-      if (ByRange(shape)) {
-        // As for listing: found through the index, a collection's rows
-        // would be visited in index order, one random table page after
-        // another (a read each, once the collection outgrows the page cache).
-        // Deleting between the lowest and highest seq of the matches goes
-        // through the table in order. One statement, so the deletion stays a
-        // single write.
-        const std::string where = Where(shape, false);
-        s = Prepare("DELETE FROM objects WHERE seq BETWEEN (SELECT min(seq) FROM objects WHERE " +
-                    where + ") AND (SELECT max(seq) FROM objects WHERE " + where + ") AND " +
-                    Where(shape, true));
-      } else {
-        s = Prepare(shape == 0 ? "DELETE FROM objects"
-                               : "DELETE FROM objects WHERE " + Where(shape, false));
+    Write([&] {
+      const std::string& instance = filter->Id().InstanceId();
+      for (Collection* c : MatchingCollections(filter->Id())) {
+        // Without an instance id, the whole table: SQLite then frees its
+        // pages at once instead of deleting row by row.
+        sqlite3_stmt* s = StatementOf(c, instance.empty() ? kClear : kErase);
+        Resetter reset(s);
+        if (!instance.empty()) Bind(s, 1, instance);
+        if (sqlite3_step(s) != SQLITE_DONE) Fail("deleting objects");
       }
-    }
-    Resetter reset(s);
-    BindId(s, filter->Id(), shape);
-    if (sqlite3_step(s) != SQLITE_DONE) Fail("deleting objects");
+    });
   }
 
   std::vector<std::shared_ptr<ConfigStoreObject>> GetObjects(
@@ -169,31 +158,31 @@ class SqliteStore final : public ConfigStore {
     std::lock_guard<std::mutex> lock(mu_);
     std::vector<std::shared_ptr<ConfigStoreObject>> out;
     if (!Open(false)) return out;
-    const unsigned shape = ShapeOf(filter->Id());
     // Outside a transaction, an explicit read transaction pins one snapshot
     // for the whole listing.
     const bool ownRead = sqlite3_get_autocommit(db_) != 0;
     if (ownRead) Step(begin_, "starting a read");
     try {
-      sqlite3_stmt* s = ListStatement(filter->Id(), shape);
-      if (s != nullptr) {
+      const std::string& instance = filter->Id().InstanceId();
+      const std::vector<Collection*> matching = MatchingCollections(filter->Id());
+      // Objects of several collections are merged into write order by seq.
+      std::vector<sqlite3_int64> seqs;
+      std::string id;  // keeps its capacity from one object to the next
+      codec::BodyArena arena;
+      for (Collection* c : matching) {
+        sqlite3_stmt* s = StatementOf(c, instance.empty() ? kList : kListOne);
         Resetter reset(s);
-        // The parts the filter fixes are the filter's; the others pass
-        // through scratch strings that keep their capacity, so each part is
-        // allocated once, by the identifier.
-        const ConfigStoreObjectId& fixed = filter->Id();
-        std::string parts[4] = {fixed.Key(), fixed.Group(), fixed.Component(), fixed.InstanceId()};
-        codec::BodyArena arena;
+        if (!instance.empty()) Bind(s, 1, instance);
         int rc;
         while ((rc = sqlite3_step(s)) == SQLITE_ROW) {
-          for (int c = 0; c < 4; ++c) {
-            if ((shape & (1u << c)) == 0) AssignColumn(s, c, &parts[c]);
-          }
+          if (matching.size() > 1) seqs.push_back(sqlite3_column_int64(s, 0));
+          AssignColumn(s, 1, &id);
           out.push_back(
-              Decode(ConfigStoreObjectId(parts[0], parts[1], parts[2], parts[3]), s, 4, &arena));
+              Decode(ConfigStoreObjectId(c->key, c->group, c->component, id), s, 2, &arena));
         }
         if (rc != SQLITE_DONE) Fail("listing objects");
       }
+      if (matching.size() > 1) InWriteOrder(seqs, &out);
     } catch (...) {
       if (ownRead) RollbackQuietly();
       throw;
@@ -229,6 +218,7 @@ class SqliteStore final : public ConfigStore {
       // the caller's writes, at every level, are gone and must not be
       // reported as committed.
       depth_ = 0;
+      Forget();
       throw ConfigStoreException(
           Where() + ": the transaction was rolled back after an earlier error; nothing committed",
           SQLITE_ABORT_ROLLBACK);
@@ -238,13 +228,16 @@ class SqliteStore final : public ConfigStore {
       --depth_;
       return;
     }
+    FlushSequence();
     Resetter reset(commit_);
     if (sqlite3_step(commit_) != SQLITE_DONE) {
       // A failed COMMIT may leave the transaction open (then Abort ends it).
       depth_ = sqlite3_get_autocommit(db_) == 0 ? 1 : 0;
+      if (depth_ == 0) Forget();
       Fail("committing");
     }
     depth_ = 0;
+    seqLoaded_ = false;  // others may write before our next transaction
   }
 
   void AbortTransaction() override {
@@ -253,14 +246,18 @@ class SqliteStore final : public ConfigStore {
     // SQLite may already have rolled back by itself; there is nothing left.
     if (sqlite3_get_autocommit(db_)) {
       depth_ = 0;
+      Forget();
       return;
     }
+    // A collection made inside what is undone is gone again.
+    ForgetCollections();
     if (depth_ > 1) {
       Step(rollbackTo_, "undoing a nested transaction");
       Step(release_, "undoing a nested transaction");
       --depth_;
       return;
     }
+    Forget();
     Resetter reset(rollback_);
     const int rc = sqlite3_step(rollback_);
     depth_ = sqlite3_get_autocommit(db_) == 0 ? 1 : 0;
@@ -397,23 +394,29 @@ class SqliteStore final : public ConfigStore {
     // schema has to be created; checking again under it settles a race with
     // another process creating the same store.
     Step(begin_, "reading the store header");
-    bool isNew;
+    schema::Found found;
     try {
-      isNew = Inspect();
+      found = schema::Inspect(db_, Where());
     } catch (...) {
       RollbackQuietly();
       throw;
     }
     Step(commit_, "reading the store header");
-    if (isNew) {
-      Step(beginImmediate_, "creating the store");
+    if (found != schema::Found::kCurrent) {
+      // A file of format 1 is upgraded by the first writer that opens it; a
+      // reader that may not write cannot, and gets SQLite's error.
+      const char* what =
+          found == schema::Found::kEmpty ? "creating the store" : "upgrading the store";
+      Step(beginImmediate_, what);
       try {
-        if (Inspect()) CreateSchema();
+        found = schema::Inspect(db_, Where());
+        if (found == schema::Found::kEmpty) schema::Create(db_, Where());
+        if (found == schema::Found::kFormat1) schema::UpgradeFormat1(db_, Where());
       } catch (...) {
         RollbackQuietly();
         throw;
       }
-      Step(commit_, "creating the store");
+      Step(commit_, what);
     }
     // Only now, once the file is known to be ours: switching to WAL rewrites
     // the header. The mode is persistent, so this is a no-op after creation;
@@ -422,12 +425,11 @@ class SqliteStore final : public ConfigStore {
     ExecOnce("PRAGMA synchronous=FULL", "setting the sync mode");
     ExecOnce("PRAGMA journal_size_limit=67108864", "setting the log size limit");
 
-    get_ = Prepare(
-        "SELECT body FROM objects WHERE key = ?1 AND grp = ?2 AND component = ?3 AND "
-        "instance = ?4");
-    put_ = Prepare(
-        "INSERT OR REPLACE INTO objects(key, grp, component, instance, body) "
-        "VALUES(?1, ?2, ?3, ?4, ?5)");
+    findCollection_ =
+        Prepare("SELECT id FROM collections WHERE key = ?1 AND grp = ?2 AND component = ?3");
+    addCollection_ = Prepare("INSERT INTO collections(key, grp, component) VALUES(?1, ?2, ?3)");
+    readSeq_ = Prepare("SELECT next FROM sequence");
+    writeSeq_ = Prepare("UPDATE sequence SET next = ?1");
     FollowStoreMode();
   }
 
@@ -514,145 +516,186 @@ class SqliteStore final : public ConfigStore {
     sqlite3_reset(rollback_);
   }
 
-  // True for a new database, false for one of our stores; throws for
-  // anything else. Runs inside a transaction so the three reads agree.
-  bool Inspect() {
-    // The first read of the file: a non-database fails here (SQLITE_NOTADB).
-    const long long appId = QueryInt("PRAGMA application_id", "reading the store header");
-    const long long version = QueryInt("PRAGMA user_version", "reading the store header");
-    const long long entries = QueryInt("SELECT count(*) FROM sqlite_master", "reading the schema");
-    if (appId == 0 && version == 0 && entries == 0) return true;
-    if (appId != kApplicationId) {
-      throw ConfigStoreException(
-          Where() + ": not a configuration store (a SQLite database of another application)",
-          kErrorNotAStore);
-    }
-    if (version != kSchemaVersion) {
-      throw ConfigStoreException(Where() + ": unknown schema version " + std::to_string(version) +
-                                     " (this library reads version " +
-                                     std::to_string(kSchemaVersion) + ")",
-                                 kErrorNotAStore);
-    }
-    if (QueryInt("SELECT count(*) FROM sqlite_master WHERE type = 'table' AND name = 'objects'",
-                 "reading the schema") != 1) {
-      throw ConfigStoreException(Where() + ": not a configuration store (no objects table)",
-                                 kErrorNotAStore);
-    }
-    return false;
-  }
+  // ---- Collections: a table each (see SqliteSchema.h) --------------------
 
-  void CreateSchema() {
-    ExecOnce(
-        "CREATE TABLE objects(seq INTEGER PRIMARY KEY, key BLOB NOT NULL, grp BLOB NOT NULL, "
-        "component BLOB NOT NULL, instance BLOB NOT NULL, body BLOB NOT NULL)",
-        "creating the schema");
-    ExecOnce("CREATE UNIQUE INDEX objects_id ON objects(key, grp, component, instance)",
-             "creating the schema");
-    ExecOnce(("PRAGMA application_id = " + std::to_string(kApplicationId)).c_str(),
-             "creating the schema");
-    ExecOnce(("PRAGMA user_version = " + std::to_string(kSchemaVersion)).c_str(),
-             "creating the schema");
-  }
+  enum Op { kPut, kList, kListOne, kClear, kErase, kOps };
 
-  // "key = ?1 AND grp = ?2 ..." for the parts a filter shape constrains;
-  // "plus" keeps SQLite from using the identifier index for those terms.
-  static std::string Where(unsigned shape, bool plus) {
-    std::string sql;
-    for (unsigned part = 0; part < 4; ++part) {
-      if ((shape & (1u << part)) == 0) continue;
-      if (!sql.empty()) sql += " AND ";
-      if (plus) sql += '+';
-      sql += kColumns[part];
-      sql += " = ?" + std::to_string(part + 1);
-    }
-    return sql;
-  }
+  struct Collection {
+    sqlite3_int64 id = 0;
+    std::string key, group, component;
+    std::array<sqlite3_stmt*, kOps> statements{};  // prepared on first use
+  };
+  using CollectionKey = std::tuple<std::string, std::string, std::string>;
 
-  // The statement for one filter shape, prepared on first use and kept.
-  sqlite3_stmt* FilterStatement(std::array<sqlite3_stmt*, kShapes>* cache, unsigned shape,
-                                const char* head, const char* tail, bool plus = false) {
-    sqlite3_stmt*& s = (*cache)[shape];
+  sqlite3_stmt* StatementOf(Collection* c, Op op) {
+    sqlite3_stmt*& s = c->statements[op];
     if (s == nullptr) {
-      std::string sql = head;
-      const std::string where = Where(shape, plus);
-      if (!where.empty()) {
-        sql += sql.find(" WHERE ") == std::string::npos ? " WHERE " : " AND ";
-        sql += where;
-      }
-      sql += tail;
+      static const char* const kSql[kOps] = {
+          "INSERT OR REPLACE INTO %(seq, instance, body) VALUES(?1, ?2, ?3)",
+          "SELECT seq, instance, body FROM % ORDER BY rowid",
+          "SELECT seq, instance, body FROM % WHERE instance = ?1", "DELETE FROM %",
+          "DELETE FROM % WHERE instance = ?1"};
+      std::string sql = kSql[op];
+      sql.replace(sql.find('%'), 1, schema::TableOf(c->id));
       s = Prepare(sql);
     }
     return s;
   }
 
-  // Filters on a leading part of the identifier index, short of a whole
-  // identifier, are served by seq ranges.
-  static bool ByRange(unsigned shape) { return (shape & 1u) != 0 && shape != kAllParts; }
-
-  struct Bounds {
-    sqlite3_int64 low = 0;
-    sqlite3_int64 high = 0;
-    sqlite3_int64 count = 0;
-  };
-
-  // The lowest and highest seq of the objects the filter matches, and how
-  // many there are; false when there are none.
-  bool FindBounds(const ConfigStoreObjectId& id, unsigned shape, Bounds* out) {
-    sqlite3_stmt* bounds =
-        FilterStatement(&bounds_, shape, "SELECT min(seq), max(seq), count(*) FROM objects", "");
-    Resetter reset(bounds);
-    BindId(bounds, id, shape);
-    if (sqlite3_step(bounds) != SQLITE_ROW) Fail("finding objects");
-    if (sqlite3_column_type(bounds, 0) == SQLITE_NULL) return false;
-    out->low = sqlite3_column_int64(bounds, 0);
-    out->high = sqlite3_column_int64(bounds, 1);
-    out->count = sqlite3_column_int64(bounds, 2);
-    return true;
+  Collection* Remember(CollectionKey&& key, sqlite3_int64 id) {
+    Collection c;
+    c.id = id;
+    std::tie(c.key, c.group, c.component) = key;
+    return &collections_.emplace(std::move(key), std::move(c)).first->second;
   }
 
-  // The listing statement for a filter, bound and ready to step; null when
-  // nothing can match. Call inside a read transaction.
-  //
-  // A filter on a leading part of the identifier index (a collection, say)
-  // would have SQLite find the rows through the index and then sort them,
-  // whole bodies included, by seq. Instead the index yields only the lowest
-  // and highest seq of the matches, and the table is read in seq order
-  // between them: no sort, and the pages come in file order. When the
-  // matches fill that range (as a collection written in one go does), no
-  // other row lies in it and the rows need no filtering.
-  sqlite3_stmt* ListStatement(const ConfigStoreObjectId& id, unsigned shape) {
-    static const char kSelect[] = "SELECT key, grp, component, instance, body FROM objects";
-    if (!ByRange(shape)) {
-      sqlite3_stmt* s = FilterStatement(&selects_, shape, kSelect, " ORDER BY seq");
-      BindId(s, id, shape);
-      return s;
+  // The collection of that key, group and component; when there is none,
+  // with "create" a new one (its row and its table), else null.
+  Collection* FindCollection(const std::string& key, const std::string& group,
+                             const std::string& component, bool create) {
+    if (last_ != nullptr && last_->key == key && last_->group == group &&
+        last_->component == component) {
+      return last_;
     }
-    // Both range statements are prepared before the bounds choose one, so
-    // the set of prepared statements does not depend on how the rows lie.
-    sqlite3_stmt* filtered = FilterStatement(
-        &rangeSelects_, shape,
-        "SELECT key, grp, component, instance, body FROM objects WHERE seq BETWEEN ?5 AND ?6",
-        " ORDER BY seq", true);
-    if (span_ == nullptr) {
-      span_ = Prepare(
-          "SELECT key, grp, component, instance, body FROM objects WHERE seq BETWEEN ?5 AND ?6 "
-          "ORDER BY seq");
+    CollectionKey k(key, group, component);
+    auto it = collections_.find(k);
+    if (it != collections_.end()) return last_ = &it->second;
+    sqlite3_int64 id = 0;
+    {
+      Resetter reset(findCollection_);
+      Bind(findCollection_, 1, key);
+      Bind(findCollection_, 2, group);
+      Bind(findCollection_, 3, component);
+      const int rc = sqlite3_step(findCollection_);
+      if (rc == SQLITE_ROW) {
+        id = sqlite3_column_int64(findCollection_, 0);
+      } else if (rc != SQLITE_DONE) {
+        Fail("finding a collection");
+      }
     }
-    Bounds bounds;
-    if (!FindBounds(id, shape, &bounds)) return nullptr;
-    if (bounds.high - bounds.low + 1 == bounds.count) {
-      BindRange(span_, bounds.low, bounds.high);
-      return span_;
+    if (id == 0) {
+      if (!create) return nullptr;
+      Resetter reset(addCollection_);
+      Bind(addCollection_, 1, key);
+      Bind(addCollection_, 2, group);
+      Bind(addCollection_, 3, component);
+      if (sqlite3_step(addCollection_) != SQLITE_DONE) Fail("adding a collection");
+      id = sqlite3_last_insert_rowid(db_);
+      ExecOnce(schema::CreateTableSql(id).c_str(), "adding a collection");
     }
-    BindId(filtered, id, shape);
-    BindRange(filtered, bounds.low, bounds.high);
-    return filtered;
+    return last_ = Remember(std::move(k), id);
   }
 
-  void BindRange(sqlite3_stmt* s, sqlite3_int64 low, sqlite3_int64 high) {
-    if (sqlite3_bind_int64(s, 5, low) != SQLITE_OK || sqlite3_bind_int64(s, 6, high) != SQLITE_OK) {
-      Fail("binding a value");
+  // The collections a filter's key, group and component match (an empty
+  // part matches any), in the order they were made.
+  std::vector<Collection*> MatchingCollections(const ConfigStoreObjectId& filter) {
+    const std::string* parts[] = {&filter.Key(), &filter.Group(), &filter.Component()};
+    unsigned shape = 0;
+    for (unsigned i = 0; i < 3; ++i) shape |= parts[i]->empty() ? 0u : 1u << i;
+    std::vector<Collection*> out;
+    if (shape == 7) {
+      if (Collection* c = FindCollection(*parts[0], *parts[1], *parts[2], false)) out.push_back(c);
+      return out;
     }
+    sqlite3_stmt*& q = collectionQueries_[shape];
+    if (q == nullptr) {
+      static const char* const kColumns[] = {"key", "grp", "component"};
+      std::string sql = "SELECT id, key, grp, component FROM collections";
+      for (unsigned i = 0; i < 3; ++i) {
+        if ((shape & (1u << i)) == 0) continue;
+        sql += sql.find(" WHERE ") == std::string::npos ? " WHERE " : " AND ";
+        sql += std::string(kColumns[i]) + " = ?" + std::to_string(i + 1);
+      }
+      q = Prepare(sql + " ORDER BY id");
+    }
+    Resetter reset(q);
+    for (unsigned i = 0; i < 3; ++i) {
+      if (shape & (1u << i)) Bind(q, static_cast<int>(i) + 1, *parts[i]);
+    }
+    CollectionKey k;
+    int rc;
+    while ((rc = sqlite3_step(q)) == SQLITE_ROW) {
+      AssignColumn(q, 1, &std::get<0>(k));
+      AssignColumn(q, 2, &std::get<1>(k));
+      AssignColumn(q, 3, &std::get<2>(k));
+      auto it = collections_.find(k);
+      out.push_back(it != collections_.end()
+                        ? &it->second
+                        : Remember(CollectionKey(k), sqlite3_column_int64(q, 0)));
+    }
+    if (rc != SQLITE_DONE) Fail("finding collections");
+    return out;
+  }
+
+  static void InWriteOrder(const std::vector<sqlite3_int64>& seqs,
+                           std::vector<std::shared_ptr<ConfigStoreObject>>* objects) {
+    std::vector<std::size_t> order(seqs.size());
+    for (std::size_t i = 0; i < order.size(); ++i) order[i] = i;
+    std::sort(order.begin(), order.end(),
+              [&seqs](std::size_t a, std::size_t b) { return seqs[a] < seqs[b]; });
+    std::vector<std::shared_ptr<ConfigStoreObject>> sorted;
+    sorted.reserve(order.size());
+    for (std::size_t i : order) sorted.push_back(std::move((*objects)[i]));
+    objects->swap(sorted);
+  }
+
+  void ForgetCollections() {
+    for (auto& entry : collections_) {
+      for (sqlite3_stmt* s : entry.second.statements) sqlite3_finalize(s);
+    }
+    collections_.clear();
+    last_ = nullptr;
+  }
+
+  void Forget() {
+    ForgetCollections();
+    seqLoaded_ = seqDirty_ = false;
+  }
+
+  // ---- Write order ------------------------------------------------------
+
+  // The seq of the next object written: read once per write transaction,
+  // counted here and stored back before its commit.
+  sqlite3_int64 NextSeq() {
+    if (!seqLoaded_) {
+      Resetter reset(readSeq_);
+      if (sqlite3_step(readSeq_) != SQLITE_ROW) Fail("reading the write sequence");
+      nextSeq_ = sqlite3_column_int64(readSeq_, 0);
+      seqLoaded_ = true;
+    }
+    seqDirty_ = true;
+    return nextSeq_++;
+  }
+
+  void FlushSequence() {
+    if (!seqDirty_) return;
+    Resetter reset(writeSeq_);
+    if (sqlite3_bind_int64(writeSeq_, 1, nextSeq_) != SQLITE_OK ||
+        sqlite3_step(writeSeq_) != SQLITE_DONE) {
+      Fail("storing the write sequence");
+    }
+    seqDirty_ = false;
+  }
+
+  // Runs "write" inside the caller's transaction, or else in one of its
+  // own: a write may touch several tables and the sequence.
+  template <typename Body>
+  void Write(Body&& write) {
+    if (depth_ > 0) {
+      write();
+      return;
+    }
+    Step(beginImmediate_, "starting a write");
+    try {
+      write();
+      FlushSequence();
+      Step(commit_, "committing a write");
+    } catch (...) {
+      RollbackQuietly();
+      Forget();
+      throw;
+    }
+    seqLoaded_ = false;
   }
 
   // As a BLOB with its length: every byte, NUL included, survives, and BLOB
@@ -660,13 +703,6 @@ class SqliteStore final : public ConfigStore {
   void Bind(sqlite3_stmt* s, int index, const std::string& bytes) {
     if (sqlite3_bind_blob64(s, index, bytes.data(), bytes.size(), SQLITE_STATIC) != SQLITE_OK) {
       Fail("binding a value");
-    }
-  }
-
-  void BindId(sqlite3_stmt* s, const ConfigStoreObjectId& id, unsigned shape) {
-    const std::string* parts[] = {&id.Key(), &id.Group(), &id.Component(), &id.InstanceId()};
-    for (unsigned part = 0; part < 4; ++part) {
-      if (shape & (1u << part)) Bind(s, static_cast<int>(part) + 1, *parts[part]);
     }
   }
 
@@ -710,13 +746,19 @@ class SqliteStore final : public ConfigStore {
   sqlite3_stmt* savepoint_ = nullptr;
   sqlite3_stmt* release_ = nullptr;
   sqlite3_stmt* rollbackTo_ = nullptr;
-  sqlite3_stmt* get_ = nullptr;
-  sqlite3_stmt* put_ = nullptr;
-  std::array<sqlite3_stmt*, kShapes> selects_{};
-  std::array<sqlite3_stmt*, kShapes> bounds_{};
-  std::array<sqlite3_stmt*, kShapes> rangeSelects_{};
-  sqlite3_stmt* span_ = nullptr;
-  std::array<sqlite3_stmt*, kShapes> deletes_{};
+  sqlite3_stmt* findCollection_ = nullptr;
+  sqlite3_stmt* addCollection_ = nullptr;
+  sqlite3_stmt* readSeq_ = nullptr;
+  sqlite3_stmt* writeSeq_ = nullptr;
+  std::array<sqlite3_stmt*, 8> collectionQueries_{};  // by which of key, group, component are set
+  // The collections met so far, with their statements. Within a write
+  // transaction this may hold collections made in it: undoing it forgets
+  // them all.
+  std::map<CollectionKey, Collection> collections_;
+  Collection* last_ = nullptr;  // the one used last, checked before the map
+  bool seqLoaded_ = false;      // nextSeq_ was read within the open write
+  bool seqDirty_ = false;       // and has been used since
+  sqlite3_int64 nextSeq_ = 0;
 };
 
 }  // namespace
