@@ -340,6 +340,13 @@ TEST_F(SqliteStoreTest, ConnectionsSeeOnlyCommittedWrites) {
   EXPECT_THAT(List(*reader), ElementsAre("y"));
   Set(*reader, Sample("from reader"));
   EXPECT_THAT(List(*writer), ElementsAre("y", "from reader"));
+  // Write order holds across collections and connections: each write takes
+  // its place after whatever any connection committed before it.
+  Set(*writer, Obj("other", "g", "c", "w1"));
+  Set(*reader, Sample("r1"));
+  Set(*reader, Sample("r2"));
+  Set(*writer, Obj("other", "g", "c", "w2"));
+  EXPECT_THAT(List(*reader), ElementsAre("y", "from reader", "w1", "r1", "r2", "w2"));
 }
 
 // The catalogue is private whatever the umask: directories the store makes
