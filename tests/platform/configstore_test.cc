@@ -340,12 +340,17 @@ TEST_F(SqliteStoreTest, ConnectionsSeeOnlyCommittedWrites) {
   EXPECT_THAT(List(*reader), ElementsAre("y"));
   Set(*reader, Sample("from reader"));
   EXPECT_THAT(List(*writer), ElementsAre("y", "from reader"));
-  // Write order holds across collections and connections: each write takes
-  // its place after whatever any connection committed before it.
-  Set(*writer, Obj("other", "g", "c", "w1"));
+  // Write order holds across collections, connections and transactions:
+  // each write takes its place after whatever any connection committed.
+  auto inTransaction = [&writer](const char* name) {
+    writer->BeginTransaction();
+    Set(*writer, Obj("other", "g", "c", name));
+    writer->CommitTransaction();
+  };
+  inTransaction("w1");
   Set(*reader, Sample("r1"));
   Set(*reader, Sample("r2"));
-  Set(*writer, Obj("other", "g", "c", "w2"));
+  inTransaction("w2");
   EXPECT_THAT(List(*reader), ElementsAre("y", "from reader", "w1", "r1", "r2", "w2"));
 }
 

@@ -502,14 +502,6 @@ class SqliteStore final : public ConfigStore {
     Step(once.s, what);
   }
 
-  long long QueryInt(const char* sql, const char* what) {
-    OneShot once;
-    if (sqlite3_prepare_v2(db_, sql, -1, &once.s, nullptr) != SQLITE_OK) Fail(what);
-    const int rc = sqlite3_step(once.s);
-    if (rc != SQLITE_ROW) Fail(what);
-    return sqlite3_column_int64(once.s, 0);
-  }
-
   void RollbackQuietly() {
     if (sqlite3_get_autocommit(db_)) return;
     sqlite3_step(rollback_);
