@@ -43,6 +43,18 @@ std::set<std::string> SurvivingIds(const std::vector<KarstPolicyInfo>& policies)
   return ids;
 }
 
+// The field a record is stored and looked up under: empty, no look-up finds
+// the record; repeated, the store keeps only the last of them.
+void KeyWarnings(const std::string& field, const std::string& value, const std::string& at,
+                 FirstSeen& seen, std::vector<std::string>& out) {
+  if (value.empty()) {
+    out.push_back(at + "." + field + " is empty; look-ups by " + field + " cannot find it");
+  }
+  if (auto first = seen.Repeats(value, at)) {
+    out.push_back(at + "." + field + " " + Shown(value) + " repeats " + *first + kKeepsLast);
+  }
+}
+
 void BlobWarnings(const KarstPolicyInfo& policy, const std::string& at,
                   std::vector<std::string>& out) {
   FirstSeen namespaces;
@@ -65,10 +77,7 @@ std::vector<std::string> PolicyWarnings(const std::vector<KarstPolicyInfo>& poli
   for (std::size_t i = 0; i < policies.size(); ++i) {
     const KarstPolicyInfo& policy = policies[i];
     const std::string at = Indexed("policies", i);
-    if (policy.name.empty()) out.push_back(at + ".name is empty; look-ups by name cannot find it");
-    if (auto first = names.Repeats(policy.name, at)) {
-      out.push_back(at + ".name " + Shown(policy.name) + " repeats " + *first + kKeepsLast);
-    }
+    KeyWarnings("name", policy.name, at, names, out);
     // An empty id is never looked up, so sharing it hides nothing.
     if (auto first = policy.policy_id.empty() ? std::nullopt : ids.Repeats(policy.policy_id, at)) {
       out.push_back(at + ".policy_id " + Shown(policy.policy_id) + " repeats " + *first +
@@ -88,10 +97,7 @@ std::vector<std::string> DatastoreWarnings(const std::vector<KarstDatastoreInfo>
   for (std::size_t i = 0; i < datastores.size(); ++i) {
     const KarstDatastoreInfo& datastore = datastores[i];
     const std::string at = Indexed("datastores", i);
-    if (datastore.url.empty()) out.push_back(at + ".url is empty; look-ups by url cannot find it");
-    if (auto first = urls.Repeats(datastore.url, at)) {
-      out.push_back(at + ".url " + Shown(datastore.url) + " repeats " + *first + kKeepsLast);
-    }
+    KeyWarnings("url", datastore.url, at, urls, out);
     // An empty drp_policy_id means no default policy.
     if (policies && !datastore.drp_policy_id.empty() && ids.count(datastore.drp_policy_id) == 0) {
       out.push_back(at + ".drp_policy_id " + Shown(datastore.drp_policy_id) +

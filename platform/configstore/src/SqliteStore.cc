@@ -250,8 +250,8 @@ class SqliteStore final : public ConfigStore {
       return;
     }
     // A collection made inside what is undone is gone again.
-    ForgetCollections();
     if (depth_ > 1) {
+      ForgetCollections();
       Step(rollbackTo_, "undoing a nested transaction");
       Step(release_, "undoing a nested transaction");
       --depth_;
