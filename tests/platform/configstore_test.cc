@@ -256,13 +256,13 @@ TEST_P(StoreConformance, TransactionsNest) {
     store_->BeginTransaction();
     Set(*store_, Obj("k", "g", "c", "outer"));
     store_->BeginTransaction();
-    Set(*store_, Obj("k", "g", "c", "undone"));
+    Set(*store_, Obj("fresh", "g", "c", "undone"));
     store_->BeginTransaction();  // committed into the one then aborted
     store_->DeleteObjects(Filter("k", "g", "c", "before"));
     store_->CommitTransaction();
     store_->AbortTransaction();
     store_->BeginTransaction();
-    Set(*store_, Obj("k", "g", "c", "inner"));
+    Set(*store_, Obj("fresh", "g", "c", "inner"));
     store_->CommitTransaction();
     EXPECT_THAT(List(*store_), ElementsAre("before", "outer", "inner"));
     if (commitOuter) {

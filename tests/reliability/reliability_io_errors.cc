@@ -254,7 +254,8 @@ TEST(IoErrors, FileSizeLimitAndFullTmpfs) {
 
 // A store file of the earlier format, as that build wrote it, is upgraded in
 // place by the first process that opens it, in one transaction: a crash at
-// any write, sync or truncate of the upgrade, or an I/O error there, leaves
+// any write, sync or truncate of the upgrade, or an I/O error at any of its
+// calls (reads included), leaves
 // a file from which the next process reads the whole catalogue in its order.
 TEST(IoErrors, UpgradeOfAnOldStoreFileIsAllOrNothing) {
   FaultVfs::Install();
@@ -285,7 +286,7 @@ TEST(IoErrors, UpgradeOfAnOldStoreFileIsAllOrNothing) {
 
   restore();
   FaultVfs::KeepLog(true);
-  FaultVfs::Arm({IoFault::kNone, io::kChanges});
+  FaultVfs::Arm({IoFault::kNone, io::kChanges | io::kRead});
   TavoConfigStore::NewSqliteStore(path);  // upgrades, and closes
   const int calls = static_cast<int>(FaultVfs::Log().size());
   FaultVfs::KeepLog(false);
@@ -297,7 +298,7 @@ TEST(IoErrors, UpgradeOfAnOldStoreFileIsAllOrNothing) {
     for (int k = 1; k <= calls; ++k) {
       restore();
       const ChildResult r = RunChild([&](int fd) {
-        FaultVfs::Arm({action, io::kChanges, k});
+        FaultVfs::Arm({action, io::kChanges | io::kRead, k});
         try {
           TavoConfigStore::NewSqliteStore(path);
         } catch (const ConfigStoreException& e) {
@@ -315,11 +316,12 @@ TEST(IoErrors, UpgradeOfAnOldStoreFileIsAllOrNothing) {
       ++points;
     }
   }
-  ReportFigures("upgrade",
-                "upgrade: an old store file, a crash (whole or torn write) or an I/O error at "
-                "each of the %d writes, syncs and truncates of its upgrade: %d points, errors "
-                "naming the file %d, next process read the catalogue whole %d, wrong %d",
-                calls, points, refused, points - wrong, wrong);
+  ReportFigures(
+      "upgrade",
+      "upgrade: an old store file, a crash (whole or torn write) or an I/O error at "
+      "each of the %d reads, writes, syncs and truncates of its upgrade: %d points, errors "
+      "naming the file %d, next process read the catalogue whole %d, wrong %d",
+      calls, points, refused, points - wrong, wrong);
 }
 
 }  // namespace karst_reliability
