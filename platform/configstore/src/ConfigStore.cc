@@ -1,11 +1,14 @@
 #include "TavoConfigStore/ConfigStore.h"
+#include "TavoConfigStore/EtcdStore.h"
 
 #include <unistd.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstdlib>
 #include <exception>
 #include <mutex>
+#include <thread>
 
 namespace TavoConfigStore {
 
@@ -68,7 +71,7 @@ std::shared_ptr<ConfigStore> DefaultStore() {
     // it here could disturb the parent's locks and WAL, so it is abandoned.
     new std::shared_ptr<ConfigStore>(std::move(cache.store));
   }
-  cache.store = NewSqliteStore(path);
+  cache.store = OpenStore(path);
   cache.pid = getpid();
   cache.path = std::move(path);
   return NewHandle(cache);
@@ -76,6 +79,16 @@ std::shared_ptr<ConfigStore> DefaultStore() {
 }  // namespace
 
 ConfigStore::~ConfigStore() = default;
+
+bool ConfigStore::WaitForChange(int timeoutMs) {
+  std::this_thread::sleep_for(std::chrono::milliseconds(timeoutMs));
+  return true;
+}
+
+std::shared_ptr<ConfigStore> OpenStore(const std::string& locator) {
+  if (IsEtcdLocator(locator)) return NewEtcdStore(ParseEtcdLocator(locator));
+  return NewSqliteStore(locator);
+}
 
 std::shared_ptr<ConfigStore> ConfigStore::GetStore(const std::string& nameSpace) {
   if (nameSpace != sGlobalNamespace) {

@@ -30,5 +30,6 @@ std::vector<std::shared_ptr<ConfigStoreObject>> ForwardingStore::GetObjects(
 void ForwardingStore::BeginTransaction() { target_->BeginTransaction(); }
 void ForwardingStore::CommitTransaction() { target_->CommitTransaction(); }
 void ForwardingStore::AbortTransaction() { target_->AbortTransaction(); }
+bool ForwardingStore::WaitForChange(int timeoutMs) { return target_->WaitForChange(timeoutMs); }
 
 }  // namespace TavoConfigStore

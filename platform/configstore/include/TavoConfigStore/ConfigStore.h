@@ -62,6 +62,12 @@ class CONFIGSTORE_EXPORT ConfigStore {
   virtual void BeginTransaction() = 0;
   virtual void CommitTransaction() = 0;
   virtual void AbortTransaction() = 0;
+
+  // Waits until another connection may have changed the store, or until
+  // "timeoutMs" has passed. True when a change was seen (or when the backend
+  // cannot tell, so a caller should read again); false on a quiet timeout.
+  // Not for use inside a transaction. The base version sleeps and says true.
+  virtual bool WaitForChange(int timeoutMs);
 };
 
 // How a SQLite store waits for another process's write lock.
@@ -84,7 +90,11 @@ CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewSqliteStore(const std::string
                                                                const SqliteStoreOptions& options);
 CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewMemoryStore();
 
-// $TAVO_CONFIGSTORE_PATH, else $XDG_STATE_HOME/tavo/configstore.db, else
+// The store a locator names: an "etcd://" or "etcds://" locator (see
+// EtcdStore.h), otherwise the path of a SQLite store.
+CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> OpenStore(const std::string& locator);
+
+// $TAVO_CONFIGSTORE_PATH (a path or an etcd locator), else $XDG_STATE_HOME/tavo/configstore.db, else
 // $HOME/.local/state/tavo/configstore.db (each of the last two only when the
 // variable holds an absolute path). Without any of them there is no default:
 // throws ConfigStoreException with kErrorNoStorePath rather than guess.

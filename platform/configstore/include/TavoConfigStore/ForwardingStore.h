@@ -30,6 +30,7 @@ class CONFIGSTORE_EXPORT ForwardingStore : public ConfigStore {
   void BeginTransaction() override;
   void CommitTransaction() override;
   void AbortTransaction() override;
+  bool WaitForChange(int timeoutMs) override;
 
  private:
   std::shared_ptr<ConfigStore> target_;
