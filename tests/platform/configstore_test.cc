@@ -96,6 +96,12 @@ std::int32_t CodeOf(F&& f) {
 class StoreConformance : public ::testing::TestWithParam<std::string> {
  protected:
   void SetUp() override {
+    if (GetParam() == "etcd") {
+      static int n = 0;
+      store_ = OpenStore(std::string("etcd://") + std::getenv("KARST_TEST_ETCD") + "/t" +
+                         std::to_string(getpid()) + "-" + std::to_string(++n));
+      return;
+    }
     store_ = GetParam() == "memory" ? NewMemoryStore() : NewSqliteStore(dir_.File("store.db"));
   }
 
@@ -308,7 +314,7 @@ TEST_P(StoreConformance, ObjectsHandedOutAreCopies) {
   EXPECT_TRUE(sub->GetValue("n", &n) && n == 3);
 }
 
-INSTANTIATE_TEST_SUITE_P(Backends, StoreConformance, ::testing::Values("memory", "sqlite"));
+INSTANTIATE_TEST_SUITE_P(Backends, StoreConformance, ::testing::Values("memory", "sqlite", "etcd"));
 
 std::shared_ptr<ConfigStoreObject> Sample(const std::string& instance, int subs = 2) {
   auto o = Obj("pool", "storage", "tavo", instance);

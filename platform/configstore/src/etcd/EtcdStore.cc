@@ -1,10 +1,927 @@
+// The etcd backend: a store that many hosts share through one cluster.
+//
+// Transactions are kept here until the outermost commit and then applied in
+// one of two ways (EtcdLayout.h has the keys):
+//  - small changes (one etcd request's worth, no collection cleared) go in
+//    place into the current generations, in one etcd transaction;
+//  - anything else writes each changed collection whole into a new
+//    generation, in as many requests as it takes, and then makes the new
+//    generations current in one small etcd transaction that compares each
+//    collection's version and that the writer's lease is still alive. Until
+//    that switch no reader sees any of it; after it every reader sees all of
+//    it. Readers read the pointers and the objects at one revision.
+// A commit that finds a collection changed by another writer since this
+// transaction read it fails with kErrorConflict: what it would write may
+// depend on what it read. A transaction that only wrote a collection
+// (a replace: clear, then write) is applied again to the new state instead,
+// since its outcome does not depend on what was there.
+
+#include <grpcpp/grpcpp.h>
+
+#include <algorithm>
+#include <chrono>
+#include <condition_variable>
+#include <cstdio>
+#include <map>
+#include <mutex>
+#include <random>
+#include <set>
+#include <thread>
+#include <vector>
+
+#include "../DamagedObject.h"
+#include "../ObjectCodec.h"
+#include "EtcdClient.h"
+#include "EtcdLayout.h"
 #include "TavoConfigStore/EtcdStore.h"
 
 namespace TavoConfigStore {
+namespace {
+
+using etcdlayout::Header;
+using etcdlayout::Keys;
+using etcdlayout::OrderKind;
+using etcdserverpb::Compare;
+using etcdserverpb::RangeRequest;
+using etcdserverpb::RequestOp;
+using etcdserverpb::TxnRequest;
+
+constexpr std::int64_t kLeaseSeconds = 60;
+constexpr int kCommitAttempts = 5;
+constexpr int kCompactedCode = kErrorEtcdBase + static_cast<int>(grpc::StatusCode::OUT_OF_RANGE);
+
+std::string NewId() {
+  static std::mutex mu;
+  static std::mt19937_64 random{std::random_device{}()};
+  std::lock_guard<std::mutex> lock(mu);
+  char text[17];
+  std::snprintf(text, sizeof text, "%016llx", static_cast<unsigned long long>(random()));
+  return text;
+}
+
+// A pointer's value: the generation, then the token of the commit that wrote
+// it, by which a writer recognises its own commit after an unclear reply.
+std::string PointerValue(const std::string& gen, const std::string& token) {
+  return gen + '\0' + token;
+}
+std::string GenerationOf(const std::string& pointerValue) {
+  return pointerValue.substr(0, pointerValue.find('\0'));
+}
+std::string TokenOf(const std::string& pointerValue) {
+  const std::size_t zero = pointerValue.find('\0');
+  return zero == std::string::npos ? std::string() : pointerValue.substr(zero + 1);
+}
+
+struct Order {
+  std::int64_t revision = 0;
+  std::uint64_t index = 0;
+  bool operator<(const Order& other) const {
+    return revision != other.revision ? revision < other.revision : index < other.index;
+  }
+};
+
+// A collection as the cluster has it at one revision.
+struct Current {
+  std::string gen;
+  std::int64_t version = 0;  // the pointer's mod revision; 0: no such collection
+  std::string token;
+};
+
+struct Pointers {
+  std::int64_t revision = 0;
+  std::map<std::string, Current> byCollection;
+};
+
+// One stored object of a generation, its bytes still in the reply.
+struct Entry {
+  std::string instance;
+  Order order;
+  std::string_view body;
+  std::string joined;  // a body stored in several parts, put together
+  std::string damage;  // why the object cannot be read, if it cannot
+};
+
+struct Put {
+  std::uint64_t seq = 0;
+  std::string body;
+};
+
+// What an open transaction did to one collection.
+struct Pending {
+  bool cleared = false;
+  std::set<std::string> deleted;
+  std::map<std::string, Put> puts;
+  bool Touched() const { return cleared || !deleted.empty() || !puts.empty(); }
+};
+
+struct TxnState {
+  std::map<std::string, Pending> collections;
+  std::uint64_t nextSeq = 0;
+};
+
+void AddCompareVersion(TxnRequest* txn, const std::string& key, const Current& current) {
+  Compare* compare = txn->add_compare();
+  compare->set_key(key);
+  if (current.version == 0) {
+    compare->set_target(Compare::VERSION);
+    compare->set_result(Compare::EQUAL);
+    compare->set_version(0);
+  } else {
+    compare->set_target(Compare::MOD);
+    compare->set_result(Compare::EQUAL);
+    compare->set_mod_revision(current.version);
+  }
+}
+
+void AddPut(std::vector<RequestOp>* ops, std::string key, std::string value,
+            std::int64_t lease = 0) {
+  auto* put = ops->emplace_back().mutable_request_put();
+  put->set_key(std::move(key));
+  put->set_value(std::move(value));
+  put->set_lease(lease);
+}
+
+void AddDelete(std::vector<RequestOp>* ops, std::string key, std::string rangeEnd = {}) {
+  auto* del = ops->emplace_back().mutable_request_delete_range();
+  del->set_key(std::move(key));
+  del->set_range_end(std::move(rangeEnd));
+}
+
+void AddDeletePrefix(std::vector<RequestOp>* ops, const std::string& prefix) {
+  AddDelete(ops, prefix, PrefixEnd(prefix));
+}
+
+TxnRequest TxnOf(std::vector<RequestOp>* ops) {
+  TxnRequest txn;
+  for (RequestOp& op : *ops) *txn.add_success() = std::move(op);
+  ops->clear();
+  return txn;
+}
+
+// Wakes WaitForChange when another writer commits: a watch on the pointers,
+// which every commit rewrites, read by a thread of its own.
+class ChangeFeed {
+ public:
+  ChangeFeed(EtcdClient& client, std::string key, std::int64_t startRevision)
+      : client_(client), key_(std::move(key)), next_(startRevision) {
+    thread_ = std::thread([this] { Run(); });
+  }
+  ~ChangeFeed() {
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      stopping_ = true;
+      if (context_) context_->TryCancel();
+    }
+    changed_.notify_all();
+    thread_.join();
+  }
+
+  bool Wait(int timeoutMs) {
+    std::unique_lock<std::mutex> lock(mu_);
+    changed_.wait_for(lock, std::chrono::milliseconds(timeoutMs), [this] { return seen_; });
+    const bool seen = seen_;
+    seen_ = false;
+    return seen;
+  }
+
+ private:
+  void Run() {
+    while (true) {
+      auto context = std::make_shared<grpc::ClientContext>();
+      try {
+        client_.Prepare(context.get(), false);
+      } catch (const ConfigStoreException&) {
+        // Credentials refused or cluster away: the wait below says "look
+        // again", and the caller's read reports the failure.
+      }
+      {
+        std::lock_guard<std::mutex> lock(mu_);
+        if (stopping_) return;
+        context_ = context;
+      }
+      auto stream = client_.WatchStub().Watch(context.get());
+      etcdserverpb::WatchRequest request;
+      auto* create = request.mutable_create_request();
+      create->set_key(key_);
+      create->set_range_end(PrefixEnd(key_));
+      create->set_start_revision(next_);
+      etcdserverpb::WatchResponse response;
+      if (stream->Write(request)) {
+        while (stream->Read(&response)) {
+          if (response.compact_revision() > 0) next_ = response.compact_revision();
+          if (response.events_size() > 0) {
+            next_ = response.events(response.events_size() - 1).kv().mod_revision() + 1;
+          }
+          if (response.events_size() > 0 || response.compact_revision() > 0) Signal();
+          if (response.canceled()) break;
+        }
+      }
+      context->TryCancel();
+      stream->Finish();
+      {
+        std::unique_lock<std::mutex> lock(mu_);
+        context_.reset();
+        if (stopping_) return;
+        // A lost stream may have missed a change: say so, and the caller's
+        // next read shows what the cluster holds (or why it cannot).
+        seen_ = true;
+        changed_.notify_all();
+        changed_.wait_for(lock, std::chrono::milliseconds(500), [this] { return stopping_; });
+        if (stopping_) return;
+      }
+    }
+  }
+
+  void Signal() {
+    std::lock_guard<std::mutex> lock(mu_);
+    seen_ = true;
+    changed_.notify_all();
+  }
+
+  EtcdClient& client_;
+  std::string key_;
+  std::int64_t next_;
+  std::mutex mu_;
+  std::condition_variable changed_;
+  bool seen_ = false;
+  bool stopping_ = false;
+  std::shared_ptr<grpc::ClientContext> context_;
+  std::thread thread_;
+};
+
+class EtcdStore final : public ConfigStore {
+ public:
+  explicit EtcdStore(const EtcdStoreOptions& options) : client_(options), keys_(options.prefix) {}
+
+  ~EtcdStore() override { feed_.reset(); }
+
+  std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
+    std::lock_guard<std::mutex> lock(mu_);
+    const std::string collection = etcdlayout::CollectionOf(id);
+    if (depth_ > 0) {
+      auto it = txn_.collections.find(collection);
+      if (it != txn_.collections.end()) {
+        const Pending& pending = it->second;
+        auto put = pending.puts.find(id.InstanceId());
+        if (put != pending.puts.end()) return DecodePut(id, put->second);
+        if (pending.cleared || pending.deleted.count(id.InstanceId())) return nullptr;
+      }
+    }
+    return Reading([&]() -> std::shared_ptr<ConfigStoreObject> {
+      const Pointers pointers = ReadPointers(collection, 0);
+      auto it = pointers.byCollection.find(collection);
+      Observe(collection, it == pointers.byCollection.end() ? Current() : it->second);
+      if (it == pointers.byCollection.end()) return nullptr;
+      std::vector<Entry> entries;
+      etcdserverpb::RangeResponse reply;
+      ReadGeneration(it->second.gen, &id.InstanceId(), pointers.revision, &reply, &entries);
+      if (entries.empty()) return nullptr;
+      return Decode(id, entries.front(), nullptr);
+    });
+  }
+
+  void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
+                 std::int32_t& /*flags*/) override {
+    if (!object) throw ConfigStoreException(client_.Where() + ": SetObject of null", kErrorNullArgument);
+    DamagedObject::RefuseWrite(*object);
+    Put put;
+    codec::EncodeObject(*object, &put.body);
+    std::lock_guard<std::mutex> lock(mu_);
+    InTransaction([&] {
+      Pending& pending = txn_.collections[etcdlayout::CollectionOf(object->Id())];
+      put.seq = txn_.nextSeq++;
+      // Erased first: a replaced object moves to the end of the write order.
+      pending.puts.erase(object->Id().InstanceId());
+      pending.puts.emplace(object->Id().InstanceId(), std::move(put));
+    });
+  }
+
+  void DeleteObjects(const std::shared_ptr<FilterSpecObject>& filter) override {
+    if (!filter) {
+      throw ConfigStoreException(client_.Where() + ": DeleteObjects of null", kErrorNullArgument);
+    }
+    std::lock_guard<std::mutex> lock(mu_);
+    InTransaction([&] {
+      const ConfigStoreObjectId& want = filter->Id();
+      const Pointers pointers = Reading([&] { return ReadPointers(ExactCollection(want), 0); });
+      std::set<std::string> names;
+      for (const auto& [name, current] : pointers.byCollection) {
+        if (CollectionMatches(*filter, name)) names.insert(name);
+      }
+      for (const auto& [name, pending] : txn_.collections) {
+        if (CollectionMatches(*filter, name)) names.insert(name);
+      }
+      for (const std::string& name : names) {
+        Pending& pending = txn_.collections[name];
+        if (want.InstanceId().empty()) {
+          pending.cleared = true;
+          pending.deleted.clear();
+          pending.puts.clear();
+        } else {
+          pending.deleted.insert(want.InstanceId());
+          pending.puts.erase(want.InstanceId());
+        }
+      }
+    });
+  }
+
+  std::vector<std::shared_ptr<ConfigStoreObject>> GetObjects(
+      const std::shared_ptr<FilterSpecObject>& filter) override {
+    if (!filter) {
+      throw ConfigStoreException(client_.Where() + ": GetObjects of null", kErrorNullArgument);
+    }
+    std::lock_guard<std::mutex> lock(mu_);
+    return Reading([&] { return List(*filter); });
+  }
+
+  void BeginTransaction() override {
+    std::lock_guard<std::mutex> lock(mu_);
+    if (depth_ > 0) saved_.push_back(txn_);
+    ++depth_;
+  }
+
+  void CommitTransaction() override {
+    std::lock_guard<std::mutex> lock(mu_);
+    if (depth_ == 0) {
+      throw ConfigStoreException(client_.Where() + ": no transaction to commit",
+                                 kErrorNoTransaction);
+    }
+    if (depth_ > 1) {
+      saved_.pop_back();
+      --depth_;
+      return;
+    }
+    // A failed commit leaves the transaction open, for the caller to abort.
+    Apply();
+    Reset();
+  }
+
+  void AbortTransaction() override {
+    std::lock_guard<std::mutex> lock(mu_);
+    if (depth_ == 0) return;
+    if (depth_ > 1) {
+      txn_ = std::move(saved_.back());
+      saved_.pop_back();
+      --depth_;
+      return;
+    }
+    Reset();
+  }
+
+  bool WaitForChange(int timeoutMs) override {
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      if (!feed_) {
+        // Changes after this revision count: anything before it the caller
+        // has read already.
+        const Pointers now = ReadPointers(std::string(), 0);
+        feed_ = std::make_unique<ChangeFeed>(client_, keys_.Pointers(), now.revision + 1);
+      }
+    }
+    return feed_->Wait(timeoutMs);
+  }
+
+ private:
+  // ---- Reading ------------------------------------------------------------
+
+  // Runs a read again when etcd compacted away the revision it was reading
+  // at between its requests.
+  template <typename Read>
+  auto Reading(const Read& read) -> decltype(read()) {
+    for (int attempt = 1;; ++attempt) {
+      try {
+        return read();
+      } catch (const ConfigStoreException& e) {
+        if (e.Code() != kCompactedCode || attempt == 3) throw;
+      }
+    }
+  }
+
+  // The collection a filter names exactly, or "" when it leaves a part open.
+  static std::string ExactCollection(const ConfigStoreObjectId& id) {
+    if (id.Key().empty() || id.Group().empty() || id.Component().empty()) return std::string();
+    return etcdlayout::CollectionOf(id);
+  }
+
+  static bool CollectionMatches(const FilterSpecObject& filter, const std::string& name) {
+    ConfigStoreObjectId id("", "", "");
+    if (!etcdlayout::ParseCollection(name, &id)) return false;
+    id.SetInstanceId(filter.Id().InstanceId());
+    return filter.Matches(id);
+  }
+
+  // The pointer of "collection", or of every collection when it is "".
+  Pointers ReadPointers(const std::string& collection, std::int64_t revision) {
+    RangeRequest request;
+    if (collection.empty()) {
+      request.set_key(keys_.Pointers());
+      request.set_range_end(PrefixEnd(keys_.Pointers()));
+    } else {
+      request.set_key(keys_.Pointer(collection));
+    }
+    request.set_revision(revision);
+    const etcdserverpb::RangeResponse reply = client_.Range(request);
+    Pointers pointers;
+    pointers.revision = reply.header().revision();
+    for (const auto& kv : reply.kvs()) {
+      Current current;
+      current.gen = GenerationOf(kv.value());
+      current.token = TokenOf(kv.value());
+      current.version = kv.mod_revision();
+      pointers.byCollection.emplace(kv.key().substr(keys_.Pointers().size()), std::move(current));
+    }
+    return pointers;
+  }
+
+  // The objects of a generation (or its one object "instance") at
+  // "revision", in the order the cluster keeps the keys. Their bytes stay
+  // in "*reply".
+  void ReadGeneration(const std::string& gen, const std::string* instance, std::int64_t revision,
+                      etcdserverpb::RangeResponse* reply, std::vector<Entry>* entries) {
+    const std::string base = keys_.Generation(gen);
+    RangeRequest request;
+    request.set_key(instance ? keys_.Object(gen, *instance) : base);
+    request.set_range_end(PrefixEnd(request.key()));
+    request.set_revision(revision);
+    *reply = client_.Range(request);
+
+    std::int64_t headRevision = 0;
+    const auto& kvs = reply->kvs();
+    for (int i = 0; i < kvs.size(); ++i) {
+      std::string_view key(kvs[i].key());
+      key.remove_prefix(base.size());
+      if (key.empty()) {
+        headRevision = kvs[i].create_revision();
+        continue;
+      }
+      const std::size_t zero = key.find('\0');
+      Entry entry;
+      Header header;
+      std::string_view value(kvs[i].value());
+      if (zero == std::string_view::npos ||
+          !etcdlayout::Unescape(key.substr(0, zero), &entry.instance)) {
+        continue;  // not an object's key: nothing of ours to report
+      }
+      const std::string part0 = std::string(key.substr(0, zero + 1)) + Keys::PartSuffix(0);
+      if (key != part0) {
+        entry.damage = "a part of an object without its first part";
+      } else if (!etcdlayout::ReadHeader(&value, &header)) {
+        entry.damage = "unreadable object header";
+      } else {
+        entry.body = value;
+        if (header.parts > 1) entry.joined.assign(value);
+        for (std::uint64_t part = 1; part < header.parts && entry.damage.empty(); ++part) {
+          const std::string want = std::string(key.substr(0, zero + 1)) + Keys::PartSuffix(part);
+          if (i + 1 < kvs.size() && std::string_view(kvs[i + 1].key()).substr(base.size()) == want) {
+            entry.joined += kvs[++i].value();
+          } else {
+            entry.damage = "part " + std::to_string(part) + " of the object is missing";
+          }
+        }
+        if (header.parts > 1) entry.body = entry.joined;
+        entry.order.index = header.index;
+        entry.order.revision = header.kind == OrderKind::kWritten     ? header.revision
+                               : header.kind == OrderKind::kOwnRevision ? kvs[i].mod_revision()
+                                                                        : -1;  // set below
+      }
+      // Parts past the ones the header announced belong to nothing.
+      while (i + 1 < kvs.size() &&
+             std::string_view(kvs[i + 1].key()).substr(base.size(), zero + 1) ==
+                 key.substr(0, zero + 1)) {
+        ++i;
+      }
+      entries->push_back(std::move(entry));
+    }
+    for (Entry& entry : *entries) {
+      if (entry.order.revision == -1) entry.order.revision = headRevision;
+    }
+  }
+
+  std::shared_ptr<ConfigStoreObject> Decode(const ConfigStoreObjectId& collection,
+                                            const Entry& entry, codec::BodyArena* arena) {
+    ConfigStoreObjectId id(collection.Key(), collection.Group(), collection.Component());
+    id.SetInstanceId(entry.instance);
+    std::string damage = entry.damage;
+    if (damage.empty()) {
+      try {
+        return codec::DecodeObject(std::move(id),
+                                   reinterpret_cast<const unsigned char*>(entry.body.data()),
+                                   entry.body.size(), arena);
+      } catch (const ConfigStoreException& e) {
+        damage = e.Message();
+      }
+    }
+    // The object still lists: a caller going through a collection loses
+    // this one record, not the catalogue.
+    return std::make_shared<DamagedObject>(
+        std::move(id), ConfigStoreException(client_.Where() + ": " + damage, kErrorCorruptObject));
+  }
+
+  static std::shared_ptr<ConfigStoreObject> DecodePut(const ConfigStoreObjectId& id,
+                                                      const Put& put) {
+    ConfigStoreObjectId copy(id);
+    return codec::DecodeObject(std::move(copy), reinterpret_cast<const unsigned char*>(put.body.data()),
+                               put.body.size());
+  }
+
+  void Observe(const std::string& collection, const Current& current) {
+    if (depth_ > 0) observed_.emplace(collection, current.version);
+  }
+
+  std::vector<std::shared_ptr<ConfigStoreObject>> List(const FilterSpecObject& filter) {
+    const ConfigStoreObjectId& want = filter.Id();
+    const std::string* instance = want.InstanceId().empty() ? nullptr : &want.InstanceId();
+    const Pointers pointers = ReadPointers(ExactCollection(want), 0);
+
+    struct Listed {
+      Order order;
+      std::shared_ptr<ConfigStoreObject> object;
+    };
+    std::vector<Listed> listed;
+    codec::BodyArena arena;
+    std::set<std::string> names;
+    for (const auto& [name, current] : pointers.byCollection) {
+      if (CollectionMatches(filter, name)) names.insert(name);
+    }
+    if (depth_ > 0) {
+      for (const auto& [name, pending] : txn_.collections) {
+        if (CollectionMatches(filter, name)) names.insert(name);
+      }
+    }
+    for (const std::string& name : names) {
+      ConfigStoreObjectId collection("", "", "");
+      etcdlayout::ParseCollection(name, &collection);
+      auto current = pointers.byCollection.find(name);
+      Observe(name, current == pointers.byCollection.end() ? Current() : current->second);
+      const Pending* pending = nullptr;
+      if (depth_ > 0) {
+        auto it = txn_.collections.find(name);
+        if (it != txn_.collections.end()) pending = &it->second;
+      }
+      if (current != pointers.byCollection.end() && !(pending && pending->cleared)) {
+        etcdserverpb::RangeResponse reply;
+        std::vector<Entry> entries;
+        ReadGeneration(current->second.gen, instance, pointers.revision, &reply, &entries);
+        for (const Entry& entry : entries) {
+          if (pending && (pending->deleted.count(entry.instance) || pending->puts.count(entry.instance))) {
+            continue;
+          }
+          listed.push_back({entry.order, Decode(collection, entry, &arena)});
+        }
+      }
+      if (pending == nullptr) continue;
+      for (const auto& [key, put] : pending->puts) {
+        if (instance && key != *instance) continue;
+        collection.SetInstanceId(key);
+        // Not committed yet: after everything that is.
+        listed.push_back({Order{INT64_MAX, put.seq}, DecodePut(collection, put)});
+      }
+    }
+    std::stable_sort(listed.begin(), listed.end(),
+                     [](const Listed& a, const Listed& b) { return a.order < b.order; });
+    std::vector<std::shared_ptr<ConfigStoreObject>> out;
+    out.reserve(listed.size());
+    for (Listed& l : listed) out.push_back(std::move(l.object));
+    return out;
+  }
+
+  // ---- Transactions -------------------------------------------------------
+
+  template <typename Change>
+  void InTransaction(const Change& change) {
+    if (depth_ > 0) {
+      change();
+      return;
+    }
+    depth_ = 1;
+    try {
+      change();
+      Apply();
+    } catch (...) {
+      Reset();
+      throw;
+    }
+    Reset();
+  }
+
+  void Reset() {
+    depth_ = 0;
+    txn_ = TxnState();
+    saved_.clear();
+    observed_.clear();
+  }
+
+  [[noreturn]] void Conflict(const std::string& collection) const {
+    ConfigStoreObjectId id("", "", "");
+    etcdlayout::ParseCollection(collection, &id);
+    throw ConfigStoreException(client_.Where() + ": another writer changed the collection \"" +
+                                   id.Key() + "\" since this transaction read it",
+                               kErrorConflict);
+  }
+
+  void Apply() {
+    std::vector<std::string> touched;
+    for (const auto& [name, pending] : txn_.collections) {
+      if (pending.Touched()) touched.push_back(name);
+    }
+    if (touched.empty()) return;
+    for (int attempt = 1;; ++attempt) {
+      Pointers now = ReadPointers(std::string(), 0);
+      bool readAny = false;
+      for (const std::string& name : touched) {
+        auto seen = observed_.find(name);
+        if (seen == observed_.end()) continue;
+        readAny = true;
+        auto it = now.byCollection.find(name);
+        if (seen->second != (it == now.byCollection.end() ? 0 : it->second.version)) Conflict(name);
+      }
+      const std::string token = NewId();
+      if (FitsInPlace(touched, now) ? CommitInPlace(touched, now, token)
+                                    : CommitGenerations(touched, now, token)) {
+        return;
+      }
+      // Another writer got in between: only a transaction that read none of
+      // what it writes can simply be applied to what is there now.
+      if (readAny || attempt == kCommitAttempts) Conflict(touched.front());
+    }
+  }
+
+  static const Current* Find(const Pointers& now, const std::string& name) {
+    auto it = now.byCollection.find(name);
+    return it == now.byCollection.end() ? nullptr : &it->second;
+  }
+
+  bool FitsInPlace(const std::vector<std::string>& touched, const Pointers& now) const {
+    std::size_t ops = 0;
+    std::size_t bytes = 0;
+    for (const std::string& name : touched) {
+      const Pending& pending = txn_.collections.at(name);
+      const bool exists = Find(now, name) != nullptr;
+      if (pending.cleared && exists) return false;
+      ops += 2 + (exists ? 0 : 2) + pending.deleted.size() + pending.puts.size() * 2;
+      for (const auto& [key, put] : pending.puts) {
+        if (put.body.size() > etcdlayout::kPartBytes) return false;
+        bytes += put.body.size() + 2 * key.size() + 128;
+      }
+    }
+    return ops <= static_cast<std::size_t>(etcdlayout::kBatchOps) && bytes <= etcdlayout::kBatchBytes;
+  }
+
+  static std::vector<const std::pair<const std::string, Put>*> InWriteOrder(const Pending& pending) {
+    std::vector<const std::pair<const std::string, Put>*> puts;
+    for (const auto& entry : pending.puts) puts.push_back(&entry);
+    std::sort(puts.begin(), puts.end(),
+              [](const auto* a, const auto* b) { return a->second.seq < b->second.seq; });
+    return puts;
+  }
+
+  static std::string FirstPart(const Header& header, std::string_view body) {
+    std::string value;
+    value.reserve(body.size() + 24);
+    etcdlayout::AppendHeader(header, &value);
+    value.append(body);
+    return value;
+  }
+
+  bool CommitInPlace(const std::vector<std::string>& touched, const Pointers& now,
+                     const std::string& token) {
+    TxnRequest txn;
+    std::vector<RequestOp> ops;
+    for (const std::string& name : touched) {
+      const Pending& pending = txn_.collections.at(name);
+      const Current* current = Find(now, name);
+      AddCompareVersion(&txn, keys_.Pointer(name), current ? *current : Current());
+      const std::string gen = current ? current->gen : NewId();
+      AddPut(&ops, keys_.Pointer(name), PointerValue(gen, token));
+      if (!current) {
+        AddPut(&ops, keys_.Generation(gen), name);
+        AddPut(&ops, keys_.Registered() + gen, name);
+      }
+      for (const std::string& instance : pending.deleted) {
+        if (current && !pending.puts.count(instance)) AddDeletePrefix(&ops, keys_.Object(gen, instance));
+      }
+      for (const auto* put : InWriteOrder(pending)) {
+        const std::string object = keys_.Object(gen, put->first);
+        Header header;
+        header.kind = OrderKind::kOwnRevision;
+        header.index = put->second.seq;
+        AddPut(&ops, object + Keys::PartSuffix(0), FirstPart(header, put->second.body));
+        // Later parts of a larger object this one replaces.
+        if (current) AddDelete(&ops, object + Keys::PartSuffix(1), PrefixEnd(object));
+      }
+    }
+    for (RequestOp& op : ops) *txn.add_success() = std::move(op);
+    return Switch(txn, touched.front(), token);
+  }
+
+  // Sends the transaction that makes a commit visible and tells whether it
+  // took effect. When the reply is lost, or a resent request finds its own
+  // first attempt has changed the versions it compares, the pointer of a
+  // collection it writes ("witness", "" when it writes none) holds this
+  // commit's token exactly when it did.
+  bool Switch(const TxnRequest& txn, const std::string& witness, const std::string& token) {
+    auto mine = [&] {
+      if (witness.empty()) return false;
+      const Current* current = Find(ReadPointers(witness, 0), witness);
+      return current != nullptr && current->token == token;
+    };
+    try {
+      return client_.Txn(txn, true).succeeded() || mine();
+    } catch (const ConfigStoreException&) {
+      bool committed = false;
+      try {
+        committed = mine();
+      } catch (const ConfigStoreException&) {
+        // Unknown either way: report the first failure.
+      }
+      if (committed) return true;
+      throw;
+    }
+  }
+
+  // Writes the puts of a batch once it is full (or "force").
+  void Flush(std::vector<RequestOp>* ops, std::size_t* bytes, bool force) {
+    if (ops->empty() || (!force && ops->size() < static_cast<std::size_t>(etcdlayout::kBatchOps) &&
+                         *bytes < etcdlayout::kBatchBytes)) {
+      return;
+    }
+    client_.Txn(TxnOf(ops), true);
+    *bytes = 0;
+  }
+
+  void WriteObject(const std::string& gen, const std::string& instance, Header header,
+                   std::string_view body, std::vector<RequestOp>* ops, std::size_t* bytes) {
+    const std::string object = keys_.Object(gen, instance);
+    header.parts = std::max<std::size_t>(1, (body.size() + etcdlayout::kPartBytes - 1) /
+                                                etcdlayout::kPartBytes);
+    for (std::size_t part = 0; part < header.parts; ++part) {
+      const std::string_view piece = body.substr(part * etcdlayout::kPartBytes, etcdlayout::kPartBytes);
+      const std::size_t size = piece.size() + object.size() + 32;
+      if (*bytes + size > etcdlayout::kBatchBytes) Flush(ops, bytes, true);
+      AddPut(ops, object + Keys::PartSuffix(part),
+             part == 0 ? FirstPart(header, piece) : std::string(piece));
+      *bytes += size;
+      Flush(ops, bytes, false);
+    }
+  }
+
+  bool CommitGenerations(const std::vector<std::string>& touched, const Pointers& now,
+                         const std::string& token) {
+    const std::int64_t lease = client_.LeaseGrant(kLeaseSeconds);
+    std::map<std::string, std::string> fresh;  // collection -> its new generation
+    std::vector<RequestOp> ops;
+    for (const std::string& name : touched) {
+      fresh[name] = NewId();
+      AddPut(&ops, keys_.Writers() + fresh[name], name, lease);
+      AddPut(&ops, keys_.Registered() + fresh[name], name);
+    }
+    client_.Txn(TxnOf(&ops), true);
+    auto abandon = [&] {
+      std::vector<RequestOp> undo;
+      for (const auto& [name, gen] : fresh) {
+        AddDeletePrefix(&undo, keys_.Generation(gen));
+        AddDelete(&undo, keys_.Registered() + gen);
+        AddDelete(&undo, keys_.Writers() + gen);
+      }
+      try {
+        client_.Txn(TxnOf(&undo), true);
+        client_.LeaseRevoke(lease);
+      } catch (const ConfigStoreException&) {
+        // The lease runs out and a later writer removes what is left.
+      }
+    };
+
+    std::map<std::string, bool> empty;
+    try {
+      std::size_t bytes = 0;
+      auto lastKeepAlive = std::chrono::steady_clock::now();
+      for (const std::string& name : touched) {
+        const Pending& pending = txn_.collections.at(name);
+        const Current* current = Find(now, name);
+        const std::string& gen = fresh[name];
+        std::size_t written = 0;
+        if (current && !pending.cleared) {
+          etcdserverpb::RangeResponse reply;
+          std::vector<Entry> entries;
+          ReadGeneration(current->gen, nullptr, now.revision, &reply, &entries);
+          for (const Entry& entry : entries) {
+            if (pending.deleted.count(entry.instance) || pending.puts.count(entry.instance)) continue;
+            if (!entry.damage.empty()) continue;  // unreadable: nothing to carry over
+            Header header;
+            header.kind = OrderKind::kWritten;
+            header.revision = entry.order.revision;
+            header.index = entry.order.index;
+            WriteObject(gen, entry.instance, header, entry.body, &ops, &bytes);
+            ++written;
+          }
+        }
+        for (const auto* put : InWriteOrder(pending)) {
+          Header header;
+          header.kind = OrderKind::kHeadRevision;
+          header.index = put->second.seq;
+          WriteObject(gen, put->first, header, put->second.body, &ops, &bytes);
+          ++written;
+          if (std::chrono::steady_clock::now() - lastKeepAlive > std::chrono::seconds(kLeaseSeconds / 4)) {
+            client_.LeaseKeepAlive(lease);
+            lastKeepAlive = std::chrono::steady_clock::now();
+          }
+        }
+        empty[name] = written == 0;
+      }
+      Flush(&ops, &bytes, true);
+    } catch (...) {
+      abandon();
+      throw;
+    }
+
+    TxnRequest txn;
+    std::string anyWritten;
+    for (const std::string& name : touched) {
+      const Current* current = Find(now, name);
+      const std::string& gen = fresh[name];
+      AddCompareVersion(&txn, keys_.Pointer(name), current ? *current : Current());
+      Compare* alive = txn.add_compare();
+      alive->set_key(keys_.Writers() + gen);
+      alive->set_target(Compare::VERSION);
+      alive->set_result(Compare::GREATER);
+      alive->set_version(0);
+      if (empty[name]) {
+        AddDelete(&ops, keys_.Pointer(name));
+        AddDeletePrefix(&ops, keys_.Generation(gen));
+        AddDelete(&ops, keys_.Registered() + gen);
+      } else {
+        AddPut(&ops, keys_.Pointer(name), PointerValue(gen, token));
+        AddPut(&ops, keys_.Generation(gen), name);
+        anyWritten = name;
+      }
+      if (current) {
+        AddDeletePrefix(&ops, keys_.Generation(current->gen));
+        AddDelete(&ops, keys_.Registered() + current->gen);
+      }
+      AddDelete(&ops, keys_.Writers() + gen);
+    }
+    for (RequestOp& op : ops) *txn.add_success() = std::move(op);
+    ops.clear();
+    if (!Switch(txn, anyWritten, token)) {
+      abandon();
+      return false;
+    }
+    try {
+      client_.LeaseRevoke(lease);
+      RemoveOrphans();
+    } catch (const ConfigStoreException&) {
+      // Tidying only: the commit stands, and a later writer tidies up.
+    }
+    return true;
+  }
+
+  // Generations whose writer died before making them current: registered,
+  // with no live writer and no collection pointing at them.
+  void RemoveOrphans() {
+    TxnRequest snapshot;
+    for (const std::string& prefix : {keys_.Registered(), keys_.Writers(), keys_.Pointers()}) {
+      RangeRequest* range = snapshot.add_success()->mutable_request_range();
+      range->set_key(prefix);
+      range->set_range_end(PrefixEnd(prefix));
+    }
+    const etcdserverpb::TxnResponse reply = client_.Txn(snapshot, true);
+    std::set<std::string> live;
+    for (const auto& kv : reply.responses(1).response_range().kvs()) {
+      live.insert(kv.key().substr(keys_.Writers().size()));
+    }
+    for (const auto& kv : reply.responses(2).response_range().kvs()) {
+      live.insert(GenerationOf(kv.value()));
+    }
+    std::vector<RequestOp> ops;
+    for (const auto& kv : reply.responses(0).response_range().kvs()) {
+      const std::string gen = kv.key().substr(keys_.Registered().size());
+      if (live.count(gen)) continue;
+      AddDeletePrefix(&ops, keys_.Generation(gen));
+      AddDelete(&ops, kv.key());
+      if (ops.size() >= static_cast<std::size_t>(etcdlayout::kBatchOps)) client_.Txn(TxnOf(&ops), true);
+    }
+    if (!ops.empty()) client_.Txn(TxnOf(&ops), true);
+  }
+
+  std::mutex mu_;
+  EtcdClient client_;
+  Keys keys_;
+  int depth_ = 0;
+  TxnState txn_;
+  std::vector<TxnState> saved_;  // the state at each inner Begin
+  // Collections this transaction read, with the version it saw (0: none).
+  std::map<std::string, std::int64_t> observed_;
+  std::unique_ptr<ChangeFeed> feed_;
+};
+
+}  // namespace
 
 std::shared_ptr<ConfigStore> NewEtcdStore(const EtcdStoreOptions& options) {
-  throw ConfigStoreException("etcd store " + options.endpoints.at(0) + ": not available yet",
-                             kErrorEtcdBase + 12);
+  if (options.endpoints.empty() || options.prefix.empty()) {
+    throw ConfigStoreException("etcd store: needs at least one endpoint and a prefix",
+                               kErrorBadLocator);
+  }
+  return std::make_shared<EtcdStore>(options);
 }
 
 }  // namespace TavoConfigStore

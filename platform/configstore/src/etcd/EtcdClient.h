@@ -1,0 +1,70 @@
+// A synchronous client for the parts of etcd's v3 API the store uses, with
+// the store's error reporting: every failure becomes a ConfigStoreException
+// whose message names the cluster and whose code is kErrorEtcdBase plus the
+// gRPC status code.
+
+#ifndef TAVOCONFIGSTORE_SRC_ETCD_ETCD_CLIENT_H_
+#define TAVOCONFIGSTORE_SRC_ETCD_ETCD_CLIENT_H_
+
+#include <grpcpp/grpcpp.h>
+
+#include <chrono>
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include "TavoConfigStore/EtcdStore.h"
+#include "etcd/etcdserver/etcdserverpb/rpc.grpc.pb.h"
+
+namespace TavoConfigStore {
+
+class EtcdClient {
+ public:
+  explicit EtcdClient(const EtcdStoreOptions& options);
+
+  // "etcd HOST:PORT[,...]", for messages.
+  const std::string& Where() const { return where_; }
+
+  // Reads. A read that cannot reach a member is tried again until the
+  // request's time is up, so a failover between members goes unnoticed.
+  etcdserverpb::RangeResponse Range(const etcdserverpb::RangeRequest& request);
+  // "retry": the request may be sent twice (puts of the same bytes, or a
+  // transaction guarded by compares that a second attempt would fail).
+  etcdserverpb::TxnResponse Txn(const etcdserverpb::TxnRequest& request, bool retry);
+
+  std::int64_t LeaseGrant(std::int64_t ttlSeconds);
+  void LeaseKeepAlive(std::int64_t lease);
+  void LeaseRevoke(std::int64_t lease);
+
+  // Adds the deadline and the auth token to a context for a call of one's own
+  // (a watch: no deadline, "deadline" false).
+  void Prepare(grpc::ClientContext* context, bool deadline = true);
+  etcdserverpb::Watch::Stub& WatchStub() { return *watch_; }
+
+  // Throws the store's exception for a failed call.
+  [[noreturn]] void Fail(const grpc::Status& status, const char* what) const;
+
+ private:
+  template <typename Call>
+  grpc::Status Invoke(const Call& call, bool retry);
+  void Authenticate();
+
+  EtcdStoreOptions options_;
+  std::string where_;
+  std::shared_ptr<grpc::Channel> channel_;
+  std::unique_ptr<etcdserverpb::KV::Stub> kv_;
+  std::unique_ptr<etcdserverpb::Lease::Stub> lease_;
+  std::unique_ptr<etcdserverpb::Watch::Stub> watch_;
+  std::unique_ptr<etcdserverpb::Auth::Stub> auth_;
+  std::mutex tokenMu_;
+  std::string token_;
+  bool authenticated_ = false;
+};
+
+// The first key after every key that starts with "prefix" (etcd's range end).
+std::string PrefixEnd(std::string prefix);
+
+}  // namespace TavoConfigStore
+
+#endif  // TAVOCONFIGSTORE_SRC_ETCD_ETCD_CLIENT_H_

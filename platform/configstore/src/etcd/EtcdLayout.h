@@ -1,0 +1,85 @@
+// How a store lies in etcd, under "/<prefix>/":
+//
+//   p/<collection>           the collection's current generation id. Rewritten
+//                            by every commit that changes the collection, so
+//                            its mod revision is the collection's version.
+//   g/<gen>/                 the generation's head (value: the collection),
+//                            made when the generation becomes current
+//   g/<gen>/<instance>\0NNNN the object: part 0000 holds the header and the
+//                            start of the body, 0001... the rest of a body
+//                            larger than one etcd request may carry
+//   r/<gen>                  every generation that has objects, current or not
+//   w/<gen>                  a generation being written, on its writer's lease
+//
+// <collection> is key \0 group \0 component and <instance> the instance id,
+// each escaped so that it holds no \0 (\0 -> \1\1, \1 -> \1\2): keys then
+// sort part by part, and one object's keys are contiguous.
+//
+// Part 0000's header: u8 1, varint order kind, varint revision, varint index,
+// varint part count. An object's place in write order is (revision, index);
+// the revision is the one written (kind 0, an object carried into a new
+// generation), the part's own mod revision (kind 1, written in place) or the
+// create revision of its generation's head (kind 2, written into a new
+// generation, which became current then).
+
+#ifndef TAVOCONFIGSTORE_SRC_ETCD_ETCD_LAYOUT_H_
+#define TAVOCONFIGSTORE_SRC_ETCD_ETCD_LAYOUT_H_
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+#include "TavoConfigStore/ConfigStoreObjectId.h"
+
+namespace TavoConfigStore {
+namespace etcdlayout {
+
+// An etcd request stays under the cluster's default limits (1.5 MiB, 128
+// operations) with room to spare.
+constexpr std::size_t kPartBytes = std::size_t{768} * 1024;
+constexpr std::size_t kBatchBytes = std::size_t{1024} * 1024;
+constexpr int kBatchOps = 100;
+
+std::string Escape(std::string_view part);
+// False when "text" is not an escaped part.
+bool Unescape(std::string_view text, std::string* out);
+
+std::string CollectionOf(const ConfigStoreObjectId& id);
+// Fills key, group and component; false when "name" is not a collection.
+bool ParseCollection(std::string_view name, ConfigStoreObjectId* id);
+
+enum class OrderKind : std::uint8_t { kWritten = 0, kOwnRevision = 1, kHeadRevision = 2 };
+
+struct Header {
+  OrderKind kind = OrderKind::kOwnRevision;
+  std::int64_t revision = 0;
+  std::uint64_t index = 0;
+  std::uint64_t parts = 1;
+};
+void AppendHeader(const Header& header, std::string* out);
+// Reads the header at the start of "*value" and drops it from the view.
+bool ReadHeader(std::string_view* value, Header* header);
+
+class Keys {
+ public:
+  explicit Keys(const std::string& prefix) : root_("/" + prefix + "/") {}
+  std::string Pointers() const { return root_ + "p/"; }
+  std::string Pointer(const std::string& collection) const { return Pointers() + collection; }
+  std::string Generation(const std::string& gen) const { return root_ + "g/" + gen + "/"; }
+  // The first key of an instance's parts, and of part 1.
+  std::string Object(const std::string& gen, const std::string& instance) const {
+    return Generation(gen) + Escape(instance) + '\0';
+  }
+  static std::string PartSuffix(std::size_t part);
+  std::string Registered() const { return root_ + "r/"; }
+  std::string Writers() const { return root_ + "w/"; }
+  const std::string& Root() const { return root_; }
+
+ private:
+  std::string root_;
+};
+
+}  // namespace etcdlayout
+}  // namespace TavoConfigStore
+
+#endif  // TAVOCONFIGSTORE_SRC_ETCD_ETCD_LAYOUT_H_
