@@ -117,10 +117,10 @@ EtcdClient::EtcdClient(const EtcdStoreOptions& options) : options_(options) {
 }
 
 void EtcdClient::Fail(const grpc::Status& status, const char* what) const {
-  std::string message = where_ + ": " + what + ": " + status.error_message();
-  if (status.error_code() == grpc::StatusCode::DEADLINE_EXCEEDED) {
-    message += " (no answer within " + std::to_string(options_.timeoutMs) + " ms)";
-  }
+  std::string message = where_ + ": " + what + ": ";
+  message += status.error_code() == grpc::StatusCode::DEADLINE_EXCEEDED
+                 ? "no member answered within " + std::to_string(options_.timeoutMs) + " ms"
+                 : status.error_message();
   message += std::string(" (") + StatusName(status.error_code()) + ")";
   throw ConfigStoreException(message, kErrorEtcdBase + static_cast<int>(status.error_code()));
 }
