@@ -1,4 +1,4 @@
-// The configuration store: what both backends share, run against each, then
+// The configuration store: what every backend shares, run against each, then
 // the SQLite backend's own behaviour (other connections and their locks,
 // rollbacks SQLite makes by itself, foreign and damaged files, objects read
 // lazily from their stored bytes) and the default store's cached connection.
@@ -22,6 +22,7 @@
 #include <thread>
 #include <vector>
 
+#include "EtcdCluster.h"
 #include "FaultVfs.h"
 #include "Files.h"
 #include "RawSqlite.h"
@@ -97,12 +98,13 @@ class StoreConformance : public ::testing::TestWithParam<std::string> {
  protected:
   void SetUp() override {
     if (GetParam() == "etcd") {
-      static int n = 0;
-      store_ = OpenStore(std::string("etcd://") + std::getenv("KARST_TEST_ETCD") + "/t" +
-                         std::to_string(getpid()) + "-" + std::to_string(++n));
-      return;
+      // One cluster for the suite, a catalogue of its own for each test.
+      static karst_test::EtcdCluster etcd;
+      static int tests = 0;
+      store_ = OpenStore(etcd.Locator("conformance" + std::to_string(++tests)));
+    } else {
+      store_ = GetParam() == "memory" ? NewMemoryStore() : NewSqliteStore(dir_.File("store.db"));
     }
-    store_ = GetParam() == "memory" ? NewMemoryStore() : NewSqliteStore(dir_.File("store.db"));
   }
 
   karst_test::ScratchDir dir_;

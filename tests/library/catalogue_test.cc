@@ -1,9 +1,10 @@
-// The catalogue on the SQLite store, through the shared library as a host
-// links it: every byte comes back, and a second connection to the file sees
-// what the first one wrote.
+// The catalogue on the SQLite and the etcd store, through the shared library
+// as a host links it: every byte comes back, and a second connection to the
+// same store sees what the first one wrote.
 
 #include <gtest/gtest.h>
 
+#include "EtcdCluster.h"
 #include "FaultStore.h"
 #include "Files.h"
 #include "Records.h"
@@ -13,9 +14,21 @@ namespace {
 
 using TavoKarst::KarstLib;
 
-TEST(CatalogueSqliteTest, RoundTripsEveryByteAndASecondConnectionSeesIt) {
-  ScratchDir dir;
-  UseStoreAt(dir.File("store.db"));
+class CatalogueTest : public ::testing::TestWithParam<std::string> {
+ protected:
+  // Where the store is, for the default store and for a second connection.
+  std::string Locator() {
+    if (GetParam() == "sqlite") return dir_.File("store.db");
+    if (!etcd_) etcd_ = std::make_unique<EtcdCluster>();
+    return etcd_->Locator("catalogue");
+  }
+
+  ScratchDir dir_;
+  std::unique_ptr<EtcdCluster> etcd_;
+};
+
+TEST_P(CatalogueTest, RoundTripsEveryByteAndASecondConnectionSeesIt) {
+  UseStoreAt(Locator());
   const std::string odd("\xff\xfe\xc0\x80\xed\xa0\x80", 7);  // not UTF-8
   const std::vector<TavoKarst::KarstPolicyInfo> policies = {
       Policy(std::string("n\0ul", 4), std::string("\0id", 3),
@@ -31,7 +44,7 @@ TEST(CatalogueSqliteTest, RoundTripsEveryByteAndASecondConnectionSeesIt) {
   EXPECT_EQ(KarstLib::ListDatastoreInfo(), datastores);
 
   {
-    ScopedFaultStore second(TavoConfigStore::NewSqliteStore(dir.File("store.db")));
+    ScopedFaultStore second(TavoConfigStore::OpenStore(Locator()));
     EXPECT_EQ(KarstLib::ListPolicyInfo(), policies);
     EXPECT_EQ(KarstLib::ListDatastoreInfo(), datastores);
     KarstLib::AddPolicyInfo({Policy("after", "p")});
@@ -39,6 +52,8 @@ TEST(CatalogueSqliteTest, RoundTripsEveryByteAndASecondConnectionSeesIt) {
   // The first connection, which read before, sees the second one's write.
   EXPECT_EQ(KarstLib::ListPolicyInfo(), (std::vector{Policy("after", "p")}));
 }
+
+INSTANTIATE_TEST_SUITE_P(Stores, CatalogueTest, ::testing::Values("sqlite", "etcd"));
 
 }  // namespace
 }  // namespace karst_test

@@ -1,0 +1,291 @@
+// The etcd store's own behaviour on a real cluster: replaces larger than one
+// etcd request that readers see whole or not at all, writers racing on one
+// collection, a dead writer's leftovers, an unreachable cluster, TLS and
+// users, and change notification. What all backends share runs in
+// configstore_test.
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <functional>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "EtcdCluster.h"
+#include "Records.h"
+#include "TavoConfigStore/ConfigStore.h"
+#include "TavoConfigStore/EtcdStore.h"
+#include "TavoKarst/KarstLib.h"
+
+namespace TavoConfigStore {
+namespace {
+
+using karst_test::EtcdCluster;
+using karst_test::EtcdOptions;
+using Clock = std::chrono::steady_clock;
+
+std::shared_ptr<ConfigStoreObject> Obj(const std::string& instance, const std::string& value = "",
+                                       const std::string& key = "k") {
+  auto o = std::make_shared<ConfigStoreObject>(ConfigStoreObjectId(key, "g", "c", instance));
+  o->SetValue("v", value);
+  return o;
+}
+
+void Set(ConfigStore& store, const std::shared_ptr<ConfigStoreObject>& object) {
+  std::int32_t flags = 0;
+  store.SetObject(object, flags);
+}
+
+// "instance=value" of each object the filter lists, in order.
+std::vector<std::string> Dump(ConfigStore& store, const std::string& key = "") {
+  std::vector<std::string> out;
+  auto filter = std::make_shared<FilterSpecObject>(ConfigStoreObjectId(key, "", ""));
+  for (const auto& o : store.GetObjects(filter)) {
+    std::string v;
+    o->GetValue("v", &v);
+    out.push_back(o->Id().InstanceId() + "=" + v);
+  }
+  return out;
+}
+
+void Clear(ConfigStore& store, const std::string& key = "k") {
+  store.DeleteObjects(std::make_shared<FilterSpecObject>(ConfigStoreObjectId(key, "g", "c")));
+}
+
+// The keys etcd holds under "/<prefix>/<area>/".
+std::vector<std::string> RawKeys(const EtcdCluster& etcd, const std::string& prefix,
+                                 const std::string& area) {
+  std::istringstream out(etcd.Etcdctl({"get", "--prefix", "--keys-only", "/" + prefix + "/" + area}));
+  std::vector<std::string> keys;
+  for (std::string line; std::getline(out, line);) {
+    if (!line.empty()) keys.push_back(line);
+  }
+  return keys;
+}
+
+template <typename F>
+ConfigStoreException ErrorOf(F&& f) {
+  try {
+    f();
+  } catch (const ConfigStoreException& e) {
+    return e;
+  }
+  ADD_FAILURE() << "no ConfigStoreException";
+  return ConfigStoreException("none", 0);
+}
+
+EtcdCluster& SharedCluster() {
+  static EtcdCluster cluster;
+  return cluster;
+}
+
+std::vector<TavoKarst::KarstPolicyInfo> Catalogue(int count, long long generation) {
+  std::vector<TavoKarst::KarstPolicyInfo> policies;
+  for (int i = 0; i < count; ++i) {
+    std::vector<TavoKarst::KarstPolicyBlob> blobs;
+    for (const char* ns : {"CORRA", "ns-b", "ns-c", "ns-d"}) {
+      blobs.push_back({std::string(256, static_cast<char>(i + generation)), ns});
+    }
+    policies.push_back(karst_test::Policy("p" + std::to_string(i), "id" + std::to_string(i),
+                                          std::move(blobs), "", generation));
+  }
+  return policies;
+}
+
+// 10,000 policies of four 256-byte blobs (about 14 MB, far over one etcd
+// request) replace one another while a reader on its own connection lists
+// them: every listing is one whole catalogue, and nothing of the writes but
+// the current generation stays behind.
+TEST(EtcdStoreTest, LargeReplacesAreAllOrNothingForReaders) {
+  EtcdCluster& etcd = SharedCluster();
+  SetGlobalStore(OpenStore(etcd.Locator("large")));
+  TavoKarst::KarstLib::AddPolicyInfo(Catalogue(10000, 1));
+
+  std::atomic<bool> done{false};
+  std::atomic<int> listings{0};
+  std::atomic<int> torn{0};
+  std::thread reader([&] {
+    auto store = OpenStore(etcd.Locator("large"));
+    auto filter = std::make_shared<FilterSpecObject>(ConfigStoreObjectId("karst_policies", "", ""));
+    while (!done) {
+      const auto objects = store->GetObjects(filter);
+      long long first = -1;
+      for (const auto& o : objects) {
+        long long generation = 0;
+        o->GetValue("generation_number", &generation);
+        if (first == -1) first = generation;
+        if (generation != first) ++torn;
+      }
+      if (objects.size() != 10000) ++torn;
+      ++listings;
+    }
+  });
+  for (long long generation = 2; generation <= 4; ++generation) {
+    TavoKarst::KarstLib::AddPolicyInfo(Catalogue(10000, generation));
+  }
+  while (listings < 3) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  done = true;
+  reader.join();
+  EXPECT_EQ(torn, 0) << "of " << listings << " listings";
+  EXPECT_EQ(TavoKarst::KarstLib::ListPolicyInfo(), Catalogue(10000, 4));
+  EXPECT_EQ(RawKeys(etcd, "large", "r/").size(), 1u);  // one live generation
+  EXPECT_THAT(RawKeys(etcd, "large", "w/"), ::testing::IsEmpty());
+  SetGlobalStore(nullptr);
+}
+
+// A 10 MiB value is stored in parts, each under etcd's request limit, and
+// comes back byte for byte, in place of a smaller object and replaced again.
+TEST(EtcdStoreTest, ValuesLargerThanARequestRoundTrip) {
+  auto store = OpenStore(SharedCluster().Locator("parts"));
+  std::string big(10 << 20, '\0');
+  for (std::size_t i = 0; i < big.size(); ++i) big[i] = static_cast<char>(i * 7919 >> 5);
+  Set(*store, Obj("small", "x"));
+  for (const std::string& value : {big, std::string("short again"), big + "tail"}) {
+    Set(*store, Obj("big", value));
+    std::string read;
+    store->GetObject(ConfigStoreObjectId("k", "g", "c", "big"))->GetValue("v", &read);
+    EXPECT_TRUE(read == value) << "size " << read.size() << " of " << value.size();
+    EXPECT_EQ(Dump(*store).size(), 2u);
+  }
+}
+
+// A transaction that read a collection fails if another writer changed it
+// before the commit; one that only replaced it is applied to the new state.
+TEST(EtcdStoreTest, RacingWritersConflictOnlyWhenWhatTheyReadChanged) {
+  const std::string locator = SharedCluster().Locator("race");
+  auto mine = OpenStore(locator);
+  auto other = OpenStore(locator);
+  Set(*mine, Obj("a", "0"));
+
+  mine->BeginTransaction();
+  EXPECT_EQ(Dump(*mine), std::vector<std::string>{"a=0"});
+  Set(*other, Obj("a", "other"));
+  Set(*mine, Obj("a", "mine"));
+  EXPECT_EQ(ErrorOf([&] { mine->CommitTransaction(); }).Code(), kErrorConflict);
+  mine->AbortTransaction();
+  EXPECT_EQ(Dump(*other), std::vector<std::string>{"a=other"});
+
+  mine->BeginTransaction();
+  Clear(*mine);
+  Set(*mine, Obj("b", "mine"));
+  Set(*other, Obj("c", "other"));  // lands between, and is replaced
+  mine->CommitTransaction();
+  EXPECT_EQ(Dump(*other), std::vector<std::string>{"b=mine"});
+}
+
+// A writer that dies mid-replace leaves a generation nobody points at; once
+// its lease is gone the next writer removes it, and readers never saw it.
+TEST(EtcdStoreTest, ADeadWritersGenerationIsRemovedByTheNextWriter) {
+  EtcdCluster& etcd = SharedCluster();
+  auto store = OpenStore(etcd.Locator("dead"));
+  Set(*store, Obj("kept", "old"));
+  // What a writer leaves when it dies after its first batch.
+  const std::string lease = [&] {
+    std::istringstream out(etcd.Etcdctl({"lease", "grant", "60"}));
+    std::string word, id;
+    out >> word >> id;
+    return id;
+  }();
+  etcd.Etcdctl({"put", "--lease=" + lease, "/dead/w/0123456789abcdef", "k"});
+  etcd.Etcdctl({"put", "/dead/r/0123456789abcdef", "k"});
+  etcd.Etcdctl({"put", std::string("/dead/g/0123456789abcdef/x") + "\\0" + "0000", "junk"});
+  etcd.Etcdctl({"put", "/dead/g/0123456789abcdef/y", "junk"});
+
+  EXPECT_EQ(Dump(*store), std::vector<std::string>{"kept=old"});
+  Clear(*store);
+  Set(*store, Obj("new", "1"));  // the writer's lease still runs: left alone
+  EXPECT_EQ(RawKeys(etcd, "dead", "g/0123456789abcdef/").size(), 2u);
+  etcd.Etcdctl({"lease", "revoke", lease});
+  Clear(*store);
+  Set(*store, Obj("newer", "2"));
+  EXPECT_THAT(RawKeys(etcd, "dead", "g/0123456789abcdef/"), ::testing::IsEmpty());
+  EXPECT_EQ(RawKeys(etcd, "dead", "r/").size(), 1u);
+  EXPECT_EQ(Dump(*store), std::vector<std::string>{"newer=2"});
+}
+
+// With no member answering, every operation fails within the locator's
+// timeout, naming the cluster, with etcd's code for it.
+TEST(EtcdStoreTest, AnUnreachableClusterFailsEveryOperationInBoundedTime) {
+  auto etcd = std::make_unique<EtcdCluster>();
+  const std::string endpoint = etcd->Endpoint(0);
+  auto store = OpenStore(etcd->Locator("down") + "?timeout=1000");
+  Set(*store, Obj("a"));
+  etcd.reset();
+  std::int32_t flags = 0;
+  auto filter = std::make_shared<FilterSpecObject>(ConfigStoreObjectId("k", "g", "c"));
+  const std::vector<std::function<void()>> operations = {
+      [&] { store->GetObject(ConfigStoreObjectId("k", "g", "c", "a")); },
+      [&] { store->GetObjects(filter); },
+      [&] { store->SetObject(Obj("b"), flags); },
+      [&] { store->DeleteObjects(filter); },
+      [&] {
+        store->BeginTransaction();
+        store->SetObject(Obj("c"), flags);
+        store->CommitTransaction();
+      },
+  };
+  for (std::size_t i = 0; i < operations.size(); ++i) {
+    const auto start = Clock::now();
+    const ConfigStoreException e = ErrorOf(operations[i]);
+    EXPECT_LT(Clock::now() - start, std::chrono::milliseconds(2500)) << "operation " << i;
+    EXPECT_THAT(e.Code(), ::testing::AnyOf(kErrorEtcdBase + 4, kErrorEtcdBase + 14)) << i;
+    EXPECT_THAT(e.what(), ::testing::HasSubstr(endpoint)) << i;
+  }
+  store->AbortTransaction();
+}
+
+// TLS with client certificates and etcd's users: the right credentials
+// work; missing or wrong ones and a user without rights on the prefix fail
+// with their own codes, and no message repeats a password.
+TEST(EtcdStoreTest, CertificatesAndUsersAreChecked) {
+  EtcdOptions options;
+  options.tls = true;
+  options.auth = true;
+  EtcdCluster etcd(options);
+  Set(*OpenStore(etcd.Locator("secure")), Obj("a", "1"));
+  EXPECT_EQ(Dump(*OpenStore(etcd.Locator("secure"))), std::vector<std::string>{"a=1"});
+
+  const std::string wrongPassword = "not-the-root-password";
+  const std::string wrongUser = "etcds://root:" + wrongPassword + "@" + etcd.Endpoints() +
+                                "/secure?cacert=" + etcd.CaFile() + "&cert=" + etcd.CertFile() +
+                                "&key=" + etcd.KeyFile() + "&timeout=2000";
+  const struct {
+    std::string locator;
+    int code;
+  } cases[] = {
+      {wrongUser, kErrorEtcdBase + 3},  // INVALID_ARGUMENT: etcd's answer to a bad password
+      {etcd.Locator("secure", {"", true}), kErrorEtcdBase + 7},
+      {etcd.Locator("secure", {"limited", true}), kErrorEtcdBase + 7},
+      {etcd.Locator("secure", {"root", false}) + "&timeout=2000", kErrorEtcdBase + 4},
+  };
+  for (const auto& c : cases) {
+    const ConfigStoreException e = ErrorOf([&] { Dump(*OpenStore(c.locator)); });
+    EXPECT_EQ(e.Code(), c.code) << e.what();
+    EXPECT_THAT(e.what(), ::testing::Not(::testing::HasSubstr(etcd.Password("root"))));
+    EXPECT_THAT(e.what(), ::testing::Not(::testing::HasSubstr(wrongPassword)));
+  }
+}
+
+// WaitForChange wakes when another connection commits, not otherwise.
+TEST(EtcdStoreTest, WaitForChangeWakesOnAnotherWritersCommit) {
+  const std::string locator = SharedCluster().Locator("watch");
+  auto watcher = OpenStore(locator);
+  auto writer = OpenStore(locator);
+  EXPECT_FALSE(watcher->WaitForChange(300));
+  std::thread later([&] {
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    Set(*writer, Obj("a"));
+  });
+  const auto start = Clock::now();
+  EXPECT_TRUE(watcher->WaitForChange(5000));
+  EXPECT_LT(Clock::now() - start, std::chrono::seconds(1));
+  later.join();
+  EXPECT_FALSE(watcher->WaitForChange(300));
+}
+
+}  // namespace
+}  // namespace TavoConfigStore
