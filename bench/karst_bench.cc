@@ -5,8 +5,6 @@
 #include <benchmark/benchmark.h>
 #include <malloc.h>
 #include <sys/resource.h>
-#include <sys/wait.h>
-#include <unistd.h>
 #include <zlib.h>
 
 #include <algorithm>
@@ -21,6 +19,7 @@
 #include <vector>
 
 #include "BenchData.h"
+#include "PeakRss.h"
 #include "RawSqlite.h"
 #include "TavoConfigStore/ConfigStore.h"
 #include "TavoKarst/KarstLib.h"
@@ -269,49 +268,10 @@ void BM_KarstGetStore(benchmark::State& state) {
 constexpr char kChildFlag[] = "--peak-rss-child=";
 
 // The child's peak resident set in KiB, as it reports it on its stdout, or
-// -1. (Not the parent's ru_maxrss for it: Linux carries the high-water mark
-// of the memory a child had before exec over, and a forked child had all of
-// the benchmark's.)
+// -1.
 long PeakRssOfChild(const std::vector<std::string>& args) {
-  std::vector<char*> argv;
-  static char self[] = "/proc/self/exe";
-  argv.push_back(self);
-  std::vector<std::string> copies = args;
-  for (std::string& a : copies) argv.push_back(a.data());
-  argv.push_back(nullptr);
-  int fds[2];
-  if (pipe(fds) != 0) return -1;
-  const pid_t pid = fork();
-  if (pid == 0) {
-    dup2(fds[1], STDOUT_FILENO);
-    close(fds[0]);
-    close(fds[1]);
-    execv(self, argv.data());
-    _exit(127);
-  }
-  close(fds[1]);
-  std::string report;
-  char buffer[256];
-  for (ssize_t got; (got = read(fds[0], buffer, sizeof buffer)) > 0;) report.append(buffer, got);
-  close(fds[0]);
-  int status = 0;
-  if (waitpid(pid, &status, 0) != pid || !WIFEXITED(status) || WEXITSTATUS(status) != 0) {
-    return -1;
-  }
-  return std::strtol(report.c_str(), nullptr, 10);
-}
-
-// VmHWM from /proc/self/status: the peak of this process's own memory.
-long OwnPeakRssKib() {
-  FILE* f = std::fopen("/proc/self/status", "r");
-  if (f == nullptr) return -1;
-  char line[256];
-  long kib = -1;
-  while (std::fgets(line, sizeof line, f) != nullptr) {
-    if (std::strncmp(line, "VmHWM:", 6) == 0) kib = std::strtol(line + 6, nullptr, 10);
-  }
-  std::fclose(f);
-  return kib;
+  const std::string report = RunSelf(args);
+  return report.empty() ? -1 : std::strtol(report.c_str(), nullptr, 10);
 }
 
 void BM_PeakRss(benchmark::State& state, const std::string& kind) {

@@ -140,22 +140,29 @@ def main():
             info.append(f"raw {layout}: replace {a:.1f} ms, list {b:.1f} ms (N=10,000)")
 
     headers = ("target", "measured", "CPU-time ratio", "goal", "result", "figures")
+    print_table(headers, rows, info, context,
+                ("store_fs", "store_dir", "sqlite_settings", "crc32_clmul", "crc32_avx512"),
+                markdown)
+
+
+def print_table(headers, rows, notes, context, context_keys, markdown):
+    """The table, then a line a note and a line a context key present."""
     if markdown:
         print("| " + " | ".join(headers) + " |")
         print("|" + "---|" * len(headers))
         for row in rows:
             print("| " + " | ".join(row) + " |")
         print()
-        for line in info:
+        for line in notes:
             print(f"- {line}")
     else:
         widths = [max(len(str(r[i])) for r in rows + [headers]) for i in range(len(headers))]
         for row in [headers] + rows:
             print("  ".join(str(v).ljust(w) for v, w in zip(row, widths)).rstrip())
         print()
-        for line in info:
+        for line in notes:
             print(line)
-    for key in ("store_fs", "store_dir", "sqlite_settings", "crc32_clmul", "crc32_avx512"):
+    for key in context_keys:
         if key in context:
             print(f"{'- ' if markdown else ''}{key}: {context[key]}")
 
