@@ -59,7 +59,8 @@ void Clear(ConfigStore& store, const std::string& key = "k") {
 // The keys etcd holds under "/<prefix>/<area>/".
 std::vector<std::string> RawKeys(const EtcdCluster& etcd, const std::string& prefix,
                                  const std::string& area) {
-  std::istringstream out(etcd.Etcdctl({"get", "--prefix", "--keys-only", "/" + prefix + "/" + area}));
+  std::istringstream out(
+      etcd.Etcdctl({"get", "--prefix", "--keys-only", "/" + prefix + "/" + area}));
   std::vector<std::string> keys;
   for (std::string line; std::getline(out, line);) {
     if (!line.empty()) keys.push_back(line);

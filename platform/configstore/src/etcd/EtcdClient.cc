@@ -12,12 +12,23 @@ namespace TavoConfigStore {
 namespace {
 
 const char* StatusName(grpc::StatusCode code) {
-  static const char* const kNames[] = {
-      "OK",        "CANCELLED",          "UNKNOWN",           "INVALID_ARGUMENT",
-      "DEADLINE_EXCEEDED", "NOT_FOUND",  "ALREADY_EXISTS",    "PERMISSION_DENIED",
-      "RESOURCE_EXHAUSTED", "FAILED_PRECONDITION", "ABORTED", "OUT_OF_RANGE",
-      "UNIMPLEMENTED", "INTERNAL",       "UNAVAILABLE",       "DATA_LOSS",
-      "UNAUTHENTICATED"};
+  static const char* const kNames[] = {"OK",
+                                       "CANCELLED",
+                                       "UNKNOWN",
+                                       "INVALID_ARGUMENT",
+                                       "DEADLINE_EXCEEDED",
+                                       "NOT_FOUND",
+                                       "ALREADY_EXISTS",
+                                       "PERMISSION_DENIED",
+                                       "RESOURCE_EXHAUSTED",
+                                       "FAILED_PRECONDITION",
+                                       "ABORTED",
+                                       "OUT_OF_RANGE",
+                                       "UNIMPLEMENTED",
+                                       "INTERNAL",
+                                       "UNAVAILABLE",
+                                       "DATA_LOSS",
+                                       "UNAUTHENTICATED"};
   const auto index = static_cast<std::size_t>(code);
   return index < sizeof kNames / sizeof kNames[0] ? kNames[index] : "UNKNOWN";
 }
@@ -56,8 +67,8 @@ std::string Target(const std::vector<std::string>& endpoints) {
     }
     for (addrinfo* a = found; a != nullptr; a = a->ai_next) {
       char host[NI_MAXHOST];
-      if (getnameinfo(a->ai_addr, a->ai_addrlen, host, sizeof host, nullptr, 0,
-                      NI_NUMERICHOST) != 0) {
+      if (getnameinfo(a->ai_addr, a->ai_addrlen, host, sizeof host, nullptr, 0, NI_NUMERICHOST) !=
+          0) {
         continue;
       }
       if (a->ai_family == AF_INET) v4 += (v4.empty() ? "" : ",") + std::string(host) + ":" + port;
@@ -237,7 +248,9 @@ void EtcdClient::LeaseRevoke(std::int64_t lease) {
   request.set_id(lease);
   etcdserverpb::LeaseRevokeResponse response;
   Invoke(
-      [&](grpc::ClientContext* context) { return lease_->LeaseRevoke(context, request, &response); },
+      [&](grpc::ClientContext* context) {
+        return lease_->LeaseRevoke(context, request, &response);
+      },
       true);
 }
 

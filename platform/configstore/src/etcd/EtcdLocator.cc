@@ -54,8 +54,9 @@ void CheckEndpoint(const std::string& endpoint) {
     Refuse("endpoint \"" + endpoint + "\" is not HOST:PORT");
   }
   const std::string port = endpoint.substr(colon + 1);
-  if (port.empty() || port.size() > 5 || port.find_first_not_of("0123456789") != std::string::npos ||
-      std::stoi(port) < 1 || std::stoi(port) > 65535) {
+  if (port.empty() || port.size() > 5 ||
+      port.find_first_not_of("0123456789") != std::string::npos || std::stoi(port) < 1 ||
+      std::stoi(port) > 65535) {
     Refuse("endpoint \"" + endpoint + "\" has no port from 1 to 65535");
   }
 }

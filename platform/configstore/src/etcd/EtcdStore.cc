@@ -282,7 +282,8 @@ class EtcdStore final : public ConfigStore {
 
   void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
                  std::int32_t& /*flags*/) override {
-    if (!object) throw ConfigStoreException(client_.Where() + ": SetObject of null", kErrorNullArgument);
+    if (!object)
+      throw ConfigStoreException(client_.Where() + ": SetObject of null", kErrorNullArgument);
     DamagedObject::RefuseWrite(*object);
     Put put;
     codec::EncodeObject(*object, &put.body);
@@ -472,7 +473,8 @@ class EtcdStore final : public ConfigStore {
         if (header.parts > 1) entry.joined.assign(value);
         for (std::uint64_t part = 1; part < header.parts && entry.damage.empty(); ++part) {
           const std::string want = std::string(key.substr(0, zero + 1)) + Keys::PartSuffix(part);
-          if (i + 1 < kvs.size() && std::string_view(kvs[i + 1].key()).substr(base.size()) == want) {
+          if (i + 1 < kvs.size() &&
+              std::string_view(kvs[i + 1].key()).substr(base.size()) == want) {
             entry.joined += kvs[++i].value();
           } else {
             entry.damage = "part " + std::to_string(part) + " of the object is missing";
@@ -480,7 +482,7 @@ class EtcdStore final : public ConfigStore {
         }
         if (header.parts > 1) entry.body = entry.joined;
         entry.order.index = header.index;
-        entry.order.revision = header.kind == OrderKind::kWritten     ? header.revision
+        entry.order.revision = header.kind == OrderKind::kWritten       ? header.revision
                                : header.kind == OrderKind::kOwnRevision ? kvs[i].mod_revision()
                                                                         : -1;  // set below
       }
@@ -520,8 +522,8 @@ class EtcdStore final : public ConfigStore {
   static std::shared_ptr<ConfigStoreObject> DecodePut(const ConfigStoreObjectId& id,
                                                       const Put& put) {
     ConfigStoreObjectId copy(id);
-    return codec::DecodeObject(std::move(copy), reinterpret_cast<const unsigned char*>(put.body.data()),
-                               put.body.size());
+    return codec::DecodeObject(
+        std::move(copy), reinterpret_cast<const unsigned char*>(put.body.data()), put.body.size());
   }
 
   void Observe(const std::string& collection, const Current& current) {
@@ -563,7 +565,8 @@ class EtcdStore final : public ConfigStore {
         std::vector<Entry> entries;
         ReadGeneration(current->second.gen, instance, pointers.revision, &reply, &entries);
         for (const Entry& entry : entries) {
-          if (pending && (pending->deleted.count(entry.instance) || pending->puts.count(entry.instance))) {
+          if (pending &&
+              (pending->deleted.count(entry.instance) || pending->puts.count(entry.instance))) {
             continue;
           }
           listed.push_back({entry.order, Decode(collection, entry, &arena)});
@@ -664,10 +667,12 @@ class EtcdStore final : public ConfigStore {
         bytes += put.body.size() + 2 * key.size() + 128;
       }
     }
-    return ops <= static_cast<std::size_t>(etcdlayout::kBatchOps) && bytes <= etcdlayout::kBatchBytes;
+    return ops <= static_cast<std::size_t>(etcdlayout::kBatchOps) &&
+           bytes <= etcdlayout::kBatchBytes;
   }
 
-  static std::vector<const std::pair<const std::string, Put>*> InWriteOrder(const Pending& pending) {
+  static std::vector<const std::pair<const std::string, Put>*> InWriteOrder(
+      const Pending& pending) {
     std::vector<const std::pair<const std::string, Put>*> puts;
     for (const auto& entry : pending.puts) puts.push_back(&entry);
     std::sort(puts.begin(), puts.end(),
@@ -698,7 +703,8 @@ class EtcdStore final : public ConfigStore {
         AddPut(&ops, keys_.Registered() + gen, name);
       }
       for (const std::string& instance : pending.deleted) {
-        if (current && !pending.puts.count(instance)) AddDeletePrefix(&ops, keys_.Object(gen, instance));
+        if (current && !pending.puts.count(instance))
+          AddDeletePrefix(&ops, keys_.Object(gen, instance));
       }
       for (const auto* put : InWriteOrder(pending)) {
         const std::string object = keys_.Object(gen, put->first);
@@ -752,10 +758,11 @@ class EtcdStore final : public ConfigStore {
   void WriteObject(const std::string& gen, const std::string& instance, Header header,
                    std::string_view body, std::vector<RequestOp>* ops, std::size_t* bytes) {
     const std::string object = keys_.Object(gen, instance);
-    header.parts = std::max<std::size_t>(1, (body.size() + etcdlayout::kPartBytes - 1) /
-                                                etcdlayout::kPartBytes);
+    header.parts = std::max<std::size_t>(
+        1, (body.size() + etcdlayout::kPartBytes - 1) / etcdlayout::kPartBytes);
     for (std::size_t part = 0; part < header.parts; ++part) {
-      const std::string_view piece = body.substr(part * etcdlayout::kPartBytes, etcdlayout::kPartBytes);
+      const std::string_view piece =
+          body.substr(part * etcdlayout::kPartBytes, etcdlayout::kPartBytes);
       const std::size_t size = piece.size() + object.size() + 32;
       if (*bytes + size > etcdlayout::kBatchBytes) Flush(ops, bytes, true);
       AddPut(ops, object + Keys::PartSuffix(part),
@@ -805,7 +812,8 @@ class EtcdStore final : public ConfigStore {
           std::vector<Entry> entries;
           ReadGeneration(current->gen, nullptr, now.revision, &reply, &entries);
           for (const Entry& entry : entries) {
-            if (pending.deleted.count(entry.instance) || pending.puts.count(entry.instance)) continue;
+            if (pending.deleted.count(entry.instance) || pending.puts.count(entry.instance))
+              continue;
             if (!entry.damage.empty()) continue;  // unreadable: nothing to carry over
             Header header;
             header.kind = OrderKind::kWritten;
@@ -821,7 +829,8 @@ class EtcdStore final : public ConfigStore {
           header.index = put->second.seq;
           WriteObject(gen, put->first, header, put->second.body, &ops, &bytes);
           ++written;
-          if (std::chrono::steady_clock::now() - lastKeepAlive > std::chrono::seconds(kLeaseSeconds / 4)) {
+          if (std::chrono::steady_clock::now() - lastKeepAlive >
+              std::chrono::seconds(kLeaseSeconds / 4)) {
             client_.LeaseKeepAlive(lease);
             lastKeepAlive = std::chrono::steady_clock::now();
           }
@@ -898,7 +907,8 @@ class EtcdStore final : public ConfigStore {
       if (live.count(gen)) continue;
       AddDeletePrefix(&ops, keys_.Generation(gen));
       AddDelete(&ops, kv.key());
-      if (ops.size() >= static_cast<std::size_t>(etcdlayout::kBatchOps)) client_.Txn(TxnOf(&ops), true);
+      if (ops.size() >= static_cast<std::size_t>(etcdlayout::kBatchOps))
+        client_.Txn(TxnOf(&ops), true);
     }
     if (!ops.empty()) client_.Txn(TxnOf(&ops), true);
   }
