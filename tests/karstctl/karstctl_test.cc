@@ -38,6 +38,14 @@ struct ToolResult {
   std::string out, err;
 };
 
+[[noreturn]] void ExecKarstctl(std::vector<std::string> args) {
+  std::vector<char*> argv = {const_cast<char*>(KARSTCTL_BINARY)};
+  for (std::string& arg : args) argv.push_back(arg.data());
+  argv.push_back(nullptr);
+  execv(argv[0], argv.data());
+  _exit(126);
+}
+
 // Each test has an empty store in its own folder; the library in this process
 // and any karstctl run without --store use it too.
 class Karstctl : public ::testing::Test {
@@ -55,11 +63,7 @@ class Karstctl : public ::testing::Test {
           dup2(open(dir_.File("stdin").c_str(), O_RDONLY), 0);
           dup2(outPath ? open(outPath, O_WRONLY) : resultFd, 1);
           dup2(open(dir_.File("stderr").c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600), 2);
-          std::vector<char*> argv = {const_cast<char*>(KARSTCTL_BINARY)};
-          for (std::string& arg : args) argv.push_back(arg.data());
-          argv.push_back(nullptr);
-          execv(argv[0], argv.data());
-          _exit(126);
+          ExecKarstctl(args);
         },
         60);
     return {child.exited ? child.code : 128 + child.code, child.output,
@@ -298,6 +302,13 @@ TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
       {{"--store", store_, "--wait", "0.2", "reset"},
        "karstctl: configuration store " + store_ +
            ": starting a transaction: database is locked (SQLITE_BUSY, 5)\n"},
+      // A bad etcd locator, never with its password; a good one is no file.
+      {{"--store", "etcd://u:cret/cret@h:1/p", "hash"},
+       "karstctl: etcd locator: '@' after the endpoints: write it as %40, and a '/' in a user "
+       "name or password as %2F (bad locator, 1010)\n"},
+      {{"--store", "etcd://u:cret@h/p", "blob", "default", "u"},
+       "karstctl: etcd locator: endpoint \"h\" is not HOST:PORT (bad locator, 1010)\n"},
+      {{"--store", "etcd://127.0.0.1:9/p", "--wait", "1", "export"}, " (etcd "},
   };
   for (const auto& [args, err] : cases) {
     const auto start = std::chrono::steady_clock::now();
@@ -307,6 +318,11 @@ TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
   EXPECT_NE(access(none.c_str(), F_OK), 0);
   ExpectFailure(RunTool({"--store", garbage, "import", "-"}, "["), 2, "<stdin>:1:2: ");
   EXPECT_EQ(ReadFile(garbage), std::string(8192, 'G'));
+  // A bad locator, though, comes before the input, from the environment too.
+  setenv("TAVO_CONFIGSTORE_PATH", "etcds://u:cret@h:1/p?cert=c", 1);
+  ExpectFailure(RunTool({"import", "-"}, "["), 1,
+                "karstctl: etcd locator: a client certificate needs its key and a key its "
+                "certificate (cert and key) (bad locator, 1010)\n");
 
   // Without a store path nor anything to derive one from, nothing is guessed.
   std::vector<std::pair<std::string, std::string>> saved;

@@ -56,9 +56,17 @@ void ReplaceBoth(const Catalogue& catalogue) {
   }
 }
 
-void RunRead(const Invocation& invocation) {
+Json Digests() {
+  auto hash = KarstLib::GetDbHash();
+  Json out = Json::object();
+  out["policies"] = hash.first;
+  out["datastores"] = hash.second;
+  return out;
+}
+
+void RunRead(const Invocation& invocation, StoreSession& session) {
   const std::vector<std::string>& operands = invocation.operands;
-  StoreSession session(invocation, StoreUse::kRead);
+  session.Open(StoreUse::kRead);
   switch (invocation.command) {
     case Command::kPoliciesList:
       PrintJson(PoliciesToJson(KarstLib::ListPolicyInfo()));
@@ -84,14 +92,9 @@ void RunRead(const Invocation& invocation) {
     case Command::kBlobDefault:
       WriteOutput(KarstLib::GetDefaultPolicyBlob(operands[0]));
       break;
-    case Command::kHash: {
-      auto hash = KarstLib::GetDbHash();
-      Json out = Json::object();
-      out["policies"] = hash.first;
-      out["datastores"] = hash.second;
-      PrintJson(out);
+    case Command::kHash:
+      PrintJson(Digests());
       break;
-    }
     default:
       break;
   }
@@ -102,23 +105,33 @@ void RunRead(const Invocation& invocation) {
 void RunCommand(const Invocation& invocation) {
   const std::vector<std::string>& operands = invocation.operands;
   switch (invocation.command) {
-    case Command::kReset: {
-      StoreSession session(invocation, StoreUse::kWrite);
+    case Command::kCheck:
+      Warn(CatalogueWarnings(ReadRecords(operands[0], CatalogueFromJson), nullptr));
+      return;
+    case Command::kHelp:
+    case Command::kVersion:
+      return;  // answered before the store is chosen
+    default:
+      break;
+  }
+  StoreSession session(invocation);  // a bad etcd locator fails here, before any input
+  switch (invocation.command) {
+    case Command::kReset:
+      session.Open(StoreUse::kWrite);
       KarstLib::Reset();
       break;
-    }
     case Command::kPoliciesSet: {
       auto policies = ReadRecords(
           operands[0], [](const Json& json) { return PoliciesFromJson(json, "policies"); });
       Warn(PolicyWarnings(policies));
-      StoreSession session(invocation, StoreUse::kWrite);
+      session.Open(StoreUse::kWrite);
       KarstLib::AddPolicyInfo(policies);
       break;
     }
     case Command::kDatastoresSet: {
       auto datastores = ReadRecords(
           operands[0], [](const Json& json) { return DatastoresFromJson(json, "datastores"); });
-      StoreSession session(invocation, StoreUse::kWrite);
+      session.Open(StoreUse::kWrite);
       const auto stored = KarstLib::ListPolicyInfo();
       Warn(DatastoreWarnings(datastores, &stored, "the store"));
       KarstLib::AddDatastoreInfo(datastores);
@@ -126,21 +139,15 @@ void RunCommand(const Invocation& invocation) {
     }
     case Command::kImport: {
       Catalogue catalogue = ReadRecords(operands[0], CatalogueFromJson);
-      StoreSession session(invocation, StoreUse::kWrite);
+      session.Open(StoreUse::kWrite);
       std::vector<TavoKarst::KarstPolicyInfo> stored;
       if (catalogue.datastores && !catalogue.policies) stored = KarstLib::ListPolicyInfo();
       Warn(CatalogueWarnings(catalogue, &stored));
       ReplaceBoth(catalogue);
       break;
     }
-    case Command::kCheck:
-      Warn(CatalogueWarnings(ReadRecords(operands[0], CatalogueFromJson), nullptr));
-      break;
-    case Command::kHelp:
-    case Command::kVersion:
-      break;  // answered before the store is chosen
     default:
-      RunRead(invocation);
+      RunRead(invocation, session);
   }
 }
 
