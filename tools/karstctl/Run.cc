@@ -1,12 +1,18 @@
 #include "Run.h"
 
+#include <signal.h>
+
+#include <chrono>
+#include <csignal>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "Errors.h"
 #include "Io.h"
 #include "JsonCodec.h"
 #include "JsonText.h"
+#include "StoreErrors.h"
 #include "StoreSession.h"
 #include "TavoConfigStore/ConfigStore.h"
 #include "TavoKarst/KarstLib.h"
@@ -62,6 +68,40 @@ Json Digests() {
   out["policies"] = hash.first;
   out["datastores"] = hash.second;
   return out;
+}
+
+volatile std::sig_atomic_t gStopWatching = 0;
+
+void StopWatching(int /*signal*/) { gStopWatching = 1; }
+
+// A wait for a change lasts at most this long, so that a signal ends the
+// watch within about as long.
+constexpr int kWatchWaitMs = 200;
+// After a failed read (a lock held through a crash recovery, say), before
+// the next try.
+constexpr std::chrono::seconds kWatchRetryPause(1);
+
+// The first read fails the command like any other; later failures are
+// reported and tried again, as a watch is meant to outlast them.
+void Watch(StoreSession& session) {
+  session.Open(StoreUse::kWatch);
+  struct sigaction stop {};
+  stop.sa_handler = StopWatching;
+  sigaction(SIGINT, &stop, nullptr);
+  sigaction(SIGTERM, &stop, nullptr);
+  auto store = TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace);
+  std::string last = Digests().dump() + "\n";
+  WriteOutput(last);
+  while (gStopWatching == 0) {
+    try {
+      if (!store->WaitForChange(kWatchWaitMs)) continue;
+      std::string line = Digests().dump() + "\n";
+      if (line != last) WriteOutput(last = std::move(line));
+    } catch (const TavoConfigStore::ConfigStoreException& e) {
+      WriteDiagnostic("warning: " + DescribeStoreError(e) + "; trying again");
+      std::this_thread::sleep_for(kWatchRetryPause);
+    }
+  }
 }
 
 void RunRead(const Invocation& invocation, StoreSession& session) {
@@ -146,6 +186,9 @@ void RunCommand(const Invocation& invocation) {
       ReplaceBoth(catalogue);
       break;
     }
+    case Command::kWatch:
+      Watch(session);
+      break;
     default:
       RunRead(invocation, session);
   }
