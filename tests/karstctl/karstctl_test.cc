@@ -1,11 +1,16 @@
 // karstctl end to end: the built binary against a store file of its own.
 #include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
 #include <sqlite3.h>
+#include <sys/prctl.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
 #include <cstdint>
+#include <filesystem>
 #include <regex>
 #include <set>
 #include <sstream>
@@ -38,6 +43,79 @@ struct ToolResult {
   std::string out, err;
 };
 
+[[noreturn]] void ExecKarstctl(std::vector<std::string> args) {
+  std::vector<char*> argv = {const_cast<char*>(KARSTCTL_BINARY)};
+  for (std::string& arg : args) argv.push_back(arg.data());
+  argv.push_back(nullptr);
+  execv(argv[0], argv.data());
+  _exit(126);
+}
+
+// karstctl left running (watch), its output read line by line as it comes.
+class Background {
+ public:
+  Background(const std::vector<std::string>& args, const std::string& errPath) {
+    int fds[2];
+    if (pipe(fds) != 0) throw std::runtime_error("pipe failed");
+    pid_ = fork();
+    if (pid_ == 0) {
+      prctl(PR_SET_PDEATHSIG, SIGKILL);  // not outliving a test that fails first
+      dup2(fds[1], 1);
+      dup2(open(errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600), 2);
+      ExecKarstctl(args);
+    }
+    close(fds[1]);
+    fd_ = fds[0];
+  }
+  ~Background() {
+    if (pid_ > 0) Stop(SIGKILL);
+    close(fd_);
+  }
+  Background(const Background&) = delete;
+  Background& operator=(const Background&) = delete;
+
+  // The next line, or "" when none is whole within "seconds".
+  std::string NextLine(double seconds) {
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::duration<double>(seconds);
+    std::size_t end;
+    while ((end = pending_.find('\n')) == std::string::npos) {
+      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+          deadline - std::chrono::steady_clock::now());
+      pollfd p{fd_, POLLIN, 0};
+      char buffer[4096];
+      ssize_t got = 0;
+      if (left.count() <= 0 || poll(&p, 1, static_cast<int>(left.count())) <= 0 ||
+          (got = read(fd_, buffer, sizeof buffer)) <= 0) {
+        return "";
+      }
+      pending_.append(buffer, static_cast<std::size_t>(got));
+    }
+    std::string line = pending_.substr(0, end + 1);
+    pending_.erase(0, end + 1);
+    return line;
+  }
+
+  // Sends "signal"; the exit status (128 + signal when killed by one), or -1
+  // when it is still running ten seconds later.
+  int Stop(int signal) {
+    kill(pid_, signal);
+    int status = 0;
+    bool hung = false;
+    for (int waited = 0; waitpid(pid_, &status, WNOHANG) == 0; waited += 10) {
+      if (waited == 10000) hung = kill(pid_, SIGKILL) == 0;
+      usleep(10000);
+    }
+    pid_ = -1;
+    if (hung) return -1;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  }
+
+ private:
+  pid_t pid_;
+  int fd_;
+  std::string pending_;
+};
+
 // Each test has an empty store in its own folder; the library in this process
 // and any karstctl run without --store use it too.
 class Karstctl : public ::testing::Test {
@@ -55,11 +133,7 @@ class Karstctl : public ::testing::Test {
           dup2(open(dir_.File("stdin").c_str(), O_RDONLY), 0);
           dup2(outPath ? open(outPath, O_WRONLY) : resultFd, 1);
           dup2(open(dir_.File("stderr").c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600), 2);
-          std::vector<char*> argv = {const_cast<char*>(KARSTCTL_BINARY)};
-          for (std::string& arg : args) argv.push_back(arg.data());
-          argv.push_back(nullptr);
-          execv(argv[0], argv.data());
-          _exit(126);
+          ExecKarstctl(args);
         },
         60);
     return {child.exited ? child.code : 128 + child.code, child.output,
@@ -75,6 +149,15 @@ class Karstctl : public ::testing::Test {
     EXPECT_EQ(result.status, 0) << result.err;
     EXPECT_EQ(result.err, "");
     return result.out;
+  }
+
+  // What hash prints for "store", on one line as watch prints it.
+  std::string HashLine(const std::string& store) {
+    std::string line;
+    for (char c : RunTool({"--store", store, "hash"}).out) {
+      if (c != ' ' && c != '\n') line += c;
+    }
+    return line + "\n";
   }
 
   ScratchDir dir_;
@@ -298,6 +381,14 @@ TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
       {{"--store", store_, "--wait", "0.2", "reset"},
        "karstctl: configuration store " + store_ +
            ": starting a transaction: database is locked (SQLITE_BUSY, 5)\n"},
+      {{"--store", garbage, "watch"}, "(SQLITE_NOTADB, 26)\n"},
+      // A bad etcd locator, never with its password; a good one is no file.
+      {{"--store", "etcd://u:cret/cret@h:1/p", "watch"},
+       "karstctl: etcd locator: '@' after the endpoints: write it as %40, and a '/' in a user "
+       "name or password as %2F (bad locator, 1010)\n"},
+      {{"--store", "etcd://u:cret@h/p", "blob", "default", "u"},
+       "karstctl: etcd locator: endpoint \"h\" is not HOST:PORT (bad locator, 1010)\n"},
+      {{"--store", "etcd://127.0.0.1:9/p", "--wait", "1", "export"}, " (etcd "},
   };
   for (const auto& [args, err] : cases) {
     const auto start = std::chrono::steady_clock::now();
@@ -307,6 +398,11 @@ TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
   EXPECT_NE(access(none.c_str(), F_OK), 0);
   ExpectFailure(RunTool({"--store", garbage, "import", "-"}, "["), 2, "<stdin>:1:2: ");
   EXPECT_EQ(ReadFile(garbage), std::string(8192, 'G'));
+  // A bad locator, though, comes before the input, from the environment too.
+  setenv("TAVO_CONFIGSTORE_PATH", "etcds://u:cret@h:1/p?cert=c", 1);
+  ExpectFailure(RunTool({"import", "-"}, "["), 1,
+                "karstctl: etcd locator: a client certificate needs its key and a key its "
+                "certificate (cert and key) (bad locator, 1010)\n");
 
   // Without a store path nor anything to derive one from, nothing is guessed.
   std::vector<std::pair<std::string, std::string>> saved;
@@ -316,6 +412,56 @@ TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
   }
   ExpectFailure(RunTool({"export"}), 1, "(no store path, 1008)\n");
   for (const auto& [name, value] : saved) setenv(name.c_str(), value.c_str(), 1);
+}
+
+// watch prints hash's digests on one line, then a line at each change, soon
+// after it; a write that leaves them equal prints nothing, and SIGINT ends it
+// with status 0.
+TEST_F(Karstctl, WatchPrintsTheDigestsAgainAtEachChange) {
+  Ok({"import", "-"}, R"({"policies": [{"name": "a"}]})");
+  Background watch({"--store", store_, "watch"}, dir_.File("watch.err"));
+  EXPECT_EQ(watch.NextLine(10), HashLine(store_));
+  // Each write follows the last line at once, so a watch that slept for
+  // seconds between looks would answer late every time.
+  auto fastest = std::chrono::steady_clock::duration::max();
+  for (const char* catalogue : {R"({"policies": [{"name": "b"}]})",
+                                R"({"datastores": [{"url": "u"}]})", R"({"policies": []})"}) {
+    Ok({"import", "-"}, catalogue);
+    const auto written = std::chrono::steady_clock::now();
+    const std::string line = watch.NextLine(10);
+    fastest = std::min(fastest, std::chrono::steady_clock::now() - written);
+    EXPECT_EQ(line, HashLine(store_)) << catalogue;
+    Ok({"import", "-"}, catalogue);  // the same digests: the next line is the next change's
+  }
+  EXPECT_LT(std::chrono::duration_cast<std::chrono::milliseconds>(fastest).count(), 1000);
+  EXPECT_EQ(watch.NextLine(0.5), "");
+  EXPECT_EQ(watch.Stop(SIGINT), 0);
+  EXPECT_EQ(ReadFile(dir_.File("watch.err")), "");
+}
+
+// Watching a store that does not exist yet creates nothing, and prints when
+// another process creates it. A store that cannot be read meanwhile (a file
+// that is no store, left there for a while) is reported and tried again.
+// SIGTERM ends the watch with status 0 too.
+TEST_F(Karstctl, WatchWaitsForTheStoreAndOutlastsFailedReads) {
+  Ok({"reset"});
+  const std::string later = dir_.File("later/store.db"), err = dir_.File("watch.err");
+  Background watch({"--store", later, "watch"}, err);
+  EXPECT_EQ(watch.NextLine(10), HashLine(store_));
+  EXPECT_EQ(watch.NextLine(0.5), "");
+  EXPECT_FALSE(std::filesystem::exists(dir_.File("later")));
+
+  std::filesystem::create_directory(dir_.File("later"));
+  WriteFile(later, std::string(8192, 'G'));
+  for (int i = 0; i < 100 && ReadFile(err).empty(); ++i) usleep(50000);
+  EXPECT_THAT(ReadFile(err), ::testing::MatchesRegex("(karstctl: warning: [^\n]*\\(SQLITE_NOTADB, "
+                                                     "26\\); trying again\n)+"));
+  EXPECT_EQ(ReadFile(later), std::string(8192, 'G'));
+  std::filesystem::remove(later);
+  ASSERT_EQ(RunTool({"--store", later, "import", "-"}, R"({"policies": [{"name": "a"}]})").status,
+            0);
+  EXPECT_EQ(watch.NextLine(10), HashLine(later));
+  EXPECT_EQ(watch.Stop(SIGTERM), 0);
 }
 
 TEST_F(Karstctl, UnwritableOutputExitsOne) {

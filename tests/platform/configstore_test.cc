@@ -474,6 +474,45 @@ TEST_F(SqliteStoreTest, WriterWaitsForAnotherConnectionsLock) {
   EXPECT_THAT(List(*NewSqliteStore(Path())), ElementsAre("after the wait"));
 }
 
+// A watcher sees another connection's commit within a poll or two, also one
+// made before it began to wait, and times out when nothing is committed.
+// Waiting for a store that does not exist creates nothing; the file's
+// appearance is the change.
+TEST_F(SqliteStoreTest, WaitForChangeSeesOtherConnectionsCommits) {
+  using std::chrono::milliseconds;
+  auto watcher = NewSqliteStore(Path("new/store.db"));
+  auto writer = NewSqliteStore(Path("new/store.db"));
+  // How long a wait with that timeout took, and what it said.
+  auto timed = [&watcher](int timeoutMs) {
+    const auto start = std::chrono::steady_clock::now();
+    const bool changed = watcher->WaitForChange(timeoutMs);
+    return std::pair{changed, std::chrono::steady_clock::now() - start};
+  };
+  for (bool exists : {false, true}) {
+    SCOPED_TRACE(exists ? "store exists" : "no store yet");
+    const auto [quiet, quietTook] = timed(200);
+    EXPECT_FALSE(quiet);
+    EXPECT_GE(quietTook, milliseconds(200));
+    EXPECT_EQ(std::filesystem::exists(Path("new")), exists);
+    std::thread commit([&writer, exists] {
+      std::this_thread::sleep_for(milliseconds(300));
+      Set(*writer, Sample(exists ? "second" : "first"));
+    });
+    const auto [changed, took] = timed(10000);
+    commit.join();
+    EXPECT_TRUE(changed);
+    EXPECT_GE(took, milliseconds(250));
+    EXPECT_LT(took, milliseconds(2000));  // 300 ms and a poll, on a loaded machine
+    watcher->WaitForChange(0);            // the rest of the write that created the file
+  }
+  Set(*writer, Sample("before the wait"));
+  EXPECT_TRUE(watcher->WaitForChange(0));
+  EXPECT_FALSE(watcher->WaitForChange(0));
+  watcher->BeginTransaction();
+  EXPECT_EQ(CodeOf([&] { watcher->WaitForChange(0); }), SQLITE_MISUSE);
+  watcher->AbortTransaction();
+}
+
 // After an I/O error SQLite rolls the transaction back by itself. A write
 // after that would be committed alone at once, beyond the caller's Abort,
 // and a Commit reporting success would lose the earlier writes silently.

@@ -23,11 +23,13 @@ enum class Command {
   kBlobCorraByName,
   kBlobDefault,
   kHash,
+  kWatch,
 };
 
 // What a command needs of the store: a read fails when there is no store
-// (so a mistyped path is not an empty catalogue), a write creates it.
-enum class StoreUse { kNone, kRead, kWrite };
+// (so a mistyped path is not an empty catalogue), a write creates it, and a
+// watch waits for it to appear without making it.
+enum class StoreUse { kNone, kRead, kWrite, kWatch };
 
 // One line of the command table: the words that select the command, the
 // operands it takes, and what it does (for --help).

@@ -65,6 +65,11 @@ const std::vector<CommandEntry>& CommandTable() {
        {},
        "print {\"policies\": \"<crc32>\", \"datastores\": \"<crc32>\"}",
        StoreUse::kRead},
+      {Command::kWatch,
+       {"watch"},
+       {},
+       "one line of hash's digests now and at each change, until interrupted",
+       StoreUse::kWatch},
   };
   return table;
 }

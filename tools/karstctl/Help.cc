@@ -38,11 +38,12 @@ std::string HelpText() {
       "Commands:\n";
   for (const auto& entry : CommandTable()) out += line(Synopsis(entry), entry.summary);
   out += "\nOptions:\n";
-  out += line("--store PATH", "the store file; by default $TAVO_CONFIGSTORE_PATH,");
-  out += line("", "else $XDG_STATE_HOME/tavo/configstore.db,");
+  out += line("--store PATH", "the store file or etcd locator (see below); by default");
+  out += line("", "$TAVO_CONFIGSTORE_PATH, else $XDG_STATE_HOME/tavo/configstore.db,");
   out += line("", "else ~/.local/state/tavo/configstore.db");
   out += line("--wait SECONDS", "how long to wait for another process's write lock");
-  out += line("", "(default 10, fractions allowed)");
+  out += line("", "(default 10, fractions allowed), or for each etcd request");
+  out += line("", "(default the locator's timeout, else 5)");
   out += line("--help", "print this help, or with a COMMAND that command's usage");
   out += line("--version", "print the version");
   out += line("--", "ends the options: later words starting with - are operands");
@@ -58,9 +59,16 @@ std::string HelpText() {
       "signed 64-bit integer. A missing field is \"\", 0 or []; an unknown or repeated key is\n"
       "an error.\n"
       "A blob is written raw with nothing added; finding none prints nothing.\n"
-      "Reading commands fail when there is no store; writing ones create it. Writing\n"
-      "commands and check warn about records the store would collapse, drop or leave\n"
-      "dangling (repeated names, ids or urls, empty names, unknown drp_policy_id).\n"
+      "Reading commands fail when there is no store file; writing ones create it and\n"
+      "watch waits for it. Writing commands and check warn about records the store\n"
+      "would collapse, drop or leave dangling (repeated names, ids or urls, empty\n"
+      "names, unknown drp_policy_id).\n"
+      "An etcd locator is\n"
+      "  etcd[s]://[USER[:PASSWORD]@]HOST:PORT[,HOST:PORT...]/PREFIX\n"
+      "            [?cacert=FILE&cert=FILE&key=FILE&timeout=MS]\n"
+      "with %XX for any of @/?&,% in its parts; etcds:// uses TLS. What it leaves out\n"
+      "comes from ETCDCTL_USER (USER[:PASSWORD]), ETCDCTL_PASSWORD and, for etcds://,\n"
+      "ETCDCTL_CACERT, ETCDCTL_CERT and ETCDCTL_KEY. A new etcd catalogue reads as empty.\n"
       "\n"
       "Exit status:\n"
       "  0  success\n"

@@ -1,12 +1,18 @@
 #include "Run.h"
 
+#include <signal.h>
+
+#include <chrono>
+#include <csignal>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "Errors.h"
 #include "Io.h"
 #include "JsonCodec.h"
 #include "JsonText.h"
+#include "StoreErrors.h"
 #include "StoreSession.h"
 #include "TavoConfigStore/ConfigStore.h"
 #include "TavoKarst/KarstLib.h"
@@ -56,9 +62,51 @@ void ReplaceBoth(const Catalogue& catalogue) {
   }
 }
 
-void RunRead(const Invocation& invocation) {
+Json Digests() {
+  auto hash = KarstLib::GetDbHash();
+  Json out = Json::object();
+  out["policies"] = hash.first;
+  out["datastores"] = hash.second;
+  return out;
+}
+
+volatile std::sig_atomic_t gStopWatching = 0;
+
+void StopWatching(int /*signal*/) { gStopWatching = 1; }
+
+// A wait for a change lasts at most this long, so that a signal ends the
+// watch within about as long.
+constexpr int kWatchWaitMs = 200;
+// After a failed read (a lock held through a crash recovery, say), before
+// the next try.
+constexpr std::chrono::seconds kWatchRetryPause(1);
+
+// The first read fails the command like any other; later failures are
+// reported and tried again, as a watch is meant to outlast them.
+void Watch(StoreSession& session) {
+  session.Open(StoreUse::kWatch);
+  struct sigaction stop {};
+  stop.sa_handler = StopWatching;
+  sigaction(SIGINT, &stop, nullptr);
+  sigaction(SIGTERM, &stop, nullptr);
+  auto store = TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace);
+  std::string last = Digests().dump() + "\n";
+  WriteOutput(last);
+  while (gStopWatching == 0) {
+    try {
+      if (!store->WaitForChange(kWatchWaitMs)) continue;
+      std::string line = Digests().dump() + "\n";
+      if (line != last) WriteOutput(last = std::move(line));
+    } catch (const TavoConfigStore::ConfigStoreException& e) {
+      WriteDiagnostic("warning: " + DescribeStoreError(e) + "; trying again");
+      std::this_thread::sleep_for(kWatchRetryPause);
+    }
+  }
+}
+
+void RunRead(const Invocation& invocation, StoreSession& session) {
   const std::vector<std::string>& operands = invocation.operands;
-  StoreSession session(invocation, StoreUse::kRead);
+  session.Open(StoreUse::kRead);
   switch (invocation.command) {
     case Command::kPoliciesList:
       PrintJson(PoliciesToJson(KarstLib::ListPolicyInfo()));
@@ -84,14 +132,9 @@ void RunRead(const Invocation& invocation) {
     case Command::kBlobDefault:
       WriteOutput(KarstLib::GetDefaultPolicyBlob(operands[0]));
       break;
-    case Command::kHash: {
-      auto hash = KarstLib::GetDbHash();
-      Json out = Json::object();
-      out["policies"] = hash.first;
-      out["datastores"] = hash.second;
-      PrintJson(out);
+    case Command::kHash:
+      PrintJson(Digests());
       break;
-    }
     default:
       break;
   }
@@ -102,23 +145,33 @@ void RunRead(const Invocation& invocation) {
 void RunCommand(const Invocation& invocation) {
   const std::vector<std::string>& operands = invocation.operands;
   switch (invocation.command) {
-    case Command::kReset: {
-      StoreSession session(invocation, StoreUse::kWrite);
+    case Command::kCheck:
+      Warn(CatalogueWarnings(ReadRecords(operands[0], CatalogueFromJson), nullptr));
+      return;
+    case Command::kHelp:
+    case Command::kVersion:
+      return;  // answered before the store is chosen
+    default:
+      break;
+  }
+  StoreSession session(invocation);  // a bad etcd locator fails here, before any input
+  switch (invocation.command) {
+    case Command::kReset:
+      session.Open(StoreUse::kWrite);
       KarstLib::Reset();
       break;
-    }
     case Command::kPoliciesSet: {
       auto policies = ReadRecords(
           operands[0], [](const Json& json) { return PoliciesFromJson(json, "policies"); });
       Warn(PolicyWarnings(policies));
-      StoreSession session(invocation, StoreUse::kWrite);
+      session.Open(StoreUse::kWrite);
       KarstLib::AddPolicyInfo(policies);
       break;
     }
     case Command::kDatastoresSet: {
       auto datastores = ReadRecords(
           operands[0], [](const Json& json) { return DatastoresFromJson(json, "datastores"); });
-      StoreSession session(invocation, StoreUse::kWrite);
+      session.Open(StoreUse::kWrite);
       const auto stored = KarstLib::ListPolicyInfo();
       Warn(DatastoreWarnings(datastores, &stored, "the store"));
       KarstLib::AddDatastoreInfo(datastores);
@@ -126,21 +179,18 @@ void RunCommand(const Invocation& invocation) {
     }
     case Command::kImport: {
       Catalogue catalogue = ReadRecords(operands[0], CatalogueFromJson);
-      StoreSession session(invocation, StoreUse::kWrite);
+      session.Open(StoreUse::kWrite);
       std::vector<TavoKarst::KarstPolicyInfo> stored;
       if (catalogue.datastores && !catalogue.policies) stored = KarstLib::ListPolicyInfo();
       Warn(CatalogueWarnings(catalogue, &stored));
       ReplaceBoth(catalogue);
       break;
     }
-    case Command::kCheck:
-      Warn(CatalogueWarnings(ReadRecords(operands[0], CatalogueFromJson), nullptr));
+    case Command::kWatch:
+      Watch(session);
       break;
-    case Command::kHelp:
-    case Command::kVersion:
-      break;  // answered before the store is chosen
     default:
-      RunRead(invocation);
+      RunRead(invocation, session);
   }
 }
 

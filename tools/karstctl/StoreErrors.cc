@@ -2,6 +2,7 @@
 
 #include <sqlite3.h>
 
+#include <iterator>
 #include <utility>
 #include <vector>
 
@@ -107,8 +108,35 @@ const Names& StoreNames() {
       {kErrorNullArgument, "null argument"},
       {kErrorNoStorePath, "no store path"},
       {kErrorSymlink, "symbolic link"},
+      {kErrorBadLocator, "bad locator"},
+      {kErrorConflict, "conflict"},
+      {kErrorEtcdReply, "bad etcd reply"},
   };
   return names;
+}
+
+// etcd's failures are kErrorEtcdBase plus the gRPC status code.
+const char* EtcdName(std::int32_t code) {
+  static const char* const kGrpc[] = {"OK",
+                                      "CANCELLED",
+                                      "UNKNOWN",
+                                      "INVALID_ARGUMENT",
+                                      "DEADLINE_EXCEEDED",
+                                      "NOT_FOUND",
+                                      "ALREADY_EXISTS",
+                                      "PERMISSION_DENIED",
+                                      "RESOURCE_EXHAUSTED",
+                                      "FAILED_PRECONDITION",
+                                      "ABORTED",
+                                      "OUT_OF_RANGE",
+                                      "UNIMPLEMENTED",
+                                      "INTERNAL",
+                                      "UNAVAILABLE",
+                                      "DATA_LOSS",
+                                      "UNAUTHENTICATED"};
+  const std::int32_t status = code - TavoConfigStore::kErrorEtcdBase;
+  return status >= 0 && status < static_cast<std::int32_t>(std::size(kGrpc)) ? kGrpc[status]
+                                                                             : nullptr;
 }
 
 const char* Find(const Names& names, std::int32_t code) {
@@ -122,6 +150,7 @@ const char* Find(const Names& names, std::int32_t code) {
 
 std::string StoreErrorName(std::int32_t code) {
   if (const char* name = Find(StoreNames(), code)) return name;
+  if (const char* name = EtcdName(code)) return std::string("etcd ") + name;
   if (const char* name = Find(SqliteNames(), code)) return name;
   if (const char* name = Find(SqliteNames(), code & 0xFF)) return name;
   return "unknown code";

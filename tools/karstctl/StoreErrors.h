@@ -9,8 +9,9 @@
 namespace karstctl {
 
 // The name of a store error code: SQLite's ("SQLITE_BUSY",
-// "SQLITE_IOERR_FSYNC"), or the store's own ("not a store"). An extended
-// SQLite code without a name of its own is named by its primary code.
+// "SQLITE_IOERR_FSYNC"), the store's own ("not a store"), or etcd's
+// ("etcd UNAVAILABLE"). An extended SQLite code without a name of its own
+// is named by its primary code.
 std::string StoreErrorName(std::int32_t code);
 
 // "<the store's message> (<name>, <code>)", so an operator can read what went

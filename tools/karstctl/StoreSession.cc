@@ -2,25 +2,37 @@
 
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <stdexcept>
-#include <string>
 
 #include "TavoConfigStore/ConfigStore.h"
 
 namespace karstctl {
 
-StoreSession::StoreSession(const Invocation& invocation, StoreUse use) {
-  const std::string path =
-      invocation.store ? *invocation.store : TavoConfigStore::DefaultStorePath();
+StoreSession::StoreSession(const Invocation& invocation)
+    : locator_(invocation.store ? *invocation.store : TavoConfigStore::DefaultStorePath()),
+      waitMs_(invocation.waitMs) {
+  if (TavoConfigStore::IsEtcdLocator(locator_)) {
+    etcd_ = TavoConfigStore::ParseEtcdLocator(locator_);
+    // A locator's timeout is at least 1 ms, and so is this one.
+    if (waitMs_) etcd_->timeoutMs = std::max(*waitMs_, 1);
+  }
+}
+
+void StoreSession::Open(StoreUse use) {
+  if (etcd_) {
+    TavoConfigStore::SetGlobalStore(TavoConfigStore::NewEtcdStore(*etcd_));
+    return;
+  }
   struct stat info;
-  if (use == StoreUse::kRead && lstat(path.c_str(), &info) != 0 &&
+  if (use == StoreUse::kRead && lstat(locator_.c_str(), &info) != 0 &&
       (errno == ENOENT || errno == ENOTDIR)) {
-    throw std::runtime_error("no store at " + path);
+    throw std::runtime_error("no store at " + locator_);
   }
   TavoConfigStore::SqliteStoreOptions options;
-  if (invocation.waitMs) options.busyTimeoutMs = *invocation.waitMs;
-  TavoConfigStore::SetGlobalStore(TavoConfigStore::NewSqliteStore(path, options));
+  if (waitMs_) options.busyTimeoutMs = *waitMs_;
+  TavoConfigStore::SetGlobalStore(TavoConfigStore::NewSqliteStore(locator_, options));
 }
 
 // Closes the connection, so a caller running several commands in one

@@ -1,21 +1,36 @@
 #ifndef KARSTCTL_STORE_SESSION_H_
 #define KARSTCTL_STORE_SESSION_H_
 
+#include <optional>
+#include <string>
+
 #include "Args.h"
+#include "TavoConfigStore/EtcdStore.h"
 
 namespace karstctl {
 
-// The store one command works on, installed as the library's store for as
-// long as this object lives: the --store path or else the default one,
-// opened with the --wait lock timeout. For a read, a path with nothing there
-// fails with "no store at PATH" (std::runtime_error) instead of reading as
-// an empty catalogue. Store failures throw ConfigStoreException.
+// The store one command works on: the --store locator or else the default
+// one, a SQLite file or an etcd locator. Constructing it touches nothing but
+// reads an etcd locator, so a bad one is reported (ConfigStoreException,
+// kErrorBadLocator) before any input is read. Open installs the store as
+// the library's for as long as this object lives, with --wait as the lock
+// timeout of a file or the request timeout of etcd. For a read, a file path
+// with nothing there fails with "no store at PATH" (std::runtime_error)
+// instead of reading as an empty catalogue; on etcd an empty catalogue is
+// simply empty. Store failures throw ConfigStoreException.
 class StoreSession {
  public:
-  StoreSession(const Invocation& invocation, StoreUse use);
+  explicit StoreSession(const Invocation& invocation);
   ~StoreSession();
   StoreSession(const StoreSession&) = delete;
   StoreSession& operator=(const StoreSession&) = delete;
+
+  void Open(StoreUse use);
+
+ private:
+  std::string locator_;
+  std::optional<TavoConfigStore::EtcdStoreOptions> etcd_;
+  std::optional<int> waitMs_;
 };
 
 }  // namespace karstctl

@@ -32,10 +32,12 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <map>
 #include <mutex>
 #include <string>
+#include <thread>
 #include <tuple>
 #include <utility>
 #include <vector>
@@ -54,6 +56,11 @@ namespace {
 // writes several times as many pages. The cost is that the smallest write
 // puts 16 KiB pages into the log rather than 4 KiB ones.
 constexpr int kPageSize = 16384;
+
+// How often WaitForChange looks: a look is one read of the shared-memory
+// index (or one lstat while there is no file), so a watcher costs next to
+// nothing and still answers within a twentieth of a second.
+constexpr std::chrono::milliseconds kChangePoll(50);
 
 // Owns the connection, so that it is closed even when the store's
 // constructor throws after opening it.
@@ -264,7 +271,45 @@ class SqliteStore final : public ConfigStore {
     if (rc != SQLITE_DONE) Fail("rolling back");
   }
 
+  // Any commit by another connection since this one connected or last
+  // looked counts, so a change between a caller's read and this call is not
+  // missed. The lock is held only while looking, never while sleeping.
+  bool WaitForChange(int timeoutMs) override {
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
+    for (;;) {
+      {
+        std::lock_guard<std::mutex> lock(mu_);
+        if (depth_ > 0) {
+          // Our write lock would keep out the very change waited for.
+          throw ConfigStoreException(Where() + ": WaitForChange inside a transaction",
+                                     SQLITE_MISUSE);
+        }
+        if (ChangedSinceLastLook()) return true;
+      }
+      const auto left = deadline - std::chrono::steady_clock::now();
+      if (left <= left.zero()) return false;
+      std::this_thread::sleep_for(std::min<std::chrono::steady_clock::duration>(left, kChangePoll));
+    }
+  }
+
  private:
+  // Without a connection there was no file when last looked: its appearance
+  // is the change, and connecting (never creating) sets the new baseline.
+  bool ChangedSinceLastLook() {
+    if (db_ == nullptr) return Open(false);
+    const sqlite3_int64 version = DataVersion();
+    if (version == seenVersion_) return false;
+    seenVersion_ = version;
+    return true;
+  }
+
+  // Moves only when another connection commits, not on this one's writes.
+  sqlite3_int64 DataVersion() {
+    Resetter reset(dataVersion_);
+    if (sqlite3_step(dataVersion_) != SQLITE_ROW) Fail("looking for changes");
+    return sqlite3_column_int64(dataVersion_, 0);
+  }
+
   // Connects to the store file when there is one; with "create", makes it
   // first. False when there is none and "create" is not set: a reader of a
   // store nobody has written yet sees it empty, and leaves nothing behind.
@@ -430,6 +475,8 @@ class SqliteStore final : public ConfigStore {
     addCollection_ = Prepare("INSERT INTO collections(key, grp, component) VALUES(?1, ?2, ?3)");
     readSeq_ = Prepare("SELECT next FROM sequence");
     writeSeq_ = Prepare("UPDATE sequence SET next = ?1");
+    dataVersion_ = Prepare("PRAGMA data_version");
+    seenVersion_ = DataVersion();
     FollowStoreMode();
   }
 
@@ -742,6 +789,7 @@ class SqliteStore final : public ConfigStore {
   sqlite3_stmt* addCollection_ = nullptr;
   sqlite3_stmt* readSeq_ = nullptr;
   sqlite3_stmt* writeSeq_ = nullptr;
+  sqlite3_stmt* dataVersion_ = nullptr;
   std::array<sqlite3_stmt*, 8> collectionQueries_{};  // by which of key, group, component are set
   // The collections met so far, with their statements. Within a write
   // transaction this may hold collections made in it: undoing it forgets
@@ -751,6 +799,7 @@ class SqliteStore final : public ConfigStore {
   bool seqLoaded_ = false;      // nextSeq_ was read within the open write
   bool seqDirty_ = false;       // and has been used since
   sqlite3_int64 nextSeq_ = 0;
+  sqlite3_int64 seenVersion_ = 0;  // data_version when WaitForChange last looked
 };
 
 }  // namespace

@@ -94,10 +94,11 @@ CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewMemoryStore();
 // EtcdStore.h), otherwise the path of a SQLite store.
 CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> OpenStore(const std::string& locator);
 
-// $TAVO_CONFIGSTORE_PATH (a path or an etcd locator), else $XDG_STATE_HOME/tavo/configstore.db,
-// else $HOME/.local/state/tavo/configstore.db (each of the last two only when the variable holds an
-// absolute path). Without any of them there is no default: throws ConfigStoreException with
-// kErrorNoStorePath rather than guess.
+// $TAVO_CONFIGSTORE_PATH (a path or an etcd locator), else
+// $XDG_STATE_HOME/tavo/configstore.db, else
+// $HOME/.local/state/tavo/configstore.db (each of the last two only when the
+// variable holds an absolute path). Without any of them there is no default:
+// throws ConfigStoreException with kErrorNoStorePath rather than guess.
 CONFIGSTORE_EXPORT std::string DefaultStorePath();
 
 // Makes GetStore return "store" for the whole process (null restores the

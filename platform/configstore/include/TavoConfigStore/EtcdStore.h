@@ -36,7 +36,10 @@ CONFIGSTORE_EXPORT bool IsEtcdLocator(const std::string& locator);
 // Reads a locator
 //   etcd[s]://[USER[:PASSWORD]@]HOST:PORT[,HOST:PORT...]/PREFIX
 //              [?cacert=FILE&cert=FILE&key=FILE&timeout=MS]
-// "etcds" turns TLS on. What the locator leaves out is taken from etcdctl's
+// "etcds" turns TLS on. An IPv6 HOST goes in brackets. In a user name,
+// password, prefix or file name %XX stands for a byte; an '@' after the
+// endpoints is refused, as it is most likely a password's with a bare '/'.
+// What the locator leaves out is taken, literally, from etcdctl's
 // environment variables: ETCDCTL_CACERT, ETCDCTL_CERT, ETCDCTL_KEY,
 // ETCDCTL_USER ("user" or "user:password") and ETCDCTL_PASSWORD. Throws
 // ConfigStoreException(kErrorBadLocator) naming what is wrong; the message

@@ -53,6 +53,10 @@ void CheckEndpoint(const std::string& endpoint) {
   if (colon == std::string::npos || colon == 0 || (bracketed && colon < 3)) {
     Refuse("endpoint \"" + endpoint + "\" is not HOST:PORT");
   }
+  // "fe80::1:2379" would otherwise quietly become host "fe80::1", port 2379.
+  if (!bracketed && endpoint.find(':') != colon) {
+    Refuse("endpoint \"" + endpoint + "\" is not HOST:PORT (an IPv6 address goes in [brackets])");
+  }
   const std::string port = endpoint.substr(colon + 1);
   if (port.empty() || port.size() > 5 ||
       port.find_first_not_of("0123456789") != std::string::npos || std::stoi(port) < 1 ||
@@ -61,11 +65,16 @@ void CheckEndpoint(const std::string& endpoint) {
   }
 }
 
-void SetUser(EtcdStoreOptions& options, std::string_view userInfo) {
+// "USER[:PASSWORD]", %-escaped in a locator but taken literally from the
+// environment, as etcdctl takes it.
+void SetUser(EtcdStoreOptions& options, std::string_view userInfo, bool escaped) {
+  auto take = [escaped](std::string_view text, const char* what) {
+    return escaped ? Unescape(text, what) : std::string(text);
+  };
   const std::size_t colon = userInfo.find(':');
-  options.user = Unescape(userInfo.substr(0, colon), "user name");
+  options.user = take(userInfo.substr(0, colon), "user name");
   if (colon != std::string_view::npos) {
-    options.password = Unescape(userInfo.substr(colon + 1), "password");
+    options.password = take(userInfo.substr(colon + 1), "password");
   }
   if (options.user.empty()) Refuse("empty user name");
 }
@@ -115,6 +124,11 @@ EtcdStoreOptions ParseEtcdLocator(const std::string& locator) {
   if (slash == std::string_view::npos) Refuse("no /PREFIX after the endpoints");
   std::string_view authority = rest.substr(0, slash);
   std::string_view path = rest.substr(slash + 1);
+  // Most likely a password with a bare '/': what came before it would be
+  // read, and echoed in errors, as endpoints, and the rest land in the prefix.
+  if (path.find('@') != std::string_view::npos) {
+    Refuse("'@' after the endpoints: write it as %40, and a '/' in a user name or password as %2F");
+  }
   std::string_view query;
   if (const std::size_t mark = path.find('?'); mark != std::string_view::npos) {
     query = path.substr(mark + 1);
@@ -122,7 +136,7 @@ EtcdStoreOptions ParseEtcdLocator(const std::string& locator) {
   }
 
   if (const std::size_t at = authority.rfind('@'); at != std::string_view::npos) {
-    SetUser(options, authority.substr(0, at));
+    SetUser(options, authority.substr(0, at), true);
     authority = authority.substr(at + 1);
   }
   while (true) {
@@ -139,7 +153,9 @@ EtcdStoreOptions ParseEtcdLocator(const std::string& locator) {
   SetQuery(options, query);
 
   // etcdctl's variables fill in what the locator leaves out.
-  if (options.user.empty() && !Env("ETCDCTL_USER").empty()) SetUser(options, Env("ETCDCTL_USER"));
+  if (options.user.empty() && !Env("ETCDCTL_USER").empty()) {
+    SetUser(options, Env("ETCDCTL_USER"), false);
+  }
   if (!options.user.empty() && options.password.empty()) options.password = Env("ETCDCTL_PASSWORD");
   if (options.tls) {
     if (options.caFile.empty()) options.caFile = Env("ETCDCTL_CACERT");
