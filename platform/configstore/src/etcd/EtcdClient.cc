@@ -11,28 +11,6 @@
 namespace TavoConfigStore {
 namespace {
 
-const char* StatusName(grpc::StatusCode code) {
-  static const char* const kNames[] = {"OK",
-                                       "CANCELLED",
-                                       "UNKNOWN",
-                                       "INVALID_ARGUMENT",
-                                       "DEADLINE_EXCEEDED",
-                                       "NOT_FOUND",
-                                       "ALREADY_EXISTS",
-                                       "PERMISSION_DENIED",
-                                       "RESOURCE_EXHAUSTED",
-                                       "FAILED_PRECONDITION",
-                                       "ABORTED",
-                                       "OUT_OF_RANGE",
-                                       "UNIMPLEMENTED",
-                                       "INTERNAL",
-                                       "UNAVAILABLE",
-                                       "DATA_LOSS",
-                                       "UNAUTHENTICATED"};
-  const auto index = static_cast<std::size_t>(code);
-  return index < sizeof kNames / sizeof kNames[0] ? kNames[index] : "UNKNOWN";
-}
-
 std::string ReadPem(const std::string& path, const char* what) {
   std::ifstream in(path, std::ios::binary);
   std::ostringstream text;
@@ -129,10 +107,14 @@ EtcdClient::EtcdClient(const EtcdStoreOptions& options) : options_(options) {
 
 void EtcdClient::Fail(const grpc::Status& status, const char* what) const {
   std::string message = where_ + ": " + what + ": ";
-  message += status.error_code() == grpc::StatusCode::DEADLINE_EXCEEDED
-                 ? "no member answered within " + std::to_string(options_.timeoutMs) + " ms"
-                 : status.error_message();
-  message += std::string(" (") + StatusName(status.error_code()) + ")";
+  if (status.error_code() != grpc::StatusCode::DEADLINE_EXCEEDED) {
+    message += status.error_message();
+  } else if (channel_->GetState(false) == GRPC_CHANNEL_TRANSIENT_FAILURE) {
+    message += "could not connect to any member within " + std::to_string(options_.timeoutMs) +
+               " ms (refused, unreachable, or the TLS handshake failed)";
+  } else {
+    message += "no answer within " + std::to_string(options_.timeoutMs) + " ms";
+  }
   throw ConfigStoreException(message, kErrorEtcdBase + static_cast<int>(status.error_code()));
 }
 
