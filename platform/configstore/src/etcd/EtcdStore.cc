@@ -623,20 +623,23 @@ class EtcdStore final : public ConfigStore {
   }
 
   void Apply() {
-    std::vector<std::string> touched;
-    for (const auto& [name, pending] : txn_.collections) {
-      if (pending.Touched()) touched.push_back(name);
-    }
-    if (touched.empty()) return;
     for (int attempt = 1;; ++attempt) {
       Pointers now = ReadPointers(std::string(), 0);
+      // Deleting from a collection that does not exist changes nothing.
+      std::vector<std::string> touched;
+      for (const auto& [name, pending] : txn_.collections) {
+        if (!pending.puts.empty() || (pending.Touched() && Find(now, name))) {
+          touched.push_back(name);
+        }
+      }
+      if (touched.empty()) return;
       bool readAny = false;
       for (const std::string& name : touched) {
         auto seen = observed_.find(name);
         if (seen == observed_.end()) continue;
         readAny = true;
-        auto it = now.byCollection.find(name);
-        if (seen->second != (it == now.byCollection.end() ? 0 : it->second.version)) Conflict(name);
+        const Current* current = Find(now, name);
+        if (seen->second != (current ? current->version : 0)) Conflict(name);
       }
       const std::string token = NewId();
       if (FitsInPlace(touched, now) ? CommitInPlace(touched, now, token)
