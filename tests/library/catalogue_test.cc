@@ -53,7 +53,8 @@ TEST_P(CatalogueTest, RoundTripsEveryByteAndASecondConnectionSeesIt) {
   EXPECT_EQ(KarstLib::ListPolicyInfo(), (std::vector{Policy("after", "p")}));
 }
 
-INSTANTIATE_TEST_SUITE_P(Stores, CatalogueTest, ::testing::Values("sqlite", "etcd"));
+INSTANTIATE_TEST_SUITE_P(Stores, CatalogueTest, ::testing::Values("sqlite", "etcd"),
+                         [](const auto& info) { return info.param; });
 
 }  // namespace
 }  // namespace karst_test

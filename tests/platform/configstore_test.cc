@@ -316,7 +316,8 @@ TEST_P(StoreConformance, ObjectsHandedOutAreCopies) {
   EXPECT_TRUE(sub->GetValue("n", &n) && n == 3);
 }
 
-INSTANTIATE_TEST_SUITE_P(Backends, StoreConformance, ::testing::Values("memory", "sqlite", "etcd"));
+INSTANTIATE_TEST_SUITE_P(Backends, StoreConformance, ::testing::Values("memory", "sqlite", "etcd"),
+                         [](const auto& info) { return info.param; });
 
 std::shared_ptr<ConfigStoreObject> Sample(const std::string& instance, int subs = 2) {
   auto o = Obj("pool", "storage", "tavo", instance);
