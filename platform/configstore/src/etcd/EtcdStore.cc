@@ -92,6 +92,11 @@ struct Pointers {
   std::map<std::string, Current> byCollection;
 };
 
+const Current* Find(const Pointers& pointers, const std::string& collection) {
+  auto it = pointers.byCollection.find(collection);
+  return it == pointers.byCollection.end() ? nullptr : &it->second;
+}
+
 // One stored object of a generation, its bytes still in the reply.
 struct Entry {
   std::string instance;
@@ -258,23 +263,19 @@ class EtcdStore final : public ConfigStore {
   std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
     std::lock_guard<std::mutex> lock(mu_);
     const std::string collection = etcdlayout::CollectionOf(id);
-    if (depth_ > 0) {
-      auto it = txn_.collections.find(collection);
-      if (it != txn_.collections.end()) {
-        const Pending& pending = it->second;
-        auto put = pending.puts.find(id.InstanceId());
-        if (put != pending.puts.end()) return DecodePut(id, put->second);
-        if (pending.cleared || pending.deleted.count(id.InstanceId())) return nullptr;
-      }
+    if (const Pending* pending = PendingOf(collection)) {
+      auto put = pending->puts.find(id.InstanceId());
+      if (put != pending->puts.end()) return DecodePut(id, put->second);
+      if (pending->cleared || pending->deleted.count(id.InstanceId())) return nullptr;
     }
     return Reading([&]() -> std::shared_ptr<ConfigStoreObject> {
       const Pointers pointers = ReadPointers(collection, 0);
-      auto it = pointers.byCollection.find(collection);
-      Observe(collection, it == pointers.byCollection.end() ? Current() : it->second);
-      if (it == pointers.byCollection.end()) return nullptr;
+      const Current* current = Find(pointers, collection);
+      Observe(collection, current ? *current : Current());
+      if (!current) return nullptr;
       std::vector<Entry> entries;
       etcdserverpb::RangeResponse reply;
-      ReadGeneration(it->second.gen, &id.InstanceId(), pointers.revision, &reply, &entries);
+      ReadGeneration(current->gen, &id.InstanceId(), pointers.revision, &reply, &entries);
       if (entries.empty()) return nullptr;
       return Decode(id, entries.front(), nullptr);
     });
@@ -282,8 +283,9 @@ class EtcdStore final : public ConfigStore {
 
   void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
                  std::int32_t& /*flags*/) override {
-    if (!object)
+    if (!object) {
       throw ConfigStoreException(client_.Where() + ": SetObject of null", kErrorNullArgument);
+    }
     DamagedObject::RefuseWrite(*object);
     Put put;
     codec::EncodeObject(*object, &put.body);
@@ -305,14 +307,7 @@ class EtcdStore final : public ConfigStore {
     InTransaction([&] {
       const ConfigStoreObjectId& want = filter->Id();
       const Pointers pointers = Reading([&] { return ReadPointers(ExactCollection(want), 0); });
-      std::set<std::string> names;
-      for (const auto& [name, current] : pointers.byCollection) {
-        if (CollectionMatches(*filter, name)) names.insert(name);
-      }
-      for (const auto& [name, pending] : txn_.collections) {
-        if (CollectionMatches(*filter, name)) names.insert(name);
-      }
-      for (const std::string& name : names) {
+      for (const std::string& name : Matching(*filter, pointers)) {
         Pending& pending = txn_.collections[name];
         if (want.InstanceId().empty()) {
           pending.cleared = true;
@@ -526,6 +521,28 @@ class EtcdStore final : public ConfigStore {
         std::move(copy), reinterpret_cast<const unsigned char*>(put.body.data()), put.body.size());
   }
 
+  // What the open transaction did to a collection, if anything.
+  const Pending* PendingOf(const std::string& collection) const {
+    if (depth_ == 0) return nullptr;
+    auto it = txn_.collections.find(collection);
+    return it == txn_.collections.end() ? nullptr : &it->second;
+  }
+
+  // The collections a filter names: stored ones, and those the open
+  // transaction has written.
+  std::set<std::string> Matching(const FilterSpecObject& filter, const Pointers& pointers) const {
+    std::set<std::string> names;
+    for (const auto& entry : pointers.byCollection) {
+      if (CollectionMatches(filter, entry.first)) names.insert(entry.first);
+    }
+    if (depth_ > 0) {
+      for (const auto& entry : txn_.collections) {
+        if (CollectionMatches(filter, entry.first)) names.insert(entry.first);
+      }
+    }
+    return names;
+  }
+
   void Observe(const std::string& collection, const Current& current) {
     if (depth_ > 0) observed_.emplace(collection, current.version);
   }
@@ -541,29 +558,16 @@ class EtcdStore final : public ConfigStore {
     };
     std::vector<Listed> listed;
     codec::BodyArena arena;
-    std::set<std::string> names;
-    for (const auto& [name, current] : pointers.byCollection) {
-      if (CollectionMatches(filter, name)) names.insert(name);
-    }
-    if (depth_ > 0) {
-      for (const auto& [name, pending] : txn_.collections) {
-        if (CollectionMatches(filter, name)) names.insert(name);
-      }
-    }
-    for (const std::string& name : names) {
+    for (const std::string& name : Matching(filter, pointers)) {
       ConfigStoreObjectId collection("", "", "");
       etcdlayout::ParseCollection(name, &collection);
-      auto current = pointers.byCollection.find(name);
-      Observe(name, current == pointers.byCollection.end() ? Current() : current->second);
-      const Pending* pending = nullptr;
-      if (depth_ > 0) {
-        auto it = txn_.collections.find(name);
-        if (it != txn_.collections.end()) pending = &it->second;
-      }
-      if (current != pointers.byCollection.end() && !(pending && pending->cleared)) {
+      const Current* current = Find(pointers, name);
+      Observe(name, current ? *current : Current());
+      const Pending* pending = PendingOf(name);
+      if (current && !(pending && pending->cleared)) {
         etcdserverpb::RangeResponse reply;
         std::vector<Entry> entries;
-        ReadGeneration(current->second.gen, instance, pointers.revision, &reply, &entries);
+        ReadGeneration(current->gen, instance, pointers.revision, &reply, &entries);
         for (const Entry& entry : entries) {
           if (pending &&
               (pending->deleted.count(entry.instance) || pending->puts.count(entry.instance))) {
@@ -650,11 +654,6 @@ class EtcdStore final : public ConfigStore {
       // what it writes can simply be applied to what is there now.
       if (readAny || attempt == kCommitAttempts) Conflict(touched.front());
     }
-  }
-
-  static const Current* Find(const Pointers& now, const std::string& name) {
-    auto it = now.byCollection.find(name);
-    return it == now.byCollection.end() ? nullptr : &it->second;
   }
 
   bool FitsInPlace(const std::vector<std::string>& touched, const Pointers& now) const {
