@@ -728,23 +728,34 @@ class EtcdStore final : public ConfigStore {
   // collection it writes ("witness", "" when it writes none) holds this
   // commit's token exactly when it did.
   bool Switch(const TxnRequest& txn, const std::string& witness, const std::string& token) {
-    auto mine = [&] {
-      if (witness.empty()) return false;
-      const Current* current = Find(ReadPointers(witness, 0), witness);
-      return current != nullptr && current->token == token;
-    };
     try {
-      return client_.Txn(txn, true).succeeded() || mine();
+      return client_.Txn(txn, true).succeeded() || Holds(witness, token);
     } catch (const ConfigStoreException&) {
       bool committed = false;
       try {
-        committed = mine();
+        committed = Holds(witness, token);
       } catch (const ConfigStoreException&) {
         // Unknown either way: report the first failure.
       }
       if (committed) return true;
       throw;
     }
+  }
+
+  bool Holds(const std::string& witness, const std::string& token) {
+    if (witness.empty()) return false;
+    const Current* current = Find(ReadPointers(witness, 0), witness);
+    return current != nullptr && current->token == token;
+  }
+
+  // The writer of generation "gen" is alive: its lease has not run out, and
+  // the generation has not been made current.
+  void AddWriterAlive(TxnRequest* txn, const std::string& gen) const {
+    Compare* alive = txn->add_compare();
+    alive->set_key(keys_.Writers() + gen);
+    alive->set_target(Compare::VERSION);
+    alive->set_result(Compare::GREATER);
+    alive->set_version(0);
   }
 
   // Writes the puts of a batch once it is full (or "force").
@@ -785,18 +796,27 @@ class EtcdStore final : public ConfigStore {
       AddPut(&ops, keys_.Registered() + fresh[name], name);
     }
     client_.Txn(TxnOf(&ops), true);
+    // Removes the new generations, unless a switch sent earlier took effect
+    // after all (a request may be applied after its sender gave up on it).
+    // The switch removes the writer keys, so it is compared on them; false
+    // when they are gone.
     auto abandon = [&] {
-      std::vector<RequestOp> undo;
+      TxnRequest undo;
+      std::vector<RequestOp> deletes;
       for (const auto& [name, gen] : fresh) {
-        AddDeletePrefix(&undo, keys_.Generation(gen));
-        AddDelete(&undo, keys_.Registered() + gen);
-        AddDelete(&undo, keys_.Writers() + gen);
+        AddWriterAlive(&undo, gen);
+        AddDeletePrefix(&deletes, keys_.Generation(gen));
+        AddDelete(&deletes, keys_.Registered() + gen);
+        AddDelete(&deletes, keys_.Writers() + gen);
       }
+      for (RequestOp& op : deletes) *undo.add_success() = std::move(op);
       try {
-        client_.Txn(TxnOf(&undo), true);
+        const bool removed = client_.Txn(undo, true).succeeded();
         client_.LeaseRevoke(lease);
+        return removed;
       } catch (const ConfigStoreException&) {
         // The lease runs out and a later writer removes what is left.
+        return true;
       }
     };
 
@@ -851,11 +871,7 @@ class EtcdStore final : public ConfigStore {
       const Current* current = Find(now, name);
       const std::string& gen = fresh[name];
       AddCompareVersion(&txn, keys_.Pointer(name), current ? *current : Current());
-      Compare* alive = txn.add_compare();
-      alive->set_key(keys_.Writers() + gen);
-      alive->set_target(Compare::VERSION);
-      alive->set_result(Compare::GREATER);
-      alive->set_version(0);
+      AddWriterAlive(&txn, gen);
       if (empty[name]) {
         AddDelete(&ops, keys_.Pointer(name));
         AddDeletePrefix(&ops, keys_.Generation(gen));
@@ -874,8 +890,7 @@ class EtcdStore final : public ConfigStore {
     for (RequestOp& op : ops) *txn.add_success() = std::move(op);
     ops.clear();
     if (!Switch(txn, anyWritten, token)) {
-      abandon();
-      return false;
+      return !abandon() && Holds(anyWritten, token);
     }
     try {
       client_.LeaseRevoke(lease);
