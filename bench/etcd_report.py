@@ -1,6 +1,7 @@
 #!/usr/bin/env python3
-"""Turns etcd_transport_bench's JSON output into the table of gRPC against
-libcurl.
+"""Turns the etcd benchmarks' JSON output into tables: etcd_store_bench's
+into the library on the etcd store against raw etcd, each row a ratio with
+its target, and etcd_transport_bench's into gRPC against libcurl.
 
 Each figure is the median over all repetitions found, pooled over the files
 given (several runs of bench/run --etcd), with the lowest and highest
@@ -19,6 +20,19 @@ from report import print_table
 SCALE = {"ns": 1e-6, "us": 1e-3, "ms": 1.0, "s": 1e3}
 OPERATIONS = (("list, one reply", "BM_ListOne"), ("list, pages of 1,000", "BM_ListPaged"),
               ("write, 100 txns of 100 puts", "BM_Write"))
+# The store's operations, each against what the same bytes cost through
+# etcd's own calls: (operation, store benchmark, raw benchmark, raw work).
+STORE_TARGET = 1.5
+STORE_OPERATIONS = (
+    ("replace: AddPolicyInfo", "BM_StoreReplace", "BM_RawReplace", "txns of 100 puts"),
+    ("list: ListPolicyInfo", "BM_StoreList", "BM_RawList", "one Range"),
+    ("GetCorraPolicyBlobByName", "BM_StoreBlobByName", "BM_RawBlobByName", "one-key Range"),
+    ("GetCorraPolicyBlobById", "BM_StoreBlobById", "BM_RawList", "one Range"),
+    ("GetDefaultPolicyBlob", "BM_StoreDefaultBlob", "BM_RawDefaultBlob",
+     "one-key Range + one Range"),
+    ("GetDbHash", "BM_StoreGetDbHash", "BM_RawListBoth", "two Ranges"),
+)
+STORE_SIZES = (1000, 10000)
 
 
 def load(paths):
@@ -45,19 +59,52 @@ def values(runs, name, field):
     return [b[field] * scale for b in rows if field in b]
 
 
-def spread(vs):
+def spread(vs, digits=0):
     """The median, and the text "median (min-max, ±half the range in % of the median)"."""
     m = statistics.median(vs)
     half = (max(vs) - min(vs)) / 2 / m * 100 if m else 0
-    return m, f"{m:.0f} ({min(vs):.0f}-{max(vs):.0f}, ±{half:.0f}%)"
+    return m, f"{m:.{digits}f} ({min(vs):.{digits}f}-{max(vs):.{digits}f}, ±{half:.0f}%)"
 
 
-def main():
-    args = sys.argv[1:]
-    markdown = bool(args) and args[-1] == "markdown"
-    if markdown:
-        args = args[:-1]
-    context, runs = load(args)
+def digits_for(vs):
+    """Decimals enough for three significant digits of the median."""
+    m = statistics.median(vs)
+    return 0 if m >= 100 else 1 if m >= 10 else 2 if m >= 1 else 3
+
+
+def store_table(runs):
+    """Rows of the store against raw etcd, with the notes below them."""
+    headers = ("operation", "N", "store ms: median (min-max)", "raw ms: median (min-max)",
+               "raw work", "ratio", "client CPU ratio", "etcd CPU ms store / raw",
+               f"target <= {STORE_TARGET}x")
+    rows = []
+    for what, mine, base, work in STORE_OPERATIONS:
+        for n in STORE_SIZES:
+            store = values(runs, f"{mine}/{n}", "real_time")
+            raw = values(runs, f"{base}/{n}", "real_time")
+            if not store or not raw:
+                rows.append((what, f"{n:,}", "NOT RUN" if not store else "",
+                             "NOT RUN" if not raw else "", work, "", "", "", "NOT RUN"))
+                continue
+            d = digits_for(raw)
+            ms, store_text = spread(store, d)
+            mr, raw_text = spread(raw, d)
+            ratio = ms / mr
+            cpu = [statistics.median(values(runs, f"{x}/{n}", "cpu_time")) for x in (mine, base)]
+            etcd = [values(runs, f"{x}/{n}", "etcd_cpu_ms") for x in (mine, base)]
+            etcd_text = (f"{statistics.median(etcd[0]):.{d}f} / {statistics.median(etcd[1]):.{d}f}"
+                         if etcd[0] and etcd[1] else "")
+            rows.append((what, f"{n:,}", store_text, raw_text, work, f"{ratio:.2f}",
+                         f"{cpu[0] / cpu[1]:.2f}", etcd_text,
+                         "MET" if ratio <= STORE_TARGET else "MISSED"))
+    reps = sorted({len(values(runs, name, "real_time")) for name in runs
+                   if name.startswith(("BM_Store", "BM_Raw"))})
+    notes = [f"repetitions per figure: {', '.join(map(str, reps))}; ratio = median over median"]
+    return headers, rows, notes
+
+
+def transport_table(runs):
+    """Rows of gRPC against libcurl, with the notes below them."""
     headers = ("operation, 10,000 x 1,400 B", "transport", "elapsed ms: median (min-max)",
                "client CPU ms", "etcd CPU ms", "reps", "curl / gRPC")
     rows = []
@@ -107,8 +154,26 @@ def main():
     if reply:
         notes.append(f"JSON reply of the one-reply listing: {reply[0] / 1e6:.1f} MB")
 
-    print_table(headers, rows, notes, context,
-                ("etcd", "grpc", "libcurl", "num_cpus", "load_avg"), markdown)
+    return headers, rows, notes
+
+
+def main():
+    args = sys.argv[1:]
+    markdown = bool(args) and args[-1] == "markdown"
+    if markdown:
+        args = args[:-1]
+    context, runs = load(args)
+    tables = []
+    if any(name.startswith("BM_Store") for name in runs):
+        tables.append(store_table(runs))
+    if any(name.startswith(("BM_ListOne", "BM_Write", "BM_PeakRss")) for name in runs):
+        tables.append(transport_table(runs))
+    for i, (headers, rows, notes) in enumerate(tables):
+        if i:
+            print()
+        last = i == len(tables) - 1
+        print_table(headers, rows, notes, context if last else {},
+                    ("etcd", "grpc", "libcurl", "num_cpus", "load_avg"), markdown)
 
 
 if __name__ == "__main__":

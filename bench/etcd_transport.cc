@@ -10,9 +10,6 @@
 
 #include <benchmark/benchmark.h>
 #include <curl/curl.h>
-#include <grpcpp/grpcpp.h>
-#include <malloc.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cstdint>
@@ -29,34 +26,17 @@
 #include <utility>
 #include <vector>
 
+#include "EtcdBench.h"
 #include "PeakRss.h"
-#include "etcd/etcdserver/etcdserverpb/rpc.grpc.pb.h"
 
 namespace karst_bench {
 namespace {
 
-using Records = std::vector<std::pair<std::string, std::string>>;
-
 constexpr std::size_t kRecords = 10000;
 constexpr std::size_t kValueBytes = 1400;
 constexpr std::int64_t kPage = 1000;
-constexpr std::size_t kBatch = 100;
 const std::string kListPrefix = "/karst-bench/list/";
 const std::string kWritePrefix = "/karst-bench/write/";
-
-std::string Endpoint() {
-  const char* endpoint = std::getenv("KARST_BENCH_ETCD");
-  if (endpoint == nullptr || *endpoint == '\0') {
-    throw std::runtime_error("KARST_BENCH_ETCD (HOST:PORT of an etcd) is not set");
-  }
-  return endpoint;
-}
-
-// The end of the range that holds every key starting with prefix.
-std::string PrefixEnd(std::string prefix) {
-  ++prefix.back();
-  return prefix;
-}
 
 // Keys in etcd's order (zero-padded), values of random bytes as a stored
 // policy has; the same for every call.
@@ -149,98 +129,7 @@ std::string Unbase64(const std::string& in) {
   return out;
 }
 
-// ---- The two transports -----------------------------------------------------
-
-struct Page {
-  std::int64_t revision = 0;
-  bool more = false;
-};
-
-class Transport {
- public:
-  virtual ~Transport() = default;
-  // The keys in [key, end) at revision (0: the latest), at most limit of
-  // them (0: all), appended to out.
-  virtual Page Range(const std::string& key, const std::string& end, std::int64_t revision,
-                     std::int64_t limit, Records* out) = 0;
-  // One transaction putting records[begin, end).
-  virtual void Put(const Records& records, std::size_t begin, std::size_t end) = 0;
-  // Connections opened so far, where the transport can tell: keep-alive
-  // should hold this at 1.
-  virtual long Connections() const { return -1; }
-};
-
-class GrpcTransport : public Transport {
- public:
-  explicit GrpcTransport(const std::string& endpoint) {
-    grpc::ChannelArguments args;
-    // The listing in one reply is about 14 MB; gRPC's default limit is 4 MB.
-    args.SetMaxReceiveMessageSize(-1);
-    channel_ = grpc::CreateCustomChannel(endpoint, grpc::InsecureChannelCredentials(), args);
-    kv_ = etcdserverpb::KV::NewStub(channel_);
-  }
-
-  Page Range(const std::string& key, const std::string& end, std::int64_t revision,
-             std::int64_t limit, Records* out) override {
-    etcdserverpb::RangeRequest request;
-    request.set_key(key);
-    request.set_range_end(end);
-    request.set_revision(revision);
-    request.set_limit(limit);
-    etcdserverpb::RangeResponse response;
-    grpc::ClientContext context;
-    Check(kv_->Range(&context, request, &response), "Range");
-    out->reserve(out->size() + static_cast<std::size_t>(response.kvs_size()));
-    for (mvccpb::KeyValue& kv : *response.mutable_kvs()) {
-      out->emplace_back(std::move(*kv.mutable_key()), std::move(*kv.mutable_value()));
-    }
-    return {response.header().revision(), response.more()};
-  }
-
-  void Put(const Records& records, std::size_t begin, std::size_t end) override {
-    etcdserverpb::TxnRequest request;
-    for (std::size_t i = begin; i < end; ++i) {
-      etcdserverpb::PutRequest* put = request.add_success()->mutable_request_put();
-      put->set_key(records[i].first);
-      put->set_value(records[i].second);
-    }
-    etcdserverpb::TxnResponse response;
-    grpc::ClientContext context;
-    Check(kv_->Txn(&context, request, &response), "Txn");
-  }
-
-  // Drops the history older than the latest revision, so that repeated
-  // writes do not grow the database from one repetition to the next.
-  void CompactAll() {
-    Records none;
-    const Page page = Range(kListPrefix, PrefixEnd(kListPrefix), 0, 1, &none);
-    etcdserverpb::CompactionRequest request;
-    request.set_revision(page.revision);
-    request.set_physical(true);
-    etcdserverpb::CompactionResponse response;
-    grpc::ClientContext context;
-    Check(kv_->Compact(&context, request, &response), "Compact");
-  }
-
-  void DeletePrefix(const std::string& prefix) {
-    etcdserverpb::DeleteRangeRequest request;
-    request.set_key(prefix);
-    request.set_range_end(PrefixEnd(prefix));
-    etcdserverpb::DeleteRangeResponse response;
-    grpc::ClientContext context;
-    Check(kv_->DeleteRange(&context, request, &response), "DeleteRange");
-  }
-
- private:
-  static void Check(const grpc::Status& status, const char* call) {
-    if (!status.ok()) {
-      throw std::runtime_error(std::string("gRPC ") + call + ": " + status.error_message());
-    }
-  }
-
-  std::shared_ptr<grpc::Channel> channel_;
-  std::unique_ptr<etcdserverpb::KV::Stub> kv_;
-};
+// ---- libcurl against the JSON gateway ----------------------------------------
 
 class CurlTransport : public Transport {
  public:
@@ -340,12 +229,6 @@ class CurlTransport : public Transport {
 
 // ---- The operations measured ------------------------------------------------
 
-Records ListOne(Transport& t, const std::string& prefix) {
-  Records out;
-  t.Range(prefix, PrefixEnd(prefix), 0, 0, &out);
-  return out;
-}
-
 // Pages at the revision of the first, so the listing is one consistent view.
 Records ListPaged(Transport& t, const std::string& prefix) {
   Records out;
@@ -356,86 +239,21 @@ Records ListPaged(Transport& t, const std::string& prefix) {
   return out;
 }
 
-void WriteBatches(Transport& t, const Records& records) {
-  for (std::size_t i = 0; i < records.size(); i += kBatch) {
-    t.Put(records, i, std::min(i + kBatch, records.size()));
-  }
-}
-
-GrpcTransport& Admin() {
-  static GrpcTransport admin(Endpoint());
-  return admin;
-}
-
 // The listed records, written once a process.
 void FillListPrefix() {
   static const bool filled = [] {
-    Admin().DeletePrefix(kListPrefix);
-    WriteBatches(Admin(), ListRecords());
-    Admin().CompactAll();
+    EtcdAdmin().DeletePrefix(kListPrefix);
+    WriteBatches(EtcdAdmin(), ListRecords());
+    EtcdAdmin().CompactAll();
     return true;
   }();
   (void)filled;
 }
 
-// The server's version, for the report.
-std::string EtcdVersion() {
-  try {
-    auto maintenance = etcdserverpb::Maintenance::NewStub(
-        grpc::CreateChannel(Endpoint(), grpc::InsecureChannelCredentials()));
-    etcdserverpb::StatusResponse response;
-    grpc::ClientContext context;
-    const grpc::Status status =
-        maintenance->Status(&context, etcdserverpb::StatusRequest(), &response);
-    return status.ok() ? response.version() : "unreachable: " + status.error_message();
-  } catch (const std::exception& e) {
-    return e.what();
-  }
-}
-
 std::unique_ptr<Transport> NewTransport(const std::string& kind) {
-  if (kind == "grpc") return std::make_unique<GrpcTransport>(Endpoint());
-  return std::make_unique<CurlTransport>(Endpoint());
+  if (kind == "grpc") return std::make_unique<GrpcTransport>(EtcdEndpoint());
+  return std::make_unique<CurlTransport>(EtcdEndpoint());
 }
-
-// CPU time the etcd server has used so far, in milliseconds, or -1.
-double EtcdCpuMs() {
-  const char* pid = std::getenv("KARST_BENCH_ETCD_PID");
-  if (pid == nullptr || *pid == '\0') return -1;
-  std::ifstream stat(std::string("/proc/") + pid + "/stat");
-  std::string text((std::istreambuf_iterator<char>(stat)), std::istreambuf_iterator<char>());
-  // Fields after the command name, which is in parentheses: utime and stime
-  // are the 12th and 13th of them.
-  const std::size_t close = text.rfind(')');
-  if (close == std::string::npos) return -1;
-  std::vector<std::string> fields;
-  std::size_t at = close + 2;
-  for (std::size_t space; (space = text.find(' ', at)) != std::string::npos; at = space + 1) {
-    fields.push_back(text.substr(at, space - at));
-  }
-  if (fields.size() < 13) return -1;
-  const double ticks = std::stod(fields[11]) + std::stod(fields[12]);
-  return ticks * 1000.0 / static_cast<double>(sysconf(_SC_CLK_TCK));
-}
-
-// The server's CPU time per iteration, as a counter.
-class EtcdCpu {
- public:
-  explicit EtcdCpu(benchmark::State& state) : state_(state), start_(EtcdCpuMs()) {}
-  ~EtcdCpu() {
-    const double now = EtcdCpuMs();
-    if (start_ >= 0 && now >= 0) {
-      state_.counters["etcd_cpu_ms"] =
-          benchmark::Counter(now - start_, benchmark::Counter::kAvgIterations);
-    }
-  }
-  EtcdCpu(const EtcdCpu&) = delete;
-  EtcdCpu& operator=(const EtcdCpu&) = delete;
-
- private:
-  benchmark::State& state_;
-  double start_;
-};
 
 void SetSizes(benchmark::State& state) {
   state.SetItemsProcessed(static_cast<std::int64_t>(state.iterations() * kRecords));
@@ -469,7 +287,7 @@ void BM_List(benchmark::State& state, const std::string& kind, ListFn list) {
 void BM_CurlListTransferOnly(benchmark::State& state) {
   try {
     FillListPrefix();
-    CurlTransport curl(Endpoint());
+    CurlTransport curl(EtcdEndpoint());
     const std::string body =
         nlohmann::json{{"key", Base64(kListPrefix)}, {"range_end", Base64(PrefixEnd(kListPrefix))}}
             .dump();
@@ -486,9 +304,9 @@ void BM_CurlListTransferOnly(benchmark::State& state) {
 void BM_Write(benchmark::State& state, const std::string& kind) {
   try {
     auto transport = NewTransport(kind);
-    Admin().DeletePrefix(kWritePrefix);
+    EtcdAdmin().DeletePrefix(kWritePrefix);
     WriteBatches(*transport, WriteRecords());
-    if (ListOne(Admin(), kWritePrefix) != WriteRecords()) {
+    if (ListOne(EtcdAdmin(), kWritePrefix) != WriteRecords()) {
       state.SkipWithError("the records read back differ from those written");
       return;
     }
@@ -498,7 +316,7 @@ void BM_Write(benchmark::State& state, const std::string& kind) {
     }
     SetSizes(state);
     state.counters["connections"] = static_cast<double>(transport->Connections());
-    Admin().CompactAll();
+    EtcdAdmin().CompactAll();
   } catch (const std::exception& e) {
     state.SkipWithError(e.what());
   }
@@ -588,7 +406,7 @@ int main(int argc, char** argv) {
   }
   // Freed memory stays with the process, as in karst_bench: otherwise every
   // listing faults its pages in again, and on a VM that is most of the noise.
-  if (mallopt(M_TRIM_THRESHOLD, 1 << 30) != 1 || mallopt(M_MMAP_THRESHOLD, 32 << 20) != 1) {
+  if (!karst_bench::KeepFreedMemory()) {
     std::fprintf(stderr, "mallopt failed\n");
     return 1;
   }

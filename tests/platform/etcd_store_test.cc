@@ -178,6 +178,50 @@ TEST(EtcdStoreTest, RacingWritersConflictOnlyWhenWhatTheyReadChanged) {
   EXPECT_EQ(Dump(*other), std::vector<std::string>{"b=mine"});
 }
 
+// A reader asks for the generation it read last together with the pointer.
+// Once another writer has moved the collection to a new generation, or
+// removed it, the reader's look-ups and listings show that, not what it read
+// before.
+TEST(EtcdStoreTest, ReadersFollowAnotherWritersNewGeneration) {
+  const std::string locator = SharedCluster().Locator("follow");
+  auto reader = OpenStore(locator);
+  auto writer = OpenStore(locator);
+  auto value = [&](const std::string& instance) {
+    auto o = reader->GetObject(ConfigStoreObjectId("k", "g", "c", instance));
+    std::string v = "absent";
+    if (o) o->GetValue("v", &v);
+    return v;
+  };
+  auto listing = [&] {
+    std::vector<std::string> out;
+    auto filter = std::make_shared<FilterSpecObject>(ConfigStoreObjectId("k", "g", "c"));
+    for (const auto& o : reader->GetObjects(filter)) {
+      std::string v;
+      o->GetValue("v", &v);
+      out.push_back(o->Id().InstanceId() + "=" + v);
+    }
+    return out;
+  };
+  Set(*writer, Obj("a", "1"));
+  EXPECT_EQ(value("a"), "1");
+  EXPECT_EQ(listing(), std::vector<std::string>{"a=1"});
+
+  writer->BeginTransaction();
+  Clear(*writer);
+  Set(*writer, Obj("b", "2"));
+  writer->CommitTransaction();
+  EXPECT_EQ(value("a"), "absent");
+  EXPECT_EQ(value("b"), "2");
+  EXPECT_EQ(listing(), std::vector<std::string>{"b=2"});
+
+  Clear(*writer);
+  EXPECT_EQ(value("b"), "absent");
+  EXPECT_THAT(listing(), ::testing::IsEmpty());
+  Set(*writer, Obj("c", "3"));
+  EXPECT_EQ(listing(), std::vector<std::string>{"c=3"});
+  EXPECT_EQ(value("c"), "3");
+}
+
 // A writer that dies mid-replace leaves a generation nobody points at; once
 // its lease is gone the next writer removes it, and readers never saw it.
 TEST(EtcdStoreTest, ADeadWritersGenerationIsRemovedByTheNextWriter) {

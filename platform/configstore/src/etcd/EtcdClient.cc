@@ -3,6 +3,7 @@
 #include <netdb.h>
 #include <sys/socket.h>
 
+#include <algorithm>
 #include <fstream>
 #include <sstream>
 #include <thread>
@@ -191,7 +192,11 @@ etcdserverpb::TxnResponse EtcdClient::Txn(const etcdserverpb::TxnRequest& reques
   etcdserverpb::TxnResponse response;
   const grpc::Status status = Invoke(
       [&](grpc::ClientContext* context) { return kv_->Txn(context, request, &response); }, retry);
-  if (!status.ok()) Fail(status, "write");
+  if (!status.ok()) {
+    const bool reads = std::all_of(request.success().begin(), request.success().end(),
+                                   [](const auto& op) { return op.has_request_range(); });
+    Fail(status, reads && request.compare().empty() ? "read" : "write");
+  }
   return response;
 }
 

@@ -269,13 +269,11 @@ class EtcdStore final : public ConfigStore {
       if (pending->cleared || pending->deleted.count(id.InstanceId())) return nullptr;
     }
     return Reading([&]() -> std::shared_ptr<ConfigStoreObject> {
-      const Pointers pointers = ReadPointers(collection, 0);
-      const Current* current = Find(pointers, collection);
-      Observe(collection, current ? *current : Current());
-      if (!current) return nullptr;
       std::vector<Entry> entries;
       etcdserverpb::RangeResponse reply;
-      ReadGeneration(current->gen, &id.InstanceId(), pointers.revision, &reply, &entries);
+      const Pointers pointers = ReadCollection(collection, &id.InstanceId(), &reply, &entries);
+      const Current* current = Find(pointers, collection);
+      Observe(collection, current ? *current : Current());
       if (entries.empty()) return nullptr;
       return Decode(id, entries.front(), nullptr);
     });
@@ -408,6 +406,13 @@ class EtcdStore final : public ConfigStore {
 
   // The pointer of "collection", or of every collection when it is "".
   Pointers ReadPointers(const std::string& collection, std::int64_t revision) {
+    RangeRequest request = PointersRequest(collection);
+    request.set_revision(revision);
+    const etcdserverpb::RangeResponse reply = client_.Range(request);
+    return PointersOf(reply, reply.header().revision());
+  }
+
+  RangeRequest PointersRequest(const std::string& collection) const {
     RangeRequest request;
     if (collection.empty()) {
       request.set_key(keys_.Pointers());
@@ -415,10 +420,12 @@ class EtcdStore final : public ConfigStore {
     } else {
       request.set_key(keys_.Pointer(collection));
     }
-    request.set_revision(revision);
-    const etcdserverpb::RangeResponse reply = client_.Range(request);
+    return request;
+  }
+
+  Pointers PointersOf(const etcdserverpb::RangeResponse& reply, std::int64_t revision) const {
     Pointers pointers;
-    pointers.revision = reply.header().revision();
+    pointers.revision = revision;
     for (const auto& kv : reply.kvs()) {
       Current current;
       current.gen = GenerationOf(kv.value());
@@ -429,20 +436,70 @@ class EtcdStore final : public ConfigStore {
     return pointers;
   }
 
+  // The pointer of one collection and, when it has one, the objects of its
+  // generation (or its one object "instance"), at one revision. The
+  // generation the collection pointed at last time is asked for with the
+  // pointer, in one request; a second is needed only when a commit has
+  // moved the pointer since.
+  Pointers ReadCollection(const std::string& collection, const std::string* instance,
+                          etcdserverpb::RangeResponse* reply, std::vector<Entry>* entries) {
+    auto last = lastGen_.find(collection);
+    Pointers pointers;
+    if (last == lastGen_.end()) {
+      pointers = ReadPointers(collection, 0);
+    } else {
+      TxnRequest txn;
+      *txn.add_success()->mutable_request_range() = PointersRequest(collection);
+      *txn.add_success()->mutable_request_range() = GenerationRequest(last->second, instance);
+      etcdserverpb::TxnResponse both = client_.Txn(txn, true);
+      if (both.responses_size() != 2) {
+        client_.Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unexpected reply"), "read");
+      }
+      pointers = PointersOf(both.responses(0).response_range(), both.header().revision());
+      const Current* current = Find(pointers, collection);
+      if (current && current->gen == last->second) {
+        reply->Swap(both.mutable_responses(1)->mutable_response_range());
+        ParseGeneration(last->second, *reply, entries);
+        return pointers;
+      }
+    }
+    const Current* current = Find(pointers, collection);
+    if (!current) {
+      lastGen_.erase(collection);
+    } else {
+      lastGen_[collection] = current->gen;
+      ReadGeneration(current->gen, instance, pointers.revision, reply, entries);
+    }
+    return pointers;
+  }
+
+  RangeRequest GenerationRequest(const std::string& gen, const std::string* instance) const {
+    RangeRequest request;
+    request.set_key(instance ? keys_.Object(gen, *instance) : keys_.Generation(gen));
+    request.set_range_end(PrefixEnd(request.key()));
+    return request;
+  }
+
   // The objects of a generation (or its one object "instance") at
   // "revision", in the order the cluster keeps the keys. Their bytes stay
   // in "*reply".
   void ReadGeneration(const std::string& gen, const std::string* instance, std::int64_t revision,
                       etcdserverpb::RangeResponse* reply, std::vector<Entry>* entries) {
-    const std::string base = keys_.Generation(gen);
-    RangeRequest request;
-    request.set_key(instance ? keys_.Object(gen, *instance) : base);
-    request.set_range_end(PrefixEnd(request.key()));
+    RangeRequest request = GenerationRequest(gen, instance);
     request.set_revision(revision);
     *reply = client_.Range(request);
+    ParseGeneration(gen, *reply, entries);
+  }
 
+  void ParseGeneration(const std::string& gen, const etcdserverpb::RangeResponse& reply,
+                       std::vector<Entry>* entries) const {
+    const std::string base = keys_.Generation(gen);
+    // Keys are compared as views against a suffix made once: a string built
+    // per key cost a listing more than half the instructions of receiving it.
+    const std::string firstPart = Keys::PartSuffix(0);
+    std::string want;
     std::int64_t headRevision = 0;
-    const auto& kvs = reply->kvs();
+    const auto& kvs = reply.kvs();
     for (int i = 0; i < kvs.size(); ++i) {
       std::string_view key(kvs[i].key());
       key.remove_prefix(base.size());
@@ -454,12 +511,14 @@ class EtcdStore final : public ConfigStore {
       Entry entry;
       Header header;
       std::string_view value(kvs[i].value());
-      if (zero == std::string_view::npos ||
-          !etcdlayout::Unescape(key.substr(0, zero), &entry.instance)) {
+      if (zero == std::string_view::npos) continue;  // not an object's key
+      const std::string_view escaped = key.substr(0, zero);
+      if (escaped.find('\1') == std::string_view::npos) {
+        entry.instance.assign(escaped);  // nothing escaped
+      } else if (!etcdlayout::Unescape(escaped, &entry.instance)) {
         continue;  // not an object's key: nothing of ours to report
       }
-      const std::string part0 = std::string(key.substr(0, zero + 1)) + Keys::PartSuffix(0);
-      if (key != part0) {
+      if (key.substr(zero + 1) != firstPart) {
         entry.damage = "a part of an object without its first part";
       } else if (!etcdlayout::ReadHeader(&value, &header)) {
         entry.damage = "unreadable object header";
@@ -467,7 +526,7 @@ class EtcdStore final : public ConfigStore {
         entry.body = value;
         if (header.parts > 1) entry.joined.assign(value);
         for (std::uint64_t part = 1; part < header.parts && entry.damage.empty(); ++part) {
-          const std::string want = std::string(key.substr(0, zero + 1)) + Keys::PartSuffix(part);
+          want.assign(key.substr(0, zero + 1)).append(Keys::PartSuffix(part));
           if (i + 1 < kvs.size() &&
               std::string_view(kvs[i + 1].key()).substr(base.size()) == want) {
             entry.joined += kvs[++i].value();
@@ -550,7 +609,11 @@ class EtcdStore final : public ConfigStore {
   std::vector<std::shared_ptr<ConfigStoreObject>> List(const FilterSpecObject& filter) {
     const ConfigStoreObjectId& want = filter.Id();
     const std::string* instance = want.InstanceId().empty() ? nullptr : &want.InstanceId();
-    const Pointers pointers = ReadPointers(ExactCollection(want), 0);
+    const std::string exact = ExactCollection(want);
+    etcdserverpb::RangeResponse reply;
+    std::vector<Entry> entries;
+    const Pointers pointers =
+        exact.empty() ? ReadPointers(exact, 0) : ReadCollection(exact, instance, &reply, &entries);
 
     struct Listed {
       Order order;
@@ -565,9 +628,10 @@ class EtcdStore final : public ConfigStore {
       Observe(name, current ? *current : Current());
       const Pending* pending = PendingOf(name);
       if (current && !(pending && pending->cleared)) {
-        etcdserverpb::RangeResponse reply;
-        std::vector<Entry> entries;
-        ReadGeneration(current->gen, instance, pointers.revision, &reply, &entries);
+        if (name != exact) {
+          entries.clear();
+          ReadGeneration(current->gen, instance, pointers.revision, &reply, &entries);
+        }
         for (const Entry& entry : entries) {
           if (pending &&
               (pending->deleted.count(entry.instance) || pending->puts.count(entry.instance))) {
@@ -938,6 +1002,8 @@ class EtcdStore final : public ConfigStore {
   std::vector<TxnState> saved_;  // the state at each inner Begin
   // Collections this transaction read, with the version it saw (0: none).
   std::map<std::string, std::int64_t> observed_;
+  // The generation each collection read pointed at then (ReadCollection).
+  std::map<std::string, std::string> lastGen_;
   std::unique_ptr<ChangeFeed> feed_;
 };
 
