@@ -24,6 +24,7 @@
 #include <cstdio>
 #include <map>
 #include <mutex>
+#include <optional>
 #include <random>
 #include <set>
 #include <thread>
@@ -49,6 +50,9 @@ using etcdserverpb::TxnRequest;
 constexpr std::int64_t kLeaseSeconds = 60;
 constexpr int kCommitAttempts = 5;
 constexpr int kCompactedCode = kErrorEtcdBase + static_cast<int>(grpc::StatusCode::OUT_OF_RANGE);
+constexpr int kDeadlineCode =
+    kErrorEtcdBase + static_cast<int>(grpc::StatusCode::DEADLINE_EXCEEDED);
+constexpr int kUnavailableCode = kErrorEtcdBase + static_cast<int>(grpc::StatusCode::UNAVAILABLE);
 
 std::string NewId() {
   static std::mutex mu;
@@ -346,7 +350,7 @@ class EtcdStore final : public ConfigStore {
       return;
     }
     // A failed commit leaves the transaction open, for the caller to abort.
-    Apply();
+    Reaching([&] { Apply(); });
     Reset();
   }
 
@@ -382,12 +386,32 @@ class EtcdStore final : public ConfigStore {
   // at between its requests.
   template <typename Read>
   auto Reading(const Read& read) -> decltype(read()) {
-    for (int attempt = 1;; ++attempt) {
-      try {
-        return read();
-      } catch (const ConfigStoreException& e) {
-        if (e.Code() != kCompactedCode || attempt == 3) throw;
+    return Reaching([&] {
+      for (int attempt = 1;; ++attempt) {
+        try {
+          return read();
+        } catch (const ConfigStoreException& e) {
+          if (e.Code() != kCompactedCode || attempt == 3) throw;
+        }
       }
+    });
+  }
+
+  // A transaction that found no member answering fails its later requests
+  // at once with that error: each would wait out the timeout again, and it
+  // cannot commit without the cluster. So a caller that goes on after a
+  // failure (a reset clearing one collection after another) still ends
+  // within about one timeout.
+  template <typename Call>
+  auto Reaching(const Call& call) -> decltype(call()) {
+    if (depth_ > 0 && unreachable_) throw *unreachable_;
+    try {
+      return call();
+    } catch (const ConfigStoreException& e) {
+      if (depth_ > 0 && (e.Code() == kDeadlineCode || e.Code() == kUnavailableCode)) {
+        unreachable_ = e;
+      }
+      throw;
     }
   }
 
@@ -680,6 +704,7 @@ class EtcdStore final : public ConfigStore {
     txn_ = TxnState();
     saved_.clear();
     observed_.clear();
+    unreachable_.reset();
   }
 
   [[noreturn]] void Conflict(const std::string& collection) const {
@@ -1005,6 +1030,7 @@ class EtcdStore final : public ConfigStore {
   // The generation each collection read pointed at then (ReadCollection).
   std::map<std::string, std::string> lastGen_;
   std::unique_ptr<ChangeFeed> feed_;
+  std::optional<ConfigStoreException> unreachable_;  // met by the open transaction
 };
 
 }  // namespace
