@@ -15,7 +15,7 @@
 // each escaped so that it holds no \0 (\0 -> \1\1, \1 -> \1\2): keys then
 // sort part by part, and one object's keys are contiguous.
 //
-// Part 0000's header: u8 1, varint order kind, varint revision, varint index,
+// The first part's header: u8 1, varint order kind, varint revision, varint index,
 // varint part count. An object's place in write order is (revision, index);
 // the revision is the one written (kind 0, an object carried into a new
 // generation), the part's own mod revision (kind 1, written in place) or the
