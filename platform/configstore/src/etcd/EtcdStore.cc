@@ -304,8 +304,14 @@ class EtcdStore final : public ConfigStore {
     std::lock_guard<std::mutex> lock(mu_);
     InTransaction([&] {
       const ConfigStoreObjectId& want = filter->Id();
-      const Pointers pointers = Reading([&] { return ReadPointers(ExactCollection(want), 0); });
+      // A collection named in full is not looked up: the commit finds out
+      // whether it exists. A caller that goes on past a failed deletion
+      // (the library's Reset) must not commit as if it had asked for none.
       std::set<std::string> names;
+      const std::string exact = ExactCollection(want);
+      if (!exact.empty()) names.insert(exact);
+      const Pointers pointers =
+          exact.empty() ? Reading([&] { return ReadPointers(std::string(), 0); }) : Pointers();
       for (const auto& [name, current] : pointers.byCollection) {
         if (CollectionMatches(*filter, name)) names.insert(name);
       }
@@ -623,21 +629,31 @@ class EtcdStore final : public ConfigStore {
   }
 
   void Apply() {
-    std::vector<std::string> touched;
+    std::vector<std::string> pendingNames;
     for (const auto& [name, pending] : txn_.collections) {
-      if (pending.Touched()) touched.push_back(name);
+      if (pending.Touched()) pendingNames.push_back(name);
     }
-    if (touched.empty()) return;
+    if (pendingNames.empty()) return;
     for (int attempt = 1;; ++attempt) {
       Pointers now = ReadPointers(std::string(), 0);
       bool readAny = false;
-      for (const std::string& name : touched) {
+      std::vector<std::string> touched;
+      for (const std::string& name : pendingNames) {
         auto seen = observed_.find(name);
-        if (seen == observed_.end()) continue;
-        readAny = true;
         auto it = now.byCollection.find(name);
-        if (seen->second != (it == now.byCollection.end() ? 0 : it->second.version)) Conflict(name);
+        if (seen != observed_.end()) {
+          readAny = true;
+          if (seen->second != (it == now.byCollection.end() ? 0 : it->second.version)) {
+            Conflict(name);
+          }
+        }
+        // Clearing or deleting from a collection that does not exist
+        // changes nothing.
+        if (it != now.byCollection.end() || !txn_.collections.at(name).puts.empty()) {
+          touched.push_back(name);
+        }
       }
+      if (touched.empty()) return;
       const std::string token = NewId();
       if (FitsInPlace(touched, now) ? CommitInPlace(touched, now, token)
                                     : CommitGenerations(touched, now, token)) {
