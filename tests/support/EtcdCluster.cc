@@ -293,6 +293,13 @@ void EtcdCluster::Restart(int i) {
   }
 }
 
+void EtcdCluster::RestartAll() {
+  for (Member& m : members_) {
+    if (m.pid < 0) m.pid = Spawn(m.argv, m.dir + "/etcd.log");
+  }
+  if (!WaitUp(kHealthy)) throw std::runtime_error("an etcd member lost a port");
+}
+
 int EtcdCluster::LeaderIndex() const {
   for (const auto deadline = Clock::now() + kUpWithin; Clock::now() < deadline; usleep(20000)) {
     std::vector<int> leaders;

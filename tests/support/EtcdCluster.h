@@ -54,6 +54,9 @@ class EtcdCluster {
   // Same folder and ports, killing it first if it runs; returns once every
   // running member is healthy.
   void Restart(int i);
+  // Starts every member that is not running, all at once (a lone member of
+  // three waits for its peers before it is healthy), and returns once all are.
+  void RestartAll();
   // Waits up to 20 s for exactly one running member to lead.
   int LeaderIndex() const;
   // etcdctl's standard output; throws with its error output when it fails.

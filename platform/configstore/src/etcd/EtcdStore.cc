@@ -308,8 +308,15 @@ class EtcdStore final : public ConfigStore {
     std::lock_guard<std::mutex> lock(mu_);
     InTransaction([&] {
       const ConfigStoreObjectId& want = filter->Id();
-      const Pointers pointers = Reading([&] { return ReadPointers(ExactCollection(want), 0); });
-      for (const std::string& name : Matching(*filter, pointers)) {
+      // A collection named in full is not looked up: the commit finds out
+      // whether it exists. A caller that goes on past a failed deletion
+      // (the library's Reset) must not commit as if it had asked for none.
+      const std::string exact = ExactCollection(want);
+      const Pointers pointers =
+          exact.empty() ? Reading([&] { return ReadPointers(std::string(), 0); }) : Pointers();
+      std::set<std::string> names = Matching(*filter, pointers);
+      if (!exact.empty()) names.insert(exact);
+      for (const std::string& name : names) {
         Pending& pending = txn_.collections[name];
         if (want.InstanceId().empty()) {
           pending.cleared = true;
@@ -716,24 +723,27 @@ class EtcdStore final : public ConfigStore {
   }
 
   void Apply() {
+    std::vector<std::string> pendingNames;
+    for (const auto& [name, pending] : txn_.collections) {
+      if (pending.Touched()) pendingNames.push_back(name);
+    }
+    if (pendingNames.empty()) return;
     for (int attempt = 1;; ++attempt) {
       Pointers now = ReadPointers(std::string(), 0);
-      // Deleting from a collection that does not exist changes nothing.
+      bool readAny = false;
       std::vector<std::string> touched;
-      for (const auto& [name, pending] : txn_.collections) {
-        if (!pending.puts.empty() || (pending.Touched() && Find(now, name))) {
-          touched.push_back(name);
+      for (const std::string& name : pendingNames) {
+        const Current* current = Find(now, name);
+        auto seen = observed_.find(name);
+        if (seen != observed_.end()) {
+          readAny = true;
+          if (seen->second != (current ? current->version : 0)) Conflict(name);
         }
+        // Clearing or deleting from a collection that does not exist
+        // changes nothing.
+        if (current || !txn_.collections.at(name).puts.empty()) touched.push_back(name);
       }
       if (touched.empty()) return;
-      bool readAny = false;
-      for (const std::string& name : touched) {
-        auto seen = observed_.find(name);
-        if (seen == observed_.end()) continue;
-        readAny = true;
-        const Current* current = Find(now, name);
-        if (seen->second != (current ? current->version : 0)) Conflict(name);
-      }
       const std::string token = NewId();
       if (FitsInPlace(touched, now) ? CommitInPlace(touched, now, token)
                                     : CommitGenerations(touched, now, token)) {

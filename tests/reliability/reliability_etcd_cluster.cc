@@ -1,0 +1,465 @@
+// Three etcd members on loopback. A writer replaces both catalogues through
+// the library while the leader is SIGKILLed and restarted, again and again;
+// then karstctl imports are SIGKILLed mid-batch; then the whole cluster goes
+// down. Four readers (one on each member, one on all) list throughout. A
+// listing must be one whole list, no older than the last replace that
+// returned before it began and no newer than the last one begun by its end;
+// a dead writer's generation must stay unseen and go once its lease has; and
+// with no member up every operation must fail in bounded time, naming the
+// cluster.
+
+#include <fcntl.h>
+#include <sys/types.h>
+
+#include <algorithm>
+#include <functional>
+#include <mutex>
+#include <set>
+#include <sstream>
+
+#include "EtcdCluster.h"
+#include "TavoConfigStore/ConfigStore.h"
+#include "TavoConfigStore/ConfigStoreException.h"
+#include "reliability_util.h"
+
+#ifndef KARSTCTL_BINARY
+#error "KARSTCTL_BINARY must name the built karstctl"
+#endif
+
+namespace karst_reliability {
+namespace {
+
+using TavoConfigStore::ConfigStore;
+using TavoConfigStore::ConfigStoreObject;
+using TavoConfigStore::ConfigStoreObjectId;
+using TavoConfigStore::FilterSpecObject;
+using TavoConfigStore::kErrorEtcdBase;
+using TavoConfigStore::OpenStore;
+using Clock = std::chrono::steady_clock;
+
+const std::string kPrefix = "cat";
+constexpr int kPolicies = 300;    // about four etcd requests a replace
+constexpr int kDatastores = 150;  // two
+constexpr double kDownBound = 8;  // seconds; each request gives up after 5
+
+// The library finds its store through the one installed for the process;
+// this one hands each call to the calling thread's own connection.
+thread_local std::shared_ptr<ConfigStore> tStore;
+class ThreadsOwnStore final : public ConfigStore {
+ public:
+  std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
+    return tStore->GetObject(id);
+  }
+  void SetObject(const std::shared_ptr<ConfigStoreObject>& o, std::int32_t& flags) override {
+    tStore->SetObject(o, flags);
+  }
+  void DeleteObjects(const std::shared_ptr<FilterSpecObject>& f) override {
+    tStore->DeleteObjects(f);
+  }
+  std::vector<std::shared_ptr<ConfigStoreObject>> GetObjects(
+      const std::shared_ptr<FilterSpecObject>& f) override {
+    return tStore->GetObjects(f);
+  }
+  void BeginTransaction() override { tStore->BeginTransaction(); }
+  void CommitTransaction() override { tStore->CommitTransaction(); }
+  void AbortTransaction() override { tStore->AbortTransaction(); }
+};
+
+// Counts by name, from any thread.
+class Tally {
+ public:
+  void Add(const std::string& name) {
+    std::lock_guard<std::mutex> lock(mu_);
+    ++counts_[name];
+  }
+  int Of(const std::string& name) {
+    std::lock_guard<std::mutex> lock(mu_);
+    return counts_[name];
+  }
+  std::string Text() {
+    std::lock_guard<std::mutex> lock(mu_);
+    std::string text;
+    for (const auto& [name, n] : counts_)
+      text += (text.empty() ? "" : ", ") + name + " x" + std::to_string(n);
+    return text.empty() ? "none" : text;
+  }
+
+ private:
+  std::mutex mu_;
+  std::map<std::string, int> counts_;
+};
+
+// Replace j goes to the policies when j is even, else to the datastores.
+void Replace(long long j) {
+  if (j % 2 == 0) KarstLib::AddPolicyInfo(PoliciesFor(Tag{0, j, kPolicies}));
+  if (j % 2 == 1) KarstLib::AddDatastoreInfo(DatastoresFor(Tag{0, j, kDatastores}));
+}
+
+// The rounds a listing of each collection may show.
+struct Bounds {
+  long long low[2];
+  long long high[2];
+};
+
+// The writers' progress: the last replace of each collection that returned,
+// and the last begun.
+struct Progress {
+  std::atomic<long long> done[2] = {{0}, {1}};
+  std::atomic<long long> begun{1};
+  std::atomic<long long> replaced{0};
+  // While replaces run: none older than the last that returned, none past
+  // the last begun.
+  Bounds Now() const { return {{done[0], done[1]}, {begun, begun}}; }
+  // With none running: exactly the last that returned.
+  Bounds Settled() const { return {{done[0], done[1]}, {done[0], done[1]}}; }
+  void Returned(long long j) {
+    done[j % 2] = j;
+    ++replaced;
+  }
+};
+
+// Lists both collections through the calling thread's store, with the lower
+// bounds taken before and the upper ones after; counts what is wrong (torn,
+// stale, unwritten) and says what it is, "" when both are right.
+std::string CheckListing(const std::function<Bounds()>& bounds, Tally& wrong) {
+  const Bounds before = bounds();
+  const std::string seen[2] = {Classify(KarstLib::ListPolicyInfo()),
+                               Classify(KarstLib::ListDatastoreInfo())};
+  const Bounds after = bounds();
+  std::string report;
+  for (int c : {0, 1}) {
+    Tag t;
+    const char* verdict = std::sscanf(seen[c].c_str(), "w=%d r=%lld", &t.writer, &t.round) != 2
+                              ? "torn"
+                          : t.round < before.low[c]                     ? "stale"
+                          : t.round > after.high[c] || t.round % 2 != c ? "unwritten"
+                                                                        : nullptr;
+    if (verdict == nullptr) continue;
+    wrong.Add(verdict);
+    report += std::string(verdict) + (c ? " datastores \"" : " policies \"") + seen[c] +
+              "\" (from " + std::to_string(before.low[c]) + " to " + std::to_string(after.high[c]) +
+              "); ";
+  }
+  return report;
+}
+
+std::string MemberLocator(const EtcdCluster& etcd, int member, const std::string& query = "") {
+  return "etcd://" + (member < 0 ? etcd.Endpoints() : etcd.Endpoint(member)) + "/" + kPrefix +
+         query;
+}
+
+// The generations etcd holds under "area" ("g/", "r/" or "w/").
+std::set<std::string> Generations(const EtcdCluster& etcd, const std::string& area) {
+  const std::string root = "/" + kPrefix + "/" + area;
+  std::istringstream keys(etcd.Etcdctl({"get", "--prefix", "--keys-only", root}));
+  std::set<std::string> gens;
+  for (std::string line; std::getline(keys, line);) {
+    if (!line.empty()) gens.insert(line.substr(root.size(), 16));
+  }
+  return gens;
+}
+
+// What a writer's lease would do after 60 s.
+void RevokeLeases(const EtcdCluster& etcd) {
+  std::istringstream out(etcd.Etcdctl({"lease", "list"}));
+  std::string id;
+  std::getline(out, id);  // "found N leases"
+  while (out >> id) etcd.Etcdctl({"lease", "revoke", id});
+}
+
+// Only each collection's current generation is left.
+bool NoLeftovers(const EtcdCluster& etcd) {
+  const std::set<std::string> registered = Generations(etcd, "r/");
+  return registered.size() == 2 && Generations(etcd, "g/") == registered &&
+         Generations(etcd, "w/").empty();
+}
+
+// karstctl with "args", its output to the files named; dies with this thread.
+pid_t StartKarstctl(const std::vector<std::string>& args, const std::string& out,
+                    const std::string& err = "/dev/null") {
+  const pid_t pid = fork();
+  if (pid != 0) return pid;
+  prctl(PR_SET_PDEATHSIG, SIGKILL);
+  dup2(open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600), STDOUT_FILENO);
+  dup2(open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600), STDERR_FILENO);
+  std::vector<char*> argv = {const_cast<char*>(KARSTCTL_BINARY)};
+  for (const std::string& arg : args) argv.push_back(const_cast<char*>(arg.c_str()));
+  argv.push_back(nullptr);
+  execv(argv[0], argv.data());
+  _exit(126);
+}
+
+template <typename Ready>
+bool WaitUntil(Ready ready, std::chrono::seconds limit) {
+  for (const auto end = Clock::now() + limit; !ready(); usleep(20000)) {
+    if (Clock::now() > end) return false;
+  }
+  return true;
+}
+
+// Threads that run until Stop, which an early end of the test calls too.
+class Threads {
+ public:
+  ~Threads() { Stop(); }
+  template <typename Body>
+  void Start(Body body) {
+    threads_.emplace_back([this, body] {
+      while (!stop_) body();
+    });
+  }
+  void Stop() {
+    stop_ = true;
+    for (std::thread& t : threads_) {
+      if (t.joinable()) t.join();
+    }
+  }
+
+ private:
+  std::atomic<bool> stop_{false};
+  std::vector<std::thread> threads_;
+};
+
+TEST(EtcdFailover, LeaderKillsDeadWritersAndAClusterDown) {
+  const auto start = Clock::now();
+  EtcdCluster etcd({3});
+  TavoConfigStore::SetGlobalStore(std::make_shared<ThreadsOwnStore>());
+  Progress progress;
+  const auto now = [&] { return progress.Now(); };
+  const auto replaceNext = [&] {
+    tStore = OpenStore(MemberLocator(etcd, -1));
+    Replace(++progress.begun);
+    progress.Returned(progress.begun);
+  };
+  tStore = OpenStore(MemberLocator(etcd, -1));
+  Replace(0), Replace(1);
+  std::mt19937 rng(20261124);
+
+  // Readers 0-2 on one member each, 3 on all; a second's timeout keeps the
+  // one whose member is down trying.
+  std::atomic<long long> listings{0}, readErrors{0};
+  Tally wrong;
+  Threads readers;
+  for (int r = 0; r < 4; ++r) {
+    readers.Start([&, r] {
+      if (!tStore) tStore = OpenStore(MemberLocator(etcd, r < 3 ? r : -1, "?timeout=1000"));
+      try {
+        EXPECT_EQ(CheckListing(now, wrong), "") << "reader " << r;
+        ++listings;
+      } catch (const ConfigStoreException&) {
+        ++readErrors;
+      }
+      usleep(10000);  // leaves the two cores to the cluster and the writer now and then
+    });
+  }
+
+  // The leader goes and comes back while the writer replaces.
+  Tally writerErrors;
+  Threads writer;
+  writer.Start([&] {
+    // A proposal lost with its leader goes unanswered until the request's
+    // deadline: a shorter one than the default keeps each such loss short.
+    if (!tStore) tStore = OpenStore(MemberLocator(etcd, -1, "?timeout=2000"));
+    const long long j = ++progress.begun;
+    try {
+      Replace(j);
+      progress.Returned(j);
+    } catch (const ConfigStoreException& e) {
+      writerErrors.Add(std::to_string(e.Code()));
+      EXPECT_GE(e.Code(), kErrorEtcdBase) << e.what();
+    }
+  });
+  const int events = Scaled(50, 10);
+  int memberChecks = 0;
+  for (int e = 0; e < events; ++e) {
+    const long long replaced = progress.replaced;
+    ASSERT_TRUE(WaitUntil([&] { return progress.replaced > replaced; }, std::chrono::seconds(20)))
+        << "no replace returned within 20 s after event " << e;
+    usleep(rng() % 200000);
+    const int leader = etcd.LeaderIndex();
+    etcd.Kill(leader);
+    usleep(rng() % 300000);
+    etcd.Restart(leader);
+    for (int m = 0; m < 3; ++m, ++memberChecks) {
+      tStore = OpenStore(MemberLocator(etcd, m));
+      EXPECT_EQ(CheckListing(now, wrong), "") << "event " << e << ", member " << m;
+    }
+  }
+  writer.Stop();
+  // A replace that failed may have left its generation, on a lease, and may
+  // still land (a timeout is no answer); once the leases are gone it cannot,
+  // and a replace of each collection settles the catalogue.
+  const std::size_t orphanedByFailures = Generations(etcd, "w/").size();
+  RevokeLeases(etcd);
+  replaceNext(), replaceNext();
+  EXPECT_TRUE(NoLeftovers(etcd));
+
+  // karstctl imports a large catalogue (both collections in one transaction)
+  // and is SIGKILLed once its generations are registered, or a little later.
+  ScratchDir dir;
+  const std::string big = dir.File("big.json");
+  const int imports = Scaled(3, 1);
+  int midBatch = 0, keptOld = 0, leftAlone = 0, removed = 0;
+  for (int k = 0; k < imports; ++k) {
+    const long long j = progress.begun + 1 + (progress.begun + 1) % 2;
+    tStore = TavoConfigStore::NewSqliteStore(dir.File("big" + std::to_string(k) + ".db"));
+    KarstLib::AddPolicyInfo(PoliciesFor(Tag{0, j, 3000}));
+    KarstLib::AddDatastoreInfo(DatastoresFor(Tag{0, j + 1, 400}));
+    int status = 0;
+    const pid_t exporter =
+        StartKarstctl({"--store", dir.File("big" + std::to_string(k) + ".db"), "export"}, big);
+    ASSERT_TRUE(waitpid(exporter, &status, 0) == exporter && status == 0);
+
+    const Bounds old = progress.Settled();
+    progress.begun = j + 1;
+    const pid_t importer =
+        StartKarstctl({"--store", etcd.Locator(kPrefix), "import", big}, "/dev/null");
+    ASSERT_TRUE(
+        WaitUntil([&] { return !Generations(etcd, "w/").empty(); }, std::chrono::seconds(30)));
+    usleep(rng() % 200000);
+    kill(importer, SIGKILL);
+    ASSERT_EQ(waitpid(importer, &status, 0), importer);
+    ASSERT_FALSE(WIFEXITED(status) && WEXITSTATUS(status) != 0) << "karstctl import failed";
+    const std::set<std::string> orphans = Generations(etcd, "w/");
+    if (orphans.empty()) {  // too late: it had committed
+      progress.Returned(j), progress.Returned(j + 1);
+      continue;
+    }
+    ++midBatch;
+    int whole = 0;
+    for (int m = 0; m < 3; ++m) {
+      tStore = OpenStore(MemberLocator(etcd, m));
+      const std::string report = CheckListing([&] { return old; }, wrong);
+      EXPECT_EQ(report, "") << "import kill " << k << ", member " << m;
+      whole += report.empty();
+    }
+    keptOld += whole == 3;
+    // The next writer leaves a generation alone while its writer's lease
+    // runs, and removes it once the lease has gone.
+    replaceNext();
+    const std::set<std::string> registered = Generations(etcd, "r/");
+    leftAlone +=
+        std::includes(registered.begin(), registered.end(), orphans.begin(), orphans.end());
+    RevokeLeases(etcd);
+    EXPECT_TRUE(Generations(etcd, "w/").empty());
+    replaceNext();
+    removed += NoLeftovers(etcd);
+  }
+  EXPECT_GT(midBatch, 0) << "no import was killed mid-batch";
+  EXPECT_EQ(keptOld, midBatch);
+  EXPECT_EQ(leftAlone, midBatch);
+  EXPECT_EQ(removed, midBatch);
+  readers.Stop();
+
+  // The whole cluster down: every operation fails in bounded time, naming it.
+  const Bounds last = progress.Settled();
+  for (int m = 0; m < 3; ++m) etcd.Kill(m);
+  const std::vector<std::pair<std::string, std::function<void()>>> calls = {
+      {"Reset", [] { KarstLib::Reset(); }},
+      {"AddPolicyInfo",
+       [] {
+         KarstLib::AddPolicyInfo(PoliciesFor(Tag{1, 1}));
+       }},
+      {"AddDatastoreInfo",
+       [] {
+         KarstLib::AddDatastoreInfo(DatastoresFor(Tag{1, 1}));
+       }},
+      {"ListPolicyInfo", [] { KarstLib::ListPolicyInfo(); }},
+      {"ListDatastoreInfo", [] { KarstLib::ListDatastoreInfo(); }},
+      {"GetPolicyBlobById", [] { KarstLib::GetPolicyBlobById("id-0", "ds-0"); }},
+      {"GetCorraPolicyBlobById", [] { KarstLib::GetCorraPolicyBlobById("id-0"); }},
+      {"GetCorraPolicyBlobByName", [] { KarstLib::GetCorraPolicyBlobByName("policy-0"); }},
+      {"GetDefaultPolicyBlob", [] { KarstLib::GetDefaultPolicyBlob("ds-0"); }},
+      {"GetDbHash", [] { KarstLib::GetDbHash(); }},
+  };
+  const std::vector<std::vector<std::string>> tool = {
+      {"policies", "list"}, {"export"}, {"hash"}, {"import", big}, {"reset"}};
+  const std::size_t count = calls.size() + tool.size();
+  std::vector<std::string> names(count), errors(count);
+  std::vector<double> seconds(count);
+  const auto begin = Clock::now();
+  const auto since = [&] { return std::chrono::duration<double>(Clock::now() - begin).count(); };
+  // karstctl first: forked while this process's own calls waited, it started
+  // seconds late.
+  std::map<pid_t, std::size_t> running;
+  for (std::size_t t = 0; t < tool.size(); ++t) {
+    std::vector<std::string> args = {"--store", etcd.Locator(kPrefix)};
+    args.insert(args.end(), tool[t].begin(), tool[t].end());
+    names[calls.size() + t] = "karstctl " + tool[t][0];
+    running[StartKarstctl(args, "/dev/null", dir.File("err" + std::to_string(t)))] =
+        calls.size() + t;
+  }
+  std::vector<std::thread> down;
+  for (std::size_t i = 0; i < calls.size(); ++i) {
+    names[i] = calls[i].first;
+    down.emplace_back([&, i] {
+      tStore = OpenStore(MemberLocator(etcd, -1));
+      try {
+        calls[i].second();
+      } catch (const ConfigStoreException& e) {
+        errors[i] = e.what();
+      }
+      tStore.reset();
+      seconds[i] = since();
+    });
+  }
+  while (!running.empty() && since() < 30) {
+    usleep(10000);
+    for (auto it = running.begin(); it != running.end();) {
+      int status = 0;
+      if (waitpid(it->first, &status, WNOHANG) != it->first) {
+        ++it;
+        continue;
+      }
+      const std::size_t i = it->second;
+      seconds[i] = since();
+      // The last line: the store's error, after the warnings about the file.
+      const std::string err = ReadFile(dir.File("err" + std::to_string(i - calls.size())));
+      const std::size_t from = err.rfind('\n', err.size() < 2 ? 0 : err.size() - 2);
+      if (WIFEXITED(status) && WEXITSTATUS(status) == 1) {
+        errors[i] = err.substr(from == std::string::npos ? 0 : from + 1);
+      }
+      it = running.erase(it);
+    }
+  }
+  for (const auto& [pid, i] : running) {  // hung
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+    seconds[i] = since();
+  }
+  for (std::thread& t : down) t.join();
+  int downWrong = 0;
+  for (std::size_t i = 0; i < count; ++i) {
+    const bool right =
+        errors[i].find(etcd.Endpoints()) != std::string::npos && seconds[i] < kDownBound;
+    downWrong += !right;
+    EXPECT_TRUE(right) << names[i] << " after " << seconds[i]
+                       << " s: " << (errors[i].empty() ? "no store error" : errors[i]);
+  }
+  etcd.RestartAll();
+  int intact = 0;
+  for (int m = 0; m < 3; ++m) {
+    tStore = OpenStore(MemberLocator(etcd, m));
+    const std::string report = CheckListing([&] { return last; }, wrong);
+    EXPECT_EQ(report, "") << "after the restart, member " << m;
+    intact += report.empty();
+  }
+  tStore.reset();
+  TavoConfigStore::SetGlobalStore(nullptr);
+
+  ReportFigures(
+      "etcd-cluster",
+      "etcd-cluster: 3 members, %d leader kills: replaces returned %lld, failed by code %s; "
+      "%lld listings by 4 readers (one on each member, one on all), read errors %lld, "
+      "%d member checks; torn %d, stale %d, unwritten %d; failed replaces left %zu generations, "
+      "gone after their lease; %d of %d karstctl imports killed mid-batch: old catalogue kept "
+      "%d, left alone while leased %d, removed after %d; cluster down: %zu operations, wrong %d, "
+      "slowest %.2f s; intact after restart on %d of 3 members; %.0f s",
+      events, progress.replaced.load(), writerErrors.Text().c_str(), listings.load(),
+      readErrors.load(), memberChecks, wrong.Of("torn"), wrong.Of("stale"), wrong.Of("unwritten"),
+      orphanedByFailures, midBatch, imports, keptOld, leftAlone, removed, count, downWrong,
+      *std::max_element(seconds.begin(), seconds.end()), intact,
+      std::chrono::duration<double>(Clock::now() - start).count());
+}
+
+}  // namespace
+}  // namespace karst_reliability
