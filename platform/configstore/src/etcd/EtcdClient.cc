@@ -234,11 +234,16 @@ void EtcdClient::LeaseRevoke(std::int64_t lease) {
   etcdserverpb::LeaseRevokeRequest request;
   request.set_id(lease);
   etcdserverpb::LeaseRevokeResponse response;
-  Invoke(
+  const grpc::Status status = Invoke(
       [&](grpc::ClientContext* context) {
         return lease_->LeaseRevoke(context, request, &response);
       },
       true);
+  // A lease that is gone already (run out, or revoked by an earlier attempt
+  // whose answer was lost) is what was asked for.
+  if (!status.ok() && status.error_code() != grpc::StatusCode::NOT_FOUND) {
+    Fail(status, "lease revoke");
+  }
 }
 
 }  // namespace TavoConfigStore

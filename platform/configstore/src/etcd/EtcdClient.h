@@ -35,6 +35,7 @@ class EtcdClient {
 
   std::int64_t LeaseGrant(std::int64_t ttlSeconds);
   void LeaseKeepAlive(std::int64_t lease);
+  // Throws unless etcd confirms the lease is gone.
   void LeaseRevoke(std::int64_t lease);
 
   // Adds the deadline and the auth token to a context for a call of one's own

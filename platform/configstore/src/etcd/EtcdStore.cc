@@ -411,7 +411,7 @@ class EtcdStore final : public ConfigStore {
   // within about one timeout.
   template <typename Call>
   auto Reaching(const Call& call) -> decltype(call()) {
-    if (depth_ > 0 && unreachable_) throw *unreachable_;
+    if (depth_ > 0 && unreachable_) throw ConfigStoreException(*unreachable_);
     try {
       return call();
     } catch (const ConfigStoreException& e) {
@@ -826,12 +826,17 @@ class EtcdStore final : public ConfigStore {
   // first attempt has changed the versions it compares, the pointer of a
   // collection it writes ("witness", "" when it writes none) holds this
   // commit's token exactly when it did.
-  bool Switch(const TxnRequest& txn, const std::string& witness, const std::string& token) {
+  bool Switch(const TxnRequest& txn, const std::string& witness, const std::string& token,
+              std::int64_t lease = 0) {
     try {
       return client_.Txn(txn, true).succeeded() || Holds(witness, token);
     } catch (const ConfigStoreException&) {
       bool committed = false;
       try {
+        // A switch compares on its writer's key: once the lease that key
+        // lives on is revoked, a request still on its way can no longer be
+        // applied, and the pointer tells for certain.
+        if (lease != 0) client_.LeaseRevoke(lease);
         committed = Holds(witness, token);
       } catch (const ConfigStoreException&) {
         // Unknown either way: report the first failure.
@@ -988,7 +993,7 @@ class EtcdStore final : public ConfigStore {
     }
     for (RequestOp& op : ops) *txn.add_success() = std::move(op);
     ops.clear();
-    if (!Switch(txn, anyWritten, token)) {
+    if (!Switch(txn, anyWritten, token, lease)) {
       return !abandon() && Holds(anyWritten, token);
     }
     try {
