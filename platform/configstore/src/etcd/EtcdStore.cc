@@ -848,7 +848,8 @@ class EtcdStore final : public ConfigStore {
 
   bool Holds(const std::string& witness, const std::string& token) {
     if (witness.empty()) return false;
-    const Current* current = Find(ReadPointers(witness, 0), witness);
+    const Pointers now = ReadPointers(witness, 0);
+    const Current* current = Find(now, witness);
     return current != nullptr && current->token == token;
   }
 
