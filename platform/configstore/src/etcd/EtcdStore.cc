@@ -313,7 +313,7 @@ class EtcdStore final : public ConfigStore {
       // (the library's Reset) must not commit as if it had asked for none.
       const std::string exact = ExactCollection(want);
       const Pointers pointers =
-          exact.empty() ? Reading([&] { return ReadPointers(std::string(), 0); }) : Pointers();
+          exact.empty() ? Reading([&] { return ReadPointers(std::string()); }) : Pointers();
       std::set<std::string> names = Matching(*filter, pointers);
       if (!exact.empty()) names.insert(exact);
       for (const std::string& name : names) {
@@ -379,7 +379,7 @@ class EtcdStore final : public ConfigStore {
       if (!feed_) {
         // Changes after this revision count: anything before it the caller
         // has read already.
-        const Pointers now = ReadPointers(std::string(), 0);
+        const Pointers now = ReadPointers(std::string());
         feed_ = std::make_unique<ChangeFeed>(client_, keys_.Pointers(), now.revision + 1);
       }
     }
@@ -435,11 +435,10 @@ class EtcdStore final : public ConfigStore {
     return filter.Matches(id);
   }
 
-  // The pointer of "collection", or of every collection when it is "".
-  Pointers ReadPointers(const std::string& collection, std::int64_t revision) {
-    RangeRequest request = PointersRequest(collection);
-    request.set_revision(revision);
-    const etcdserverpb::RangeResponse reply = client_.Range(request);
+  // The pointer of "collection", or of every collection when it is "", as
+  // the cluster has them now.
+  Pointers ReadPointers(const std::string& collection) {
+    const etcdserverpb::RangeResponse reply = client_.Range(PointersRequest(collection));
     return PointersOf(reply, reply.header().revision());
   }
 
@@ -477,7 +476,7 @@ class EtcdStore final : public ConfigStore {
     auto last = lastGen_.find(collection);
     Pointers pointers;
     if (last == lastGen_.end()) {
-      pointers = ReadPointers(collection, 0);
+      pointers = ReadPointers(collection);
     } else {
       TxnRequest txn;
       *txn.add_success()->mutable_request_range() = PointersRequest(collection);
@@ -644,7 +643,7 @@ class EtcdStore final : public ConfigStore {
     etcdserverpb::RangeResponse reply;
     std::vector<Entry> entries;
     const Pointers pointers =
-        exact.empty() ? ReadPointers(exact, 0) : ReadCollection(exact, instance, &reply, &entries);
+        exact.empty() ? ReadPointers(exact) : ReadCollection(exact, instance, &reply, &entries);
 
     struct Listed {
       Order order;
@@ -729,7 +728,7 @@ class EtcdStore final : public ConfigStore {
     }
     if (pendingNames.empty()) return;
     for (int attempt = 1;; ++attempt) {
-      Pointers now = ReadPointers(std::string(), 0);
+      Pointers now = ReadPointers(std::string());
       bool readAny = false;
       std::vector<std::string> touched;
       for (const std::string& name : pendingNames) {
@@ -848,7 +847,7 @@ class EtcdStore final : public ConfigStore {
 
   bool Holds(const std::string& witness, const std::string& token) {
     if (witness.empty()) return false;
-    const Pointers now = ReadPointers(witness, 0);
+    const Pointers now = ReadPointers(witness);
     const Current* current = Find(now, witness);
     return current != nullptr && current->token == token;
   }
