@@ -119,22 +119,19 @@ void EtcdClient::Fail(const grpc::Status& status, const char* what) const {
   throw ConfigStoreException(message, kErrorEtcdBase + static_cast<int>(status.error_code()));
 }
 
-void EtcdClient::Prepare(grpc::ClientContext* context, bool deadline) {
-  if (deadline) {
-    context->set_deadline(std::chrono::system_clock::now() +
-                          std::chrono::milliseconds(options_.timeoutMs));
-  }
+void EtcdClient::Prepare(grpc::ClientContext* context) {
   // Wait for a member to answer until the deadline instead of failing at
   // the first refused connection.
   context->set_wait_for_ready(true);
   if (!options_.user.empty()) {
-    Authenticate();
+    Authenticate(std::min(context->deadline(), std::chrono::system_clock::now() +
+                                                   std::chrono::milliseconds(options_.timeoutMs)));
     std::lock_guard<std::mutex> lock(tokenMu_);
     if (!token_.empty()) context->AddMetadata("token", token_);
   }
 }
 
-void EtcdClient::Authenticate() {
+void EtcdClient::Authenticate(std::chrono::system_clock::time_point deadline) {
   std::lock_guard<std::mutex> lock(tokenMu_);
   if (authenticated_) return;
   etcdserverpb::AuthenticateRequest request;
@@ -142,8 +139,7 @@ void EtcdClient::Authenticate() {
   request.set_password(options_.password);
   etcdserverpb::AuthenticateResponse response;
   grpc::ClientContext context;
-  context.set_deadline(std::chrono::system_clock::now() +
-                       std::chrono::milliseconds(options_.timeoutMs));
+  context.set_deadline(deadline);
   context.set_wait_for_ready(true);
   const grpc::Status status = auth_->Authenticate(&context, request, &response);
   if (status.ok()) {
@@ -156,11 +152,14 @@ void EtcdClient::Authenticate() {
 
 template <typename Call>
 grpc::Status EtcdClient::Invoke(const Call& call, bool retry) {
+  // One deadline for every attempt: a request ends within the timeout
+  // however often a member drops it.
   const auto deadline =
-      std::chrono::steady_clock::now() + std::chrono::milliseconds(options_.timeoutMs);
+      std::chrono::system_clock::now() + std::chrono::milliseconds(options_.timeoutMs);
   bool reauthenticated = false;
   while (true) {
     grpc::ClientContext context;
+    context.set_deadline(deadline);
     Prepare(&context);
     grpc::Status status = call(&context);
     if (status.ok()) return status;
@@ -173,7 +172,7 @@ grpc::Status EtcdClient::Invoke(const Call& call, bool retry) {
       token_.clear();
       continue;
     }
-    if (!retry || !RetriesOn(status) || std::chrono::steady_clock::now() >= deadline) {
+    if (!retry || !RetriesOn(status) || std::chrono::system_clock::now() >= deadline) {
       return status;
     }
     std::this_thread::sleep_for(std::chrono::milliseconds(50));

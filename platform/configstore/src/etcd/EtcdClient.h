@@ -38,9 +38,9 @@ class EtcdClient {
   // Throws unless etcd confirms the lease is gone.
   void LeaseRevoke(std::int64_t lease);
 
-  // Adds the deadline and the auth token to a context for a call of one's own
-  // (a watch: no deadline, "deadline" false).
-  void Prepare(grpc::ClientContext* context, bool deadline = true);
+  // Readies a context for a call of one's own (a watch, which has no
+  // deadline): waits for a member, carries the auth token.
+  void Prepare(grpc::ClientContext* context);
   etcdserverpb::Watch::Stub& WatchStub() { return *watch_; }
 
   // Throws the store's exception for a failed call.
@@ -49,7 +49,7 @@ class EtcdClient {
  private:
   template <typename Call>
   grpc::Status Invoke(const Call& call, bool retry);
-  void Authenticate();
+  void Authenticate(std::chrono::system_clock::time_point deadline);
 
   EtcdStoreOptions options_;
   std::string where_;

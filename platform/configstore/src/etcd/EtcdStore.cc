@@ -198,7 +198,7 @@ class ChangeFeed {
     while (true) {
       auto context = std::make_shared<grpc::ClientContext>();
       try {
-        client_.Prepare(context.get(), false);
+        client_.Prepare(context.get());
       } catch (const ConfigStoreException&) {
         // Credentials refused or cluster away: the wait below says "look
         // again", and the caller's read reports the failure.
