@@ -101,6 +101,10 @@ EtcdClient::EtcdClient(const EtcdStoreOptions& options) : options_(options) {
   }
   channel_ = grpc::CreateCustomChannel(Target(options.endpoints), credentials, arguments);
   kv_ = etcdserverpb::KV::NewStub(channel_);
+  rangeMethod_ = std::make_unique<grpc::internal::RpcMethod>(
+      "/etcdserverpb.KV/Range", grpc::internal::RpcMethod::NORMAL_RPC, channel_);
+  txnMethod_ = std::make_unique<grpc::internal::RpcMethod>(
+      "/etcdserverpb.KV/Txn", grpc::internal::RpcMethod::NORMAL_RPC, channel_);
   lease_ = etcdserverpb::Lease::NewStub(channel_);
   watch_ = etcdserverpb::Watch::NewStub(channel_);
   auth_ = etcdserverpb::Auth::NewStub(channel_);
@@ -179,14 +183,6 @@ grpc::Status EtcdClient::Invoke(const Call& call, bool retry) {
   }
 }
 
-etcdserverpb::RangeResponse EtcdClient::Range(const etcdserverpb::RangeRequest& request) {
-  etcdserverpb::RangeResponse response;
-  const grpc::Status status = Invoke(
-      [&](grpc::ClientContext* context) { return kv_->Range(context, request, &response); }, true);
-  if (!status.ok()) Fail(status, "read");
-  return response;
-}
-
 etcdserverpb::TxnResponse EtcdClient::Txn(const etcdserverpb::TxnRequest& request, bool retry) {
   etcdserverpb::TxnResponse response;
   const grpc::Status status = Invoke(
@@ -197,6 +193,39 @@ etcdserverpb::TxnResponse EtcdClient::Txn(const etcdserverpb::TxnRequest& reques
     Fail(status, reads && request.compare().empty() ? "read" : "write");
   }
   return response;
+}
+
+template <typename Request>
+void EtcdClient::Receive(const grpc::internal::RpcMethod& method, const Request& request,
+                         etcdwire::Reply* reply) {
+  grpc::ByteBuffer received;
+  const grpc::Status status = Invoke(
+      [&](grpc::ClientContext* context) {
+        return grpc::internal::BlockingUnaryCall<Request, grpc::ByteBuffer,
+                                                 grpc::protobuf::MessageLite, grpc::ByteBuffer>(
+            channel_.get(), method, context, request, &received);
+      },
+      true);
+  if (!status.ok()) Fail(status, "read");
+  // A large reply arrives in several slices; the views need one.
+  if (!received.TrySingleSlice(&reply->bytes).ok() &&
+      !received.DumpToSingleSlice(&reply->bytes).ok()) {
+    Fail(grpc::Status(grpc::StatusCode::INTERNAL, "empty reply"), "read");
+  }
+}
+
+void EtcdClient::Read(const etcdserverpb::RangeRequest& request, etcdwire::Reply* reply) {
+  Receive(*rangeMethod_, request, reply);
+  if (!etcdwire::ParseRangeResponse(reply)) {
+    Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unreadable reply"), "read");
+  }
+}
+
+void EtcdClient::Read(const etcdserverpb::TxnRequest& request, etcdwire::Reply* reply) {
+  Receive(*txnMethod_, request, reply);
+  if (!etcdwire::ParseTxnResponse(reply)) {
+    Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unreadable reply"), "read");
+  }
 }
 
 std::int64_t EtcdClient::LeaseGrant(std::int64_t ttlSeconds) {

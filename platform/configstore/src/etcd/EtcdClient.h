@@ -7,6 +7,8 @@
 #define TAVOCONFIGSTORE_SRC_ETCD_ETCD_CLIENT_H_
 
 #include <grpcpp/grpcpp.h>
+#include <grpcpp/impl/client_unary_call.h>
+#include <grpcpp/impl/rpc_method.h>
 
 #include <chrono>
 #include <cstdint>
@@ -14,6 +16,7 @@
 #include <mutex>
 #include <string>
 
+#include "EtcdWire.h"
 #include "TavoConfigStore/EtcdStore.h"
 #include "etcd/etcdserver/etcdserverpb/rpc.grpc.pb.h"
 
@@ -26,12 +29,15 @@ class EtcdClient {
   // "etcd HOST:PORT[,...]", for messages.
   const std::string& Where() const { return where_; }
 
-  // Reads. A read that cannot reach a member is tried again until the
-  // request's time is up, so a failover between members goes unnoticed.
-  etcdserverpb::RangeResponse Range(const etcdserverpb::RangeRequest& request);
+  // A request that cannot reach a member is tried again until its time is
+  // up, so a failover between members goes unnoticed.
   // "retry": the request may be sent twice (puts of the same bytes, or a
   // transaction guarded by compares that a second attempt would fail).
   etcdserverpb::TxnResponse Txn(const etcdserverpb::TxnRequest& request, bool retry);
+  // Reads, with the reply kept as received (EtcdWire.h); a transaction sent
+  // this way must only read.
+  void Read(const etcdserverpb::RangeRequest& request, etcdwire::Reply* reply);
+  void Read(const etcdserverpb::TxnRequest& request, etcdwire::Reply* reply);
 
   std::int64_t LeaseGrant(std::int64_t ttlSeconds);
   void LeaseKeepAlive(std::int64_t lease);
@@ -50,11 +56,16 @@ class EtcdClient {
   template <typename Call>
   grpc::Status Invoke(const Call& call, bool retry);
   void Authenticate(std::chrono::system_clock::time_point deadline);
+  template <typename Request>
+  void Receive(const grpc::internal::RpcMethod& method, const Request& request,
+               etcdwire::Reply* reply);
 
   EtcdStoreOptions options_;
   std::string where_;
   std::shared_ptr<grpc::Channel> channel_;
   std::unique_ptr<etcdserverpb::KV::Stub> kv_;
+  std::unique_ptr<grpc::internal::RpcMethod> rangeMethod_;
+  std::unique_ptr<grpc::internal::RpcMethod> txnMethod_;
   std::unique_ptr<etcdserverpb::Lease::Stub> lease_;
   std::unique_ptr<etcdserverpb::Watch::Stub> watch_;
   std::unique_ptr<etcdserverpb::Auth::Stub> auth_;

@@ -34,6 +34,7 @@
 #include "../ObjectCodec.h"
 #include "EtcdClient.h"
 #include "EtcdLayout.h"
+#include "EtcdWire.h"
 #include "TavoConfigStore/EtcdStore.h"
 
 namespace TavoConfigStore {
@@ -68,12 +69,13 @@ std::string NewId() {
 std::string PointerValue(const std::string& gen, const std::string& token) {
   return gen + '\0' + token;
 }
-std::string GenerationOf(const std::string& pointerValue) {
-  return pointerValue.substr(0, pointerValue.find('\0'));
+std::string GenerationOf(std::string_view pointerValue) {
+  return std::string(pointerValue.substr(0, pointerValue.find('\0')));
 }
-std::string TokenOf(const std::string& pointerValue) {
+std::string TokenOf(std::string_view pointerValue) {
   const std::size_t zero = pointerValue.find('\0');
-  return zero == std::string::npos ? std::string() : pointerValue.substr(zero + 1);
+  return zero == std::string_view::npos ? std::string()
+                                        : std::string(pointerValue.substr(zero + 1));
 }
 
 struct Order {
@@ -274,7 +276,7 @@ class EtcdStore final : public ConfigStore {
     }
     return Reading([&]() -> std::shared_ptr<ConfigStoreObject> {
       std::vector<Entry> entries;
-      etcdserverpb::RangeResponse reply;
+      etcdwire::Reply reply;
       const Pointers pointers = ReadCollection(collection, &id.InstanceId(), &reply, &entries);
       const Current* current = Find(pointers, collection);
       Observe(collection, current ? *current : Current());
@@ -438,8 +440,9 @@ class EtcdStore final : public ConfigStore {
   // The pointer of "collection", or of every collection when it is "", as
   // the cluster has them now.
   Pointers ReadPointers(const std::string& collection) {
-    const etcdserverpb::RangeResponse reply = client_.Range(PointersRequest(collection));
-    return PointersOf(reply, reply.header().revision());
+    etcdwire::Reply reply;
+    client_.Read(PointersRequest(collection), &reply);
+    return PointersOf(reply.ranges[0], reply.revision);
   }
 
   RangeRequest PointersRequest(const std::string& collection) const {
@@ -453,15 +456,15 @@ class EtcdStore final : public ConfigStore {
     return request;
   }
 
-  Pointers PointersOf(const etcdserverpb::RangeResponse& reply, std::int64_t revision) const {
+  Pointers PointersOf(const etcdwire::Range& range, std::int64_t revision) const {
     Pointers pointers;
     pointers.revision = revision;
-    for (const auto& kv : reply.kvs()) {
+    for (const etcdwire::KeyValue& kv : range.kvs) {
       Current current;
-      current.gen = GenerationOf(kv.value());
-      current.token = TokenOf(kv.value());
-      current.version = kv.mod_revision();
-      pointers.byCollection.emplace(kv.key().substr(keys_.Pointers().size()), std::move(current));
+      current.gen = GenerationOf(kv.value);
+      current.token = TokenOf(kv.value);
+      current.version = kv.modRevision;
+      pointers.byCollection.emplace(kv.key.substr(keys_.Pointers().size()), std::move(current));
     }
     return pointers;
   }
@@ -472,7 +475,7 @@ class EtcdStore final : public ConfigStore {
   // pointer, in one request; a second is needed only when a commit has
   // moved the pointer since.
   Pointers ReadCollection(const std::string& collection, const std::string* instance,
-                          etcdserverpb::RangeResponse* reply, std::vector<Entry>* entries) {
+                          etcdwire::Reply* reply, std::vector<Entry>* entries) {
     auto last = lastGen_.find(collection);
     Pointers pointers;
     if (last == lastGen_.end()) {
@@ -481,15 +484,14 @@ class EtcdStore final : public ConfigStore {
       TxnRequest txn;
       *txn.add_success()->mutable_request_range() = PointersRequest(collection);
       *txn.add_success()->mutable_request_range() = GenerationRequest(last->second, instance);
-      etcdserverpb::TxnResponse both = client_.Txn(txn, true);
-      if (both.responses_size() != 2) {
+      client_.Read(txn, reply);
+      if (reply->ranges.size() != 2) {
         client_.Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unexpected reply"), "read");
       }
-      pointers = PointersOf(both.responses(0).response_range(), both.header().revision());
+      pointers = PointersOf(reply->ranges[0], reply->revision);
       const Current* current = Find(pointers, collection);
       if (current && current->gen == last->second) {
-        reply->Swap(both.mutable_responses(1)->mutable_response_range());
-        ParseGeneration(last->second, *reply, entries);
+        ParseGeneration(last->second, reply->ranges[1], entries);
         return pointers;
       }
     }
@@ -514,14 +516,14 @@ class EtcdStore final : public ConfigStore {
   // "revision", in the order the cluster keeps the keys. Their bytes stay
   // in "*reply".
   void ReadGeneration(const std::string& gen, const std::string* instance, std::int64_t revision,
-                      etcdserverpb::RangeResponse* reply, std::vector<Entry>* entries) {
+                      etcdwire::Reply* reply, std::vector<Entry>* entries) {
     RangeRequest request = GenerationRequest(gen, instance);
     request.set_revision(revision);
-    *reply = client_.Range(request);
-    ParseGeneration(gen, *reply, entries);
+    client_.Read(request, reply);
+    ParseGeneration(gen, reply->ranges[0], entries);
   }
 
-  void ParseGeneration(const std::string& gen, const etcdserverpb::RangeResponse& reply,
+  void ParseGeneration(const std::string& gen, const etcdwire::Range& range,
                        std::vector<Entry>* entries) const {
     const std::string base = keys_.Generation(gen);
     // Keys are compared as views against a suffix made once: a string built
@@ -529,18 +531,18 @@ class EtcdStore final : public ConfigStore {
     const std::string firstPart = Keys::PartSuffix(0);
     std::string want;
     std::int64_t headRevision = 0;
-    const auto& kvs = reply.kvs();
-    for (int i = 0; i < kvs.size(); ++i) {
-      std::string_view key(kvs[i].key());
+    const std::vector<etcdwire::KeyValue>& kvs = range.kvs;
+    for (std::size_t i = 0; i < kvs.size(); ++i) {
+      std::string_view key(kvs[i].key);
       key.remove_prefix(base.size());
       if (key.empty()) {
-        headRevision = kvs[i].create_revision();
+        headRevision = kvs[i].createRevision;
         continue;
       }
       const std::size_t zero = key.find('\0');
       Entry entry;
       Header header;
-      std::string_view value(kvs[i].value());
+      std::string_view value(kvs[i].value);
       if (zero == std::string_view::npos) continue;  // not an object's key
       const std::string_view escaped = key.substr(0, zero);
       if (escaped.find('\1') == std::string_view::npos) {
@@ -557,9 +559,8 @@ class EtcdStore final : public ConfigStore {
         if (header.parts > 1) entry.joined.assign(value);
         for (std::uint64_t part = 1; part < header.parts && entry.damage.empty(); ++part) {
           want.assign(key.substr(0, zero + 1)).append(Keys::PartSuffix(part));
-          if (i + 1 < kvs.size() &&
-              std::string_view(kvs[i + 1].key()).substr(base.size()) == want) {
-            entry.joined += kvs[++i].value();
+          if (i + 1 < kvs.size() && kvs[i + 1].key.substr(base.size()) == want) {
+            entry.joined += kvs[++i].value;
           } else {
             entry.damage = "part " + std::to_string(part) + " of the object is missing";
           }
@@ -567,13 +568,12 @@ class EtcdStore final : public ConfigStore {
         if (header.parts > 1) entry.body = entry.joined;
         entry.order.index = header.index;
         entry.order.revision = header.kind == OrderKind::kWritten       ? header.revision
-                               : header.kind == OrderKind::kOwnRevision ? kvs[i].mod_revision()
+                               : header.kind == OrderKind::kOwnRevision ? kvs[i].modRevision
                                                                         : -1;  // set below
       }
       // Parts past the ones the header announced belong to nothing.
       while (i + 1 < kvs.size() &&
-             std::string_view(kvs[i + 1].key()).substr(base.size(), zero + 1) ==
-                 key.substr(0, zero + 1)) {
+             kvs[i + 1].key.substr(base.size(), zero + 1) == key.substr(0, zero + 1)) {
         ++i;
       }
       entries->push_back(std::move(entry));
@@ -640,7 +640,7 @@ class EtcdStore final : public ConfigStore {
     const ConfigStoreObjectId& want = filter.Id();
     const std::string* instance = want.InstanceId().empty() ? nullptr : &want.InstanceId();
     const std::string exact = ExactCollection(want);
-    etcdserverpb::RangeResponse reply;
+    etcdwire::Reply reply;
     std::vector<Entry> entries;
     const Pointers pointers =
         exact.empty() ? ReadPointers(exact) : ReadCollection(exact, instance, &reply, &entries);
@@ -934,7 +934,7 @@ class EtcdStore final : public ConfigStore {
         const std::string& gen = fresh[name];
         std::size_t written = 0;
         if (current && !pending.cleared) {
-          etcdserverpb::RangeResponse reply;
+          etcdwire::Reply reply;
           std::vector<Entry> entries;
           ReadGeneration(current->gen, nullptr, now.revision, &reply, &entries);
           for (const Entry& entry : entries) {
@@ -1014,20 +1014,24 @@ class EtcdStore final : public ConfigStore {
       range->set_key(prefix);
       range->set_range_end(PrefixEnd(prefix));
     }
-    const etcdserverpb::TxnResponse reply = client_.Txn(snapshot, true);
-    std::set<std::string> live;
-    for (const auto& kv : reply.responses(1).response_range().kvs()) {
-      live.insert(kv.key().substr(keys_.Writers().size()));
+    etcdwire::Reply reply;
+    client_.Read(snapshot, &reply);
+    if (reply.ranges.size() != 3) {
+      client_.Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unexpected reply"), "read");
     }
-    for (const auto& kv : reply.responses(2).response_range().kvs()) {
-      live.insert(GenerationOf(kv.value()));
+    std::set<std::string> live;
+    for (const etcdwire::KeyValue& kv : reply.ranges[1].kvs) {
+      live.insert(std::string(kv.key.substr(keys_.Writers().size())));
+    }
+    for (const etcdwire::KeyValue& kv : reply.ranges[2].kvs) {
+      live.insert(GenerationOf(kv.value));
     }
     std::vector<RequestOp> ops;
-    for (const auto& kv : reply.responses(0).response_range().kvs()) {
-      const std::string gen = kv.key().substr(keys_.Registered().size());
+    for (const etcdwire::KeyValue& kv : reply.ranges[0].kvs) {
+      const std::string gen(kv.key.substr(keys_.Registered().size()));
       if (live.count(gen)) continue;
       AddDeletePrefix(&ops, keys_.Generation(gen));
-      AddDelete(&ops, kv.key());
+      AddDelete(&ops, std::string(kv.key));
       if (ops.size() >= static_cast<std::size_t>(etcdlayout::kBatchOps))
         client_.Txn(TxnOf(&ops), true);
     }
