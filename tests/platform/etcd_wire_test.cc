@@ -71,6 +71,8 @@ std::vector<Row> Rows(const etcdserverpb::RangeResponse& range) {
   return rows;
 }
 
+// A copy of exactly the reply's size, so that the sanitizers see a read past
+// its end.
 bool Parse(const std::string& bytes, Reply* reply, bool txn) {
   reply->bytes = grpc::Slice(bytes);
   return txn ? ParseTxnResponse(reply) : ParseRangeResponse(reply);
@@ -99,8 +101,10 @@ TEST(EtcdWire, ReadsATransactionsRangesInOrder) {
   txn.add_responses()->mutable_response_put()->mutable_header()->set_revision(9);
   txn.add_responses()->mutable_response_range();
   *txn.add_responses()->mutable_response_range()->add_kvs() = Kv("k2", "", 6);
+  // ... and a field of a later etcd, which is skipped.
+  const std::string succeeded = txn.SerializeAsString() + Varint(9 << 3) + Varint(5);
   Reply reply;
-  ASSERT_TRUE(Parse(txn.SerializeAsString(), &reply, true));
+  ASSERT_TRUE(Parse(succeeded, &reply, true));
   EXPECT_EQ(reply.revision, 9);
   EXPECT_TRUE(reply.succeeded);
   ASSERT_EQ(reply.ranges.size(), 4u);
@@ -110,7 +114,8 @@ TEST(EtcdWire, ReadsATransactionsRangesInOrder) {
         << i;
   }
   txn.set_succeeded(false);
-  ASSERT_TRUE(Parse(txn.SerializeAsString(), &reply, true));
+  const std::string failed = txn.SerializeAsString();
+  ASSERT_TRUE(Parse(failed, &reply, true));
   EXPECT_FALSE(reply.succeeded);
 }
 
@@ -129,7 +134,7 @@ TEST(EtcdWire, CutOrDamagedRepliesAgreeWithProtobuf) {
     for (std::size_t at = 0; at < bytes.size(); ++at) {
       for (unsigned char x : {0x01, 0x07, 0x80, 0xff}) {
         variants.push_back(bytes);
-        variants.back()[at] = static_cast<char>(variants.back()[at] ^ x);
+        variants.back()[at] = static_cast<char>(bytes[at] ^ x);
       }
     }
     for (const std::string& variant : variants) {
