@@ -893,13 +893,15 @@ class EtcdStore final : public ConfigStore {
                          const std::string& token) {
     const std::int64_t lease = client_.LeaseGrant(kLeaseSeconds);
     std::map<std::string, std::string> fresh;  // collection -> its new generation
+    // The registrations go with the first batch of objects, in one
+    // transaction: a generation never has objects without being registered,
+    // so a later writer finds whatever a dead one left.
     std::vector<RequestOp> ops;
     for (const std::string& name : touched) {
       fresh[name] = NewId();
       AddPut(&ops, keys_.Writers() + fresh[name], name, lease);
       AddPut(&ops, keys_.Registered() + fresh[name], name);
     }
-    client_.Txn(TxnOf(&ops), true);
     // Removes the new generations, unless a switch sent earlier took effect
     // after all (a request may be applied after its sender gave up on it).
     // The switch removes the writer keys, so it is compared on them; false
