@@ -197,38 +197,28 @@ void EncodeObject(const ConfigStoreObject& object, std::string* out) {
 std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId&& id, const unsigned char* data,
                                                 std::size_t size, BodyArena* arena) {
   // Check everything now, so that damage is reported by the read that
-  // fetched it and the object's lazy readers only meet sound bytes. The walk
-  // notes where the sub-objects are, so they can be built right away while
-  // the body is still in the cache.
+  // fetched it and the object's lazy readers only meet sound bytes.
   Reader r(data, size);
   if (r.Byte() != kFormat) Reader::Corrupt("unknown format");
   const std::size_t valuesBegin = 1;
   r.SkipValues();
   const std::size_t subsBegin = size - r.Left();
   const std::size_t count = r.Count();
-  SubSpan spans[kEagerSubs];
   for (std::size_t i = 0; i < count; ++i) {
-    SubSpan span;
-    span.array = static_cast<std::size_t>(
-        reinterpret_cast<const unsigned char*>(r.Bytes(&span.arraySize)) - data);
-    span.key = static_cast<std::size_t>(
-        reinterpret_cast<const unsigned char*>(r.Bytes(&span.keySize)) - data);
-    span.values = size - r.Left();
+    std::size_t ignored = 0;
+    r.Bytes(&ignored);  // array
+    r.Bytes(&ignored);  // key
     r.SkipValues();
-    span.valuesSize = size - r.Left() - span.values;
-    if (i < kEagerSubs) spans[i] = span;
   }
   if (r.Left() != 0) Reader::Corrupt("trailing bytes");
 
-  return Access::NewObject(std::move(id), data, size, valuesBegin, subsBegin, count,
-                           count <= kEagerSubs ? spans : nullptr, arena);
+  return Access::NewObject(std::move(id), data, size, valuesBegin, subsBegin, count, arena);
 }
 
 std::shared_ptr<ConfigStoreObject> Access::NewObject(ConfigStoreObjectId&& id,
                                                      const unsigned char* body, std::size_t size,
                                                      std::size_t valuesBegin, std::size_t subsBegin,
-                                                     std::size_t subs, const SubSpan* spans,
-                                                     BodyArena* arena) {
+                                                     std::size_t subs, BodyArena* arena) {
   // The sub-objects live next to the body: listing them costs no allocation.
   unsigned char* copy = nullptr;
   BodyArena own;
@@ -240,18 +230,6 @@ std::shared_ptr<ConfigStoreObject> Access::NewObject(ConfigStoreObjectId&& id,
   object->encoded_ = copy + valuesBegin;
   object->encodedSize_ = subsBegin - valuesBegin;
   object->encodedSubs_ = copy + subsBegin;
-  if (spans != nullptr) {
-    for (std::size_t i = 0; i < subs; ++i) {
-      Body::Sub* sub = new (block->subs + i) Body::Sub();
-      block->built = i + 1;
-      const auto* at = reinterpret_cast<const char*>(copy);
-      sub->array = std::string_view(at + spans[i].array, spans[i].arraySize);
-      sub->key = std::string_view(at + spans[i].key, spans[i].keySize);
-      sub->object.encoded_ = copy + spans[i].values;
-      sub->object.encodedSize_ = spans[i].valuesSize;
-    }
-    object->subsBuilt_.store(true, std::memory_order_relaxed);
-  }
   object->body_ = std::move(block);
   return object;
 }

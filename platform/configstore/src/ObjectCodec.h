@@ -83,28 +83,16 @@ class SubReader {
   std::size_t left_;
 };
 
-// Where one sub-object lies in a body, as offsets from its start.
-struct SubSpan {
-  std::size_t array = 0;
-  std::size_t arraySize = 0;
-  std::size_t key = 0;
-  std::size_t keySize = 0;
-  std::size_t values = 0;
-  std::size_t valuesSize = 0;
-};
-// Objects with at most this many sub-objects get them built when decoded;
-// others build them on first access.
-constexpr std::size_t kEagerSubs = 16;
-
 // Builds objects over encoded memory; the friend the object classes allow.
 class Access {
  public:
-  // "subs" sub-objects, built at once when "spans" gives where they lie.
+  // With room for "subs" sub-objects, built on first access: a scan that
+  // reads one value of each object never pays for them.
   static std::shared_ptr<ConfigStoreObject> NewObject(ConfigStoreObjectId&& id,
                                                       const unsigned char* body, std::size_t size,
                                                       std::size_t valuesBegin,
                                                       std::size_t subsBegin, std::size_t subs,
-                                                      const SubSpan* spans, BodyArena* arena);
+                                                      BodyArena* arena);
 };
 
 // The bodies of the objects of one listing, placed one after another in
