@@ -139,8 +139,8 @@ class Reader {
     return static_cast<long long>((z >> 1) ^ (0 - (z & 1)));
   }
 
-  // Steps over one value and returns its kind.
-  unsigned char SkipPayload() {
+  // Steps over one value.
+  void SkipPayload() {
     const unsigned char kind = Byte();
     std::size_t size;
     switch (kind) {
@@ -153,7 +153,6 @@ class Reader {
       default:
         Corrupt("unknown value kind");
     }
-    return kind;
   }
 
   void SkipValues() {
