@@ -187,11 +187,7 @@ etcdserverpb::TxnResponse EtcdClient::Txn(const etcdserverpb::TxnRequest& reques
   etcdserverpb::TxnResponse response;
   const grpc::Status status = Invoke(
       [&](grpc::ClientContext* context) { return kv_->Txn(context, request, &response); }, retry);
-  if (!status.ok()) {
-    const bool reads = std::all_of(request.success().begin(), request.success().end(),
-                                   [](const auto& op) { return op.has_request_range(); });
-    Fail(status, reads && request.compare().empty() ? "read" : "write");
-  }
+  if (!status.ok()) Fail(status, "write");  // reads go through Read
   return response;
 }
 

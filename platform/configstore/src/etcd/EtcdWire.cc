@@ -142,6 +142,25 @@ bool ParseRange(std::string_view bytes, Range* range, std::int64_t* revision) {
   return true;
 }
 
+// ResponseOp: response_range = 1 (the others are not read). A response
+// inside a transaction carries no revision of its own that is read.
+bool ParseResponseOp(std::string_view bytes, Range* range) {
+  Reader r(bytes);
+  while (!r.Done()) {
+    std::uint64_t number = 0;
+    int type = 0;
+    std::string_view field;
+    std::int64_t ignored = 0;
+    if (!r.Field(&number, &type)) return false;
+    if (number != 1) {
+      if (!r.Skip(type)) return false;
+    } else if (type != kBytes || !r.Bytes(&field) || !ParseRange(field, range, &ignored)) {
+      return false;
+    }
+  }
+  return true;
+}
+
 std::string_view View(const grpc::Slice& slice) {
   return std::string_view(reinterpret_cast<const char*>(slice.begin()), slice.size());
 }
@@ -153,8 +172,7 @@ bool ParseRangeResponse(Reply* reply) {
   return ParseRange(View(reply->bytes), &reply->ranges[0], &reply->revision);
 }
 
-// TxnResponse: header = 1, succeeded = 2, responses = 3; in a ResponseOp,
-// response_range = 1 (the others are not read).
+// TxnResponse: header = 1, succeeded = 2, responses = 3.
 bool ParseTxnResponse(Reply* reply) {
   reply->ranges.clear();
   reply->succeeded = false;
@@ -179,22 +197,7 @@ bool ParseTxnResponse(Reply* reply) {
       if (!ParseHeader(field, &reply->revision)) return false;
       continue;
     }
-    Range& range = reply->ranges.emplace_back();
-    Reader op(field);
-    while (!op.Done()) {
-      std::uint64_t opNumber = 0;
-      int opType = 0;
-      std::string_view opField;
-      if (!op.Field(&opNumber, &opType)) return false;
-      if (opNumber != 1) {
-        if (!op.Skip(opType)) return false;
-        continue;
-      }
-      std::int64_t ignored = 0;  // a response inside a transaction has no header of its own
-      if (opType != kBytes || !op.Bytes(&opField) || !ParseRange(opField, &range, &ignored)) {
-        return false;
-      }
-    }
+    if (!ParseResponseOp(field, &reply->ranges.emplace_back())) return false;
   }
   return true;
 }
