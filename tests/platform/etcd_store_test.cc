@@ -252,6 +252,34 @@ TEST(EtcdStoreTest, ADeadWritersGenerationIsRemovedByTheNextWriter) {
   EXPECT_EQ(Dump(*store), std::vector<std::string>{"newer=2"});
 }
 
+// A writer renews its one lease from replace to replace rather than granting
+// one each time, and gets a new one when it has gone.
+TEST(EtcdStoreTest, AWriterKeepsOneLeaseAcrossReplaces) {
+  EtcdCluster& etcd = SharedCluster();
+  auto leases = [&] {
+    std::istringstream out(etcd.Etcdctl({"lease", "list"}));
+    std::string line;
+    std::vector<std::string> ids;
+    std::getline(out, line);  // "found N leases"
+    while (out >> line) ids.push_back(line);
+    return ids;
+  };
+  for (const std::string& id : leases()) etcd.Etcdctl({"lease", "revoke", id});
+  auto store = OpenStore(etcd.Locator("leases"));
+  for (int i = 0; i < 3; ++i) {
+    Clear(*store);
+    Set(*store, Obj("a", std::to_string(i)));
+  }
+  const std::vector<std::string> kept = leases();
+  ASSERT_EQ(kept.size(), 1u);
+  etcd.Etcdctl({"lease", "revoke", kept[0]});
+  Clear(*store);
+  Set(*store, Obj("a", "after"));
+  EXPECT_EQ(Dump(*store), std::vector<std::string>{"a=after"});
+  EXPECT_EQ(leases().size(), 1u);
+  EXPECT_THAT(RawKeys(etcd, "leases", "w/"), ::testing::IsEmpty());
+}
+
 // With no member answering, every operation fails within the locator's
 // timeout, naming the cluster, with etcd's code for it; so does the library's
 // Reset, which goes on past a failed deletion and so can fail only at its

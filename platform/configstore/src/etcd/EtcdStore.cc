@@ -22,12 +22,15 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstdio>
+#include <deque>
+#include <future>
 #include <map>
 #include <mutex>
 #include <optional>
 #include <random>
 #include <set>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "../DamagedObject.h"
@@ -54,6 +57,7 @@ constexpr int kCompactedCode = kErrorEtcdBase + static_cast<int>(grpc::StatusCod
 constexpr int kDeadlineCode =
     kErrorEtcdBase + static_cast<int>(grpc::StatusCode::DEADLINE_EXCEEDED);
 constexpr int kUnavailableCode = kErrorEtcdBase + static_cast<int>(grpc::StatusCode::UNAVAILABLE);
+constexpr int kLeaseGoneCode = kErrorEtcdBase + static_cast<int>(grpc::StatusCode::NOT_FOUND);
 
 std::string NewId() {
   static std::mutex mu;
@@ -96,6 +100,10 @@ struct Current {
 struct Pointers {
   std::int64_t revision = 0;
   std::map<std::string, Current> byCollection;
+  // Read by a commit only: generations at that revision whose writer died
+  // before making them current (registered, no live writer, no pointer).
+  // Nothing can make such a generation current any more.
+  std::vector<std::string> orphans;
 };
 
 const Current* Find(const Pointers& pointers, const std::string& collection) {
@@ -168,6 +176,70 @@ TxnRequest TxnOf(std::vector<RequestOp>* ops) {
   ops->clear();
   return txn;
 }
+
+// Writes a new generation's objects in transactions of at most kBatchOps
+// puts and kBatchBytes. The first batch, which registers the generation, is
+// written alone; after it up to kBatchesInFlight are on their way at once
+// while the next is built. Their order does not matter (no reader looks at a
+// generation before the switch), and etcd syncs batches that arrive together
+// to disk together.
+class BatchWriter {
+ public:
+  static constexpr std::size_t kBatchesInFlight = 4;
+
+  explicit BatchWriter(EtcdClient& client) : client_(client) {}
+  // Waits for every batch still on its way: what is abandoned after a
+  // failure must not be written afterwards by a batch of its own.
+  ~BatchWriter() {
+    for (std::future<void>& batch : inFlight_) batch.wait();
+  }
+  BatchWriter(const BatchWriter&) = delete;
+  BatchWriter& operator=(const BatchWriter&) = delete;
+
+  // Adds a put that takes about "size" bytes of a request.
+  void Put(std::string key, std::string value, std::size_t size, std::int64_t lease = 0) {
+    if (bytes_ + size > etcdlayout::kBatchBytes) Send();
+    AddPut(&ops_, std::move(key), std::move(value), lease);
+    bytes_ += size;
+    if (ops_.size() >= static_cast<std::size_t>(etcdlayout::kBatchOps) ||
+        bytes_ >= etcdlayout::kBatchBytes) {
+      Send();
+    }
+  }
+
+  // Sends what is left and waits for every batch; throws the first failure.
+  void Finish() {
+    Send();
+    while (!inFlight_.empty()) Collect();
+  }
+
+ private:
+  void Send() {
+    if (ops_.empty()) return;
+    TxnRequest txn = TxnOf(&ops_);
+    bytes_ = 0;
+    if (!registered_) {
+      client_.Txn(txn, true);
+      registered_ = true;
+      return;
+    }
+    if (inFlight_.size() >= kBatchesInFlight) Collect();
+    inFlight_.push_back(std::async(std::launch::async,
+                                   [this, txn = std::move(txn)] { client_.Txn(txn, true); }));
+  }
+
+  void Collect() {
+    std::future<void> oldest = std::move(inFlight_.front());
+    inFlight_.pop_front();
+    oldest.get();
+  }
+
+  EtcdClient& client_;
+  std::vector<RequestOp> ops_;
+  std::size_t bytes_ = 0;
+  bool registered_ = false;
+  std::deque<std::future<void>> inFlight_;
+};
 
 // Wakes WaitForChange when another writer commits: a watch on the pointers,
 // which every commit rewrites, read by a thread of its own.
@@ -728,7 +800,7 @@ class EtcdStore final : public ConfigStore {
     }
     if (pendingNames.empty()) return;
     for (int attempt = 1;; ++attempt) {
-      Pointers now = ReadPointers(std::string());
+      Pointers now = ReadCommitState();
       bool readAny = false;
       std::vector<std::string> touched;
       for (const std::string& name : pendingNames) {
@@ -862,46 +934,28 @@ class EtcdStore final : public ConfigStore {
     alive->set_version(0);
   }
 
-  // Writes the puts of a batch once it is full (or "force").
-  void Flush(std::vector<RequestOp>* ops, std::size_t* bytes, bool force) {
-    if (ops->empty() || (!force && ops->size() < static_cast<std::size_t>(etcdlayout::kBatchOps) &&
-                         *bytes < etcdlayout::kBatchBytes)) {
-      return;
-    }
-    client_.Txn(TxnOf(ops), true);
-    *bytes = 0;
-  }
-
   void WriteObject(const std::string& gen, const std::string& instance, Header header,
-                   std::string_view body, std::vector<RequestOp>* ops, std::size_t* bytes) {
+                   std::string_view body, BatchWriter* batches) {
     const std::string object = keys_.Object(gen, instance);
     header.parts = std::max<std::size_t>(
         1, (body.size() + etcdlayout::kPartBytes - 1) / etcdlayout::kPartBytes);
     for (std::size_t part = 0; part < header.parts; ++part) {
       const std::string_view piece =
           body.substr(part * etcdlayout::kPartBytes, etcdlayout::kPartBytes);
-      const std::size_t size = piece.size() + object.size() + 32;
-      if (*bytes + size > etcdlayout::kBatchBytes) Flush(ops, bytes, true);
-      AddPut(ops, object + Keys::PartSuffix(part),
-             part == 0 ? FirstPart(header, piece) : std::string(piece));
-      *bytes += size;
-      Flush(ops, bytes, false);
+      batches->Put(object + Keys::PartSuffix(part),
+                   part == 0 ? FirstPart(header, piece) : std::string(piece),
+                   piece.size() + object.size() + 32);
     }
   }
 
   bool CommitGenerations(const std::vector<std::string>& touched, const Pointers& now,
                          const std::string& token) {
-    const std::int64_t lease = client_.LeaseGrant(kLeaseSeconds);
+    const std::int64_t lease = TakeLease();
     std::map<std::string, std::string> fresh;  // collection -> its new generation
     // The registrations go with the first batch of objects, in one
     // transaction: a generation never has objects without being registered,
     // so a later writer finds whatever a dead one left.
-    std::vector<RequestOp> ops;
-    for (const std::string& name : touched) {
-      fresh[name] = NewId();
-      AddPut(&ops, keys_.Writers() + fresh[name], name, lease);
-      AddPut(&ops, keys_.Registered() + fresh[name], name);
-    }
+    for (const std::string& name : touched) fresh[name] = NewId();
     // Removes the new generations, unless a switch sent earlier took effect
     // after all (a request may be applied after its sender gave up on it).
     // The switch removes the writer keys, so it is compared on them; false
@@ -928,8 +982,14 @@ class EtcdStore final : public ConfigStore {
 
     std::map<std::string, bool> empty;
     try {
-      std::size_t bytes = 0;
-      auto lastKeepAlive = std::chrono::steady_clock::now();
+      // Left before "abandon" runs, so that no batch is still on its way.
+      BatchWriter batches(client_);
+      for (const auto& [name, gen] : fresh) {
+        const std::size_t size = keys_.Writers().size() + gen.size() + name.size() + 32;
+        batches.Put(keys_.Writers() + gen, name, size, lease);
+        batches.Put(keys_.Registered() + gen, name, size);
+      }
+      auto lastKeepAlive = leaseRenewed_;
       for (const std::string& name : touched) {
         const Pending& pending = txn_.collections.at(name);
         const Current* current = Find(now, name);
@@ -947,7 +1007,7 @@ class EtcdStore final : public ConfigStore {
             header.kind = OrderKind::kWritten;
             header.revision = entry.order.revision;
             header.index = entry.order.index;
-            WriteObject(gen, entry.instance, header, entry.body, &ops, &bytes);
+            WriteObject(gen, entry.instance, header, entry.body, &batches);
             ++written;
           }
         }
@@ -955,7 +1015,7 @@ class EtcdStore final : public ConfigStore {
           Header header;
           header.kind = OrderKind::kHeadRevision;
           header.index = put->second.seq;
-          WriteObject(gen, put->first, header, put->second.body, &ops, &bytes);
+          WriteObject(gen, put->first, header, put->second.body, &batches);
           ++written;
           if (std::chrono::steady_clock::now() - lastKeepAlive >
               std::chrono::seconds(kLeaseSeconds / 4)) {
@@ -965,13 +1025,14 @@ class EtcdStore final : public ConfigStore {
         }
         empty[name] = written == 0;
       }
-      Flush(&ops, &bytes, true);
+      batches.Finish();
     } catch (...) {
       abandon();
       throw;
     }
 
     TxnRequest txn;
+    std::vector<RequestOp> ops;
     std::string anyWritten;
     for (const std::string& name : touched) {
       const Current* current = Find(now, name);
@@ -998,42 +1059,75 @@ class EtcdStore final : public ConfigStore {
     if (!Switch(txn, anyWritten, token, lease)) {
       return !abandon() && Holds(anyWritten, token);
     }
+    // The switch removed this commit's writer keys: the lease holds nothing
+    // now and serves the next commit.
+    lease_ = lease;
     try {
-      client_.LeaseRevoke(lease);
-      RemoveOrphans();
+      RemoveOrphans(now.orphans);
     } catch (const ConfigStoreException&) {
       // Tidying only: the commit stands, and a later writer tidies up.
     }
     return true;
   }
 
-  // Generations whose writer died before making them current: registered,
-  // with no live writer and no collection pointing at them.
-  void RemoveOrphans() {
+  // The lease for a commit's writer keys. The one the last commit used is
+  // renewed rather than a new one granted: a grant and a revocation are each
+  // a write etcd syncs to disk, a renewal is not. A commit hands the lease
+  // back only once its switch has removed its writer keys; one that failed
+  // keeps it (and revokes it or lets it run out), as a writer key still on a
+  // lease that goes on being renewed would keep its generation from ever
+  // being tidied.
+  std::int64_t TakeLease() {
+    const std::int64_t kept = std::exchange(lease_, 0);
+    const auto now = std::chrono::steady_clock::now();
+    if (kept != 0) {
+      try {
+        client_.LeaseKeepAlive(kept);
+        leaseRenewed_ = now;
+        return kept;
+      } catch (const ConfigStoreException& e) {
+        // Run out or revoked: a new one. Anything else is the cluster's.
+        if (e.Code() != kLeaseGoneCode) throw;
+      }
+    }
+    const std::int64_t lease = client_.LeaseGrant(kLeaseSeconds);
+    leaseRenewed_ = now;
+    return lease;
+  }
+
+  // The pointers, and the generations a dead writer left, in one read.
+  Pointers ReadCommitState() {
     TxnRequest snapshot;
-    for (const std::string& prefix : {keys_.Registered(), keys_.Writers(), keys_.Pointers()}) {
+    *snapshot.add_success()->mutable_request_range() = PointersRequest(std::string());
+    for (const std::string& prefix : {keys_.Registered(), keys_.Writers()}) {
       RangeRequest* range = snapshot.add_success()->mutable_request_range();
       range->set_key(prefix);
       range->set_range_end(PrefixEnd(prefix));
+      range->set_keys_only(true);
     }
     etcdwire::Reply reply;
     client_.Read(snapshot, &reply);
     if (reply.ranges.size() != 3) {
       client_.Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unexpected reply"), "read");
     }
+    Pointers now = PointersOf(reply.ranges[0], reply.revision);
     std::set<std::string> live;
-    for (const etcdwire::KeyValue& kv : reply.ranges[1].kvs) {
+    for (const etcdwire::KeyValue& kv : reply.ranges[2].kvs) {
       live.insert(std::string(kv.key.substr(keys_.Writers().size())));
     }
-    for (const etcdwire::KeyValue& kv : reply.ranges[2].kvs) {
-      live.insert(GenerationOf(kv.value));
+    for (const auto& [name, current] : now.byCollection) live.insert(current.gen);
+    for (const etcdwire::KeyValue& kv : reply.ranges[1].kvs) {
+      std::string gen(kv.key.substr(keys_.Registered().size()));
+      if (!live.count(gen)) now.orphans.push_back(std::move(gen));
     }
+    return now;
+  }
+
+  void RemoveOrphans(const std::vector<std::string>& orphans) {
     std::vector<RequestOp> ops;
-    for (const etcdwire::KeyValue& kv : reply.ranges[0].kvs) {
-      const std::string gen(kv.key.substr(keys_.Registered().size()));
-      if (live.count(gen)) continue;
+    for (const std::string& gen : orphans) {
       AddDeletePrefix(&ops, keys_.Generation(gen));
-      AddDelete(&ops, std::string(kv.key));
+      AddDelete(&ops, keys_.Registered() + gen);
       if (ops.size() >= static_cast<std::size_t>(etcdlayout::kBatchOps))
         client_.Txn(TxnOf(&ops), true);
     }
@@ -1051,6 +1145,10 @@ class EtcdStore final : public ConfigStore {
   // The generation each collection read pointed at then (ReadCollection).
   std::map<std::string, std::string> lastGen_;
   std::unique_ptr<ChangeFeed> feed_;
+  // The lease of this store's last successful commit (0: none), left to run
+  // out when the store goes, and when it was last renewed.
+  std::int64_t lease_ = 0;
+  std::chrono::steady_clock::time_point leaseRenewed_;
   std::optional<ConfigStoreException> unreachable_;  // met by the open transaction
 };
 
