@@ -52,6 +52,8 @@ using etcdserverpb::RequestOp;
 using etcdserverpb::TxnRequest;
 
 constexpr std::int64_t kLeaseSeconds = 60;
+// A listing of at least this many objects is read in two halves at once.
+constexpr std::size_t kSplitObjects = 256;
 constexpr int kCommitAttempts = 5;
 constexpr int kCompactedCode = kErrorEtcdBase + static_cast<int>(grpc::StatusCode::OUT_OF_RANGE);
 constexpr int kDeadlineCode =
@@ -118,6 +120,13 @@ struct Entry {
   std::string_view body;
   std::string joined;  // a body stored in several parts, put together
   std::string damage;  // why the object cannot be read, if it cannot
+};
+
+// The replies a read of one collection's objects keeps; entries point into
+// them.
+struct Replies {
+  etcdwire::Reply first;
+  etcdwire::Reply second;  // the second half of a split listing
 };
 
 struct Put {
@@ -224,8 +233,8 @@ class BatchWriter {
       return;
     }
     if (inFlight_.size() >= kBatchesInFlight) Collect();
-    inFlight_.push_back(std::async(std::launch::async,
-                                   [this, txn = std::move(txn)] { client_.Txn(txn, true); }));
+    inFlight_.push_back(
+        std::async(std::launch::async, [this, txn = std::move(txn)] { client_.Txn(txn, true); }));
   }
 
   void Collect() {
@@ -348,8 +357,8 @@ class EtcdStore final : public ConfigStore {
     }
     return Reading([&]() -> std::shared_ptr<ConfigStoreObject> {
       std::vector<Entry> entries;
-      etcdwire::Reply reply;
-      const Pointers pointers = ReadCollection(collection, &id.InstanceId(), &reply, &entries);
+      Replies replies;
+      const Pointers pointers = ReadCollection(collection, &id.InstanceId(), &replies, &entries);
       const Current* current = Find(pointers, collection);
       Observe(collection, current ? *current : Current());
       if (entries.empty()) return nullptr;
@@ -546,24 +555,48 @@ class EtcdStore final : public ConfigStore {
   // generation the collection pointed at last time is asked for with the
   // pointer, in one request; a second is needed only when a commit has
   // moved the pointer since.
+  //
+  // A whole generation listed before is asked for in two halves at once,
+  // split at an object's key remembered from then: etcd reads and sends
+  // the two side by side. Two replies of the same revision are one snapshot;
+  // otherwise the generation is read again at the first one's.
   Pointers ReadCollection(const std::string& collection, const std::string* instance,
-                          etcdwire::Reply* reply, std::vector<Entry>* entries) {
+                          Replies* replies, std::vector<Entry>* entries) {
     auto last = lastGen_.find(collection);
     Pointers pointers;
     if (last == lastGen_.end()) {
       pointers = ReadPointers(collection);
     } else {
+      const std::string& gen = last->second.gen;
+      const std::string* split =
+          instance == nullptr && !last->second.split.empty() ? &last->second.split : nullptr;
       TxnRequest txn;
       *txn.add_success()->mutable_request_range() = PointersRequest(collection);
-      *txn.add_success()->mutable_request_range() = GenerationRequest(last->second, instance);
-      client_.Read(txn, reply);
-      if (reply->ranges.size() != 2) {
+      RangeRequest* head = txn.add_success()->mutable_request_range();
+      *head = GenerationRequest(gen, instance);
+      std::future<void> rest;
+      if (split) {
+        RangeRequest tail = *head;
+        tail.set_key(*split);
+        head->set_range_end(*split);
+        rest = std::async(std::launch::async, [this, tail = std::move(tail), replies] {
+          client_.Read(tail, &replies->second);
+        });
+      }
+      client_.Read(txn, &replies->first);
+      if (rest.valid()) rest.get();
+      const etcdwire::Reply& reply = replies->first;
+      if (reply.ranges.size() != 2) {
         client_.Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unexpected reply"), "read");
       }
-      pointers = PointersOf(reply->ranges[0], reply->revision);
+      pointers = PointersOf(reply.ranges[0], reply.revision);
       const Current* current = Find(pointers, collection);
-      if (current && current->gen == last->second) {
-        ParseGeneration(last->second, reply->ranges[1], entries);
+      if (current && current->gen == gen &&
+          (!split || replies->second.revision == reply.revision)) {
+        std::vector<const etcdwire::Range*> ranges{&reply.ranges[1]};
+        if (split) ranges.push_back(&replies->second.ranges[0]);
+        ParseGeneration(gen, ranges, entries);
+        if (!instance) RememberSplit(collection, *entries);
         return pointers;
       }
     }
@@ -571,10 +604,22 @@ class EtcdStore final : public ConfigStore {
     if (!current) {
       lastGen_.erase(collection);
     } else {
-      lastGen_[collection] = current->gen;
-      ReadGeneration(current->gen, instance, pointers.revision, reply, entries);
+      if (lastGen_[collection].gen != current->gen)
+        lastGen_[collection] = LastRead{current->gen, std::string()};
+      ReadGeneration(current->gen, instance, pointers.revision, &replies->first, entries);
+      if (!instance) RememberSplit(collection, *entries);
     }
     return pointers;
+  }
+
+  // The key of the object half-way through a listing of the collection's
+  // current generation; none for a small one, where a second request would
+  // cost more than it saves.
+  void RememberSplit(const std::string& collection, const std::vector<Entry>& entries) {
+    LastRead& last = lastGen_[collection];
+    last.split = entries.size() < kSplitObjects
+                     ? std::string()
+                     : keys_.Object(last.gen, entries[entries.size() / 2].instance);
   }
 
   RangeRequest GenerationRequest(const std::string& gen, const std::string* instance) const {
@@ -592,23 +637,33 @@ class EtcdStore final : public ConfigStore {
     RangeRequest request = GenerationRequest(gen, instance);
     request.set_revision(revision);
     client_.Read(request, reply);
-    ParseGeneration(gen, reply->ranges[0], entries);
+    ParseGeneration(gen, {&reply->ranges[0]}, entries);
   }
 
-  void ParseGeneration(const std::string& gen, const etcdwire::Range& range,
+  // The objects in "ranges", consecutive ranges of one generation's keys
+  // that split it between objects.
+  void ParseGeneration(const std::string& gen, const std::vector<const etcdwire::Range*>& ranges,
                        std::vector<Entry>* entries) const {
+    std::int64_t headRevision = 0;
+    for (const etcdwire::Range* range : ranges) ParseRange(gen, *range, entries, &headRevision);
+    for (Entry& entry : *entries) {
+      if (entry.order.revision == -1) entry.order.revision = headRevision;
+    }
+  }
+
+  void ParseRange(const std::string& gen, const etcdwire::Range& range, std::vector<Entry>* entries,
+                  std::int64_t* headRevision) const {
     const std::string base = keys_.Generation(gen);
     // Keys are compared as views against a suffix made once: a string built
     // per key cost a listing more than half the instructions of receiving it.
     const std::string firstPart = Keys::PartSuffix(0);
     std::string want;
-    std::int64_t headRevision = 0;
     const std::vector<etcdwire::KeyValue>& kvs = range.kvs;
     for (std::size_t i = 0; i < kvs.size(); ++i) {
       std::string_view key(kvs[i].key);
       key.remove_prefix(base.size());
       if (key.empty()) {
-        headRevision = kvs[i].createRevision;
+        *headRevision = kvs[i].createRevision;
         continue;
       }
       const std::size_t zero = key.find('\0');
@@ -649,9 +704,6 @@ class EtcdStore final : public ConfigStore {
         ++i;
       }
       entries->push_back(std::move(entry));
-    }
-    for (Entry& entry : *entries) {
-      if (entry.order.revision == -1) entry.order.revision = headRevision;
     }
   }
 
@@ -712,10 +764,10 @@ class EtcdStore final : public ConfigStore {
     const ConfigStoreObjectId& want = filter.Id();
     const std::string* instance = want.InstanceId().empty() ? nullptr : &want.InstanceId();
     const std::string exact = ExactCollection(want);
-    etcdwire::Reply reply;
+    Replies replies;
     std::vector<Entry> entries;
     const Pointers pointers =
-        exact.empty() ? ReadPointers(exact) : ReadCollection(exact, instance, &reply, &entries);
+        exact.empty() ? ReadPointers(exact) : ReadCollection(exact, instance, &replies, &entries);
 
     struct Listed {
       Order order;
@@ -732,7 +784,7 @@ class EtcdStore final : public ConfigStore {
       if (current && !(pending && pending->cleared)) {
         if (name != exact) {
           entries.clear();
-          ReadGeneration(current->gen, instance, pointers.revision, &reply, &entries);
+          ReadGeneration(current->gen, instance, pointers.revision, &replies.first, &entries);
         }
         for (const Entry& entry : entries) {
           if (pending &&
@@ -1142,8 +1194,13 @@ class EtcdStore final : public ConfigStore {
   std::vector<TxnState> saved_;  // the state at each inner Begin
   // Collections this transaction read, with the version it saw (0: none).
   std::map<std::string, std::int64_t> observed_;
-  // The generation each collection read pointed at then (ReadCollection).
-  std::map<std::string, std::string> lastGen_;
+  // The generation each collection read pointed at then, and where to split
+  // a listing of it (ReadCollection).
+  struct LastRead {
+    std::string gen;
+    std::string split;
+  };
+  std::map<std::string, LastRead> lastGen_;
   std::unique_ptr<ChangeFeed> feed_;
   // The lease of this store's last successful commit (0: none), left to run
   // out when the store goes, and when it was last renewed.
