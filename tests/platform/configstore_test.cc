@@ -160,6 +160,10 @@ TEST_P(StoreConformance, ValuesAndSubObjectsRoundTripByteExact) {
   }
   o->CreateSubObject(SubObjectId(std::string("a\0", 2), "\xff"))->SetValue("v", big);
   o->CreateSubObject(SubObjectId("blobs", "s2"))->SetValue("replaced", 1LL);  // in s2's place
+  // More values than a new object appends to its own encoding.
+  auto many = o->CreateSubObject(SubObjectId("many", ""));
+  for (long long v = 0; v < 200; ++v) many->SetValue(("v" + std::to_string(v)).c_str(), v);
+  many->SetValue("v3", std::string("set again"));
   Set(*store_, o);
   // A neighbour that differs only after a NUL, and one with few sub-objects.
   Set(*store_, Obj("k", id.Group(), "c", id.InstanceId()));
@@ -177,6 +181,8 @@ TEST_P(StoreConformance, ValuesAndSubObjectsRoundTripByteExact) {
   std::string s;
   EXPECT_FALSE(read->GetValue("byte", &s));                            // a prefix is another name
   EXPECT_EQ(read->GetSubObject(SubObjectId("blobs", "s0")), nullptr);  // s0 is in "other"
+  long long n = 0;
+  EXPECT_TRUE(read->GetSubObject(SubObjectId("many", ""))->GetValue("v199", &n) && n == 199);
 }
 
 TEST_P(StoreConformance, FiltersMatchInWriteOrder) {
@@ -232,8 +238,13 @@ TEST_P(StoreConformance, TransactionsCommitOrRestoreExactlyAndMisuseFails) {
     Set(*store_, replaced);
     store_->DeleteObjects(Filter("k", "g", "c", "2"));
     Set(*store_, Obj("k", "g", "c", "4"));
-    // The transaction reads its own writes.
+    Set(*store_, Obj("k", "g", "c", "5"));
+    store_->DeleteObjects(Filter("k", "g", "c", "5"));
+    // The transaction reads its own writes, and what it left alone.
     EXPECT_THAT(List(*store_), ElementsAre("3", "1", "4"));
+    EXPECT_EQ(store_->GetObject(ConfigStoreObjectId("k", "g", "c", "2")), nullptr);
+    EXPECT_EQ(store_->GetObject(ConfigStoreObjectId("k", "g", "c", "5")), nullptr);
+    EXPECT_NE(store_->GetObject(ConfigStoreObjectId("k", "g", "c", "3")), nullptr);
     if (commit) {
       store_->CommitTransaction();
     } else {

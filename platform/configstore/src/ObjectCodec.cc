@@ -65,16 +65,32 @@ std::size_t ValuesSize(const std::vector<StoreValue>& values) {
 char* PutValues(const std::vector<StoreValue>& values, char* out) {
   out = PutVarint(values.size(), out);
   for (const StoreValue& v : values) {
-    out = PutBytes(v.name, out);
-    if (const auto* s = std::get_if<std::string>(&v.value)) {
-      *out++ = static_cast<char>(kKindBytes);
-      out = PutBytes(*s, out);
-    } else {
-      *out++ = static_cast<char>(kKindInteger);
-      out = PutVarint(Zigzag(std::get<long long>(v.value)), out);
-    }
+    const auto* bytes = std::get_if<std::string>(&v.value);
+    out = reinterpret_cast<char*>(PutValue(v.name.data(), v.name.size(), bytes,
+                                           bytes ? 0 : std::get<long long>(v.value),
+                                           reinterpret_cast<unsigned char*>(out)));
   }
   return out;
+}
+
+// The section of one object's values: its own encoding when it keeps one.
+std::size_t SectionSize(const StoreObject* object) {
+  static const std::vector<StoreValue> kNoValues;
+  const unsigned char* data = nullptr;
+  std::size_t size = 0;
+  if (object != nullptr && Access::Encoded(*object, &data, &size)) return size;
+  return ValuesSize(object ? object->Values() : kNoValues);
+}
+
+char* PutSection(const StoreObject* object, char* out) {
+  static const std::vector<StoreValue> kNoValues;
+  const unsigned char* data = nullptr;
+  std::size_t size = 0;
+  if (object != nullptr && Access::Encoded(*object, &data, &size)) {
+    std::memcpy(out, data, size);
+    return out + size;
+  }
+  return PutValues(object ? object->Values() : kNoValues, out);
 }
 
 // A bounds-checked cursor: every read checks what is left first. Bodies are
@@ -173,24 +189,42 @@ class Reader {
 
 void EncodeObject(const ConfigStoreObject& object, std::string* out) {
   // Sized first and written in one go: no regrowing of "out".
-  static const std::vector<StoreValue> kNoValues;
   const std::vector<SubObjectEntry>& subs = object.SubObjects();
-  std::size_t size = 1 + ValuesSize(object.Values()) + VarintSize(subs.size());
+  std::size_t size = 1 + SectionSize(&object) + VarintSize(subs.size());
   for (const SubObjectEntry& e : subs) {
-    size += BytesSize(e.id.Array()) + BytesSize(e.id.Key()) +
-            ValuesSize(e.object ? e.object->Values() : kNoValues);
+    size += BytesSize(e.id.Array()) + BytesSize(e.id.Key()) + SectionSize(e.object.get());
   }
   const std::size_t start = out->size();
   out->resize(start + size);
   char* p = &(*out)[start];
   *p++ = static_cast<char>(kFormat);
-  p = PutValues(object.Values(), p);
+  p = PutSection(&object, p);
   p = PutVarint(subs.size(), p);
   for (const SubObjectEntry& e : subs) {
     p = PutBytes(e.id.Array(), p);
     p = PutBytes(e.id.Key(), p);
-    p = PutValues(e.object ? e.object->Values() : kNoValues, p);
+    p = PutSection(e.object.get(), p);
   }
+}
+
+std::size_t ValueSize(std::size_t nameSize, const std::string* bytes, long long integer) {
+  return VarintSize(nameSize) + nameSize + 1 +
+         (bytes ? BytesSize(*bytes) : VarintSize(Zigzag(integer)));
+}
+
+unsigned char* PutValue(const char* name, std::size_t nameSize, const std::string* bytes,
+                        long long integer, unsigned char* out) {
+  char* p = PutVarint(nameSize, reinterpret_cast<char*>(out));
+  std::memcpy(p, name, nameSize);
+  p += nameSize;
+  if (bytes) {
+    *p++ = static_cast<char>(kKindBytes);
+    p = PutBytes(*bytes, p);
+  } else {
+    *p++ = static_cast<char>(kKindInteger);
+    p = PutVarint(Zigzag(integer), p);
+  }
+  return reinterpret_cast<unsigned char*>(p);
 }
 
 std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId&& id, const unsigned char* data,

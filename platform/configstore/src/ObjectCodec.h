@@ -43,6 +43,14 @@ class BodyArena;
 std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId&& id, const unsigned char* data,
                                                 std::size_t size, BodyArena* arena = nullptr);
 
+// ---- One value of a "values" section ---------------------------------------
+
+// The bytes a value takes: a byte string when "bytes" is set, else "integer".
+std::size_t ValueSize(std::size_t nameSize, const std::string* bytes, long long integer);
+// Writes it at "out", which has room for ValueSize bytes; returns the end.
+unsigned char* PutValue(const char* name, std::size_t nameSize, const std::string* bytes,
+                        long long integer, unsigned char* out);
+
 // ---- Readers of a checked "values" section ---------------------------------
 
 // Every value, in order.
@@ -93,6 +101,13 @@ class Access {
                                                       std::size_t valuesBegin,
                                                       std::size_t subsBegin, std::size_t subs,
                                                       BodyArena* arena);
+  // The object's values as an encoded "values" section, when it keeps them
+  // so (read objects, and new ones until a name is set twice).
+  static bool Encoded(const StoreObject& object, const unsigned char** data, std::size_t* size) {
+    *data = object.encoded_;
+    *size = object.encodedSize_;
+    return *data != nullptr;
+  }
 };
 
 // The bodies of the objects of one listing, placed one after another in

@@ -1,5 +1,6 @@
 #include "TavoConfigStore/StoreObject.h"
 
+#include <algorithm>
 #include <cstring>
 #include <mutex>
 #include <new>
@@ -14,6 +15,11 @@ namespace {
 // read from the store, so concurrent readers of one object stay safe. They
 // are rare and short, so one lock serves every object.
 std::mutex gExpandMu;
+
+// An object's own encoding: its capacity, then a "values" section whose
+// count takes one byte, so it holds at most kMaxAppended values.
+constexpr std::size_t kCapacityBytes = sizeof(std::size_t);
+constexpr unsigned char kMaxAppended = 0x7f;
 
 // FilterSpecObject::Matches(const SubObjectId&) over views of the encoding:
 // the filter's key against the array, its instance id against the key, an
@@ -33,13 +39,19 @@ StoreObject::StoreObject(const StoreObject& other) : values_(other.Values()) {}
 StoreObject& StoreObject::operator=(const StoreObject& other) {
   if (this == &other) return *this;
   values_ = other.Values();
-  encoded_ = nullptr;
-  encodedSize_ = 0;
+  ReleaseEncoding();
   expanded_.store(false, std::memory_order_relaxed);
   return *this;
 }
 
-StoreObject::~StoreObject() = default;
+StoreObject::~StoreObject() { ReleaseEncoding(); }
+
+void StoreObject::ReleaseEncoding() {
+  if (ownsEncoding_) ::operator delete(const_cast<unsigned char*>(encoded_) - kCapacityBytes);
+  ownsEncoding_ = false;
+  encoded_ = nullptr;
+  encodedSize_ = 0;
+}
 
 const std::vector<StoreValue>& StoreObject::Values() const {
   if (encoded_ != nullptr && !expanded_.load(std::memory_order_acquire)) {
@@ -57,9 +69,51 @@ void StoreObject::Own() {
   if (encoded_ == nullptr) return;
   if (!expanded_.load(std::memory_order_acquire))
     values_ = codec::DecodeValues(encoded_, encodedSize_);
-  encoded_ = nullptr;
-  encodedSize_ = 0;
+  ReleaseEncoding();
   expanded_.store(false, std::memory_order_relaxed);
+}
+
+// A new object's values go straight into one encoding, as the store will
+// write them: a few appends to one block instead of a string for each name
+// and value, and the store copies the section whole.
+bool StoreObject::Append(const char* name, const std::string* bytes, long long integer) {
+  unsigned char* data = nullptr;
+  std::size_t used = 1;  // the count
+  std::size_t capacity = 0;
+  if (encoded_ != nullptr) {
+    if (!ownsEncoding_ || expanded_.load(std::memory_order_acquire)) return false;
+    codec::ValueRef existing;
+    if (encoded_[0] == kMaxAppended || codec::FindValue(encoded_, encodedSize_, name, &existing)) {
+      return false;  // a name set again is replaced where it stands
+    }
+    data = const_cast<unsigned char*>(encoded_);
+    used = encodedSize_;
+    std::memcpy(&capacity, data - kCapacityBytes, kCapacityBytes);
+  } else if (!values_.empty()) {
+    return false;
+  }
+  const std::size_t nameSize = std::strlen(name);
+  const std::size_t needed = used + codec::ValueSize(nameSize, bytes, integer);
+  if (data == nullptr || needed > capacity) {
+    // Room for a few more names and short values besides.
+    capacity = std::max(needed + 64, 2 * capacity);
+    auto* block = static_cast<unsigned char*>(::operator new(kCapacityBytes + capacity));
+    std::memcpy(block, &capacity, kCapacityBytes);
+    unsigned char* grown = block + kCapacityBytes;
+    if (data == nullptr) {
+      grown[0] = 0;
+    } else {
+      std::memcpy(grown, data, used);
+    }
+    ReleaseEncoding();
+    data = grown;
+    encoded_ = data;
+    ownsEncoding_ = true;
+  }
+  codec::PutValue(name, nameSize, bytes, integer, data + used);
+  ++data[0];
+  encodedSize_ = needed;
+  return true;
 }
 
 const StoreValue* StoreObject::Find(const char* name) const {
@@ -80,11 +134,13 @@ StoreValue& StoreObject::Slot(const char* name) {
 }
 
 void StoreObject::SetValue(const char* name, const std::string& value) {
+  if (Append(name, &value, 0)) return;
   Own();
   Slot(name).value = value;
 }
 
 void StoreObject::SetValue(const char* name, long long value) {
+  if (Append(name, nullptr, value)) return;
   Own();
   Slot(name).value = value;
 }

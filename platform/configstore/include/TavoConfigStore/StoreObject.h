@@ -30,9 +30,11 @@ class ConfigStoreObject;
 // value (and may change its kind); values keep the order in which their names
 // were first set.
 //
-// Objects read from the SQLite store keep the values in their stored encoding
-// and read them from there in place; the vector behind Values() is built only
-// when asked for. Const members may be called from several threads at once.
+// Objects read from a store keep the values in their stored encoding and read
+// them from there in place; so do new objects, which append each value to an
+// encoding of their own until a name is set twice. The vector behind Values()
+// is built only when asked for. Const members may be called from several
+// threads at once.
 class CONFIGSTORE_EXPORT StoreObject {
  public:
   StoreObject() = default;
@@ -62,14 +64,21 @@ class CONFIGSTORE_EXPORT StoreObject {
   const StoreValue* Find(const char* name) const;
   // Before a change: encoded values become ordinary ones.
   void Own();
+  // Appends a value to the object's own encoding; false when the object
+  // holds its values otherwise, or already has one of that name.
+  bool Append(const char* name, const std::string* bytes, long long integer);
+  void ReleaseEncoding();
 
   // While encoded_ is set, the values are the ones encoded at
-  // encoded_[0, encodedSize_), in memory whose owner also owns this object,
-  // and values_ is filled from them on the first Values().
+  // encoded_[0, encodedSize_), and values_ is filled from them on the first
+  // Values(). The memory is this object's own when ownsEncoding_ (its
+  // capacity then stored just before it), and otherwise that of whoever
+  // owns this object.
   mutable std::vector<StoreValue> values_;
   const unsigned char* encoded_ = nullptr;
   std::size_t encodedSize_ = 0;
   mutable std::atomic<bool> expanded_{false};
+  bool ownsEncoding_ = false;
 };
 
 // One sub-object together with its identifier, as a backend encodes it.
