@@ -299,6 +299,7 @@ TEST_P(StoreConformance, ObjectsHandedOutAreCopies) {
   auto make = [] {
     auto o = Obj("k", "g", "c", "i");
     o->SetValue("count", 1LL);
+    o->SetValue("kept", std::string("as it was"));
     for (int i = 0; i < 20; ++i) o->CreateSubObject(SubObjectId("arr", std::to_string(i)));
     return o;
   };
@@ -315,6 +316,8 @@ TEST_P(StoreConformance, ObjectsHandedOutAreCopies) {
     changed->SetValue("count", std::string("now a string"));
     changed->SetValue("late", 1LL);
     changed->CreateSubObject(SubObjectId("arr", "2"))->SetValue("fresh", 1LL);
+    std::string kept;
+    EXPECT_TRUE(changed->GetValue("kept", &kept) && kept == "as it was");
   }
   EXPECT_EQ(Dump(*store_), stored);
   ExpectReadsAs(*read, *expected);
