@@ -66,32 +66,34 @@ char* PutValues(const std::vector<StoreValue>& values, char* out) {
   out = PutVarint(values.size(), out);
   for (const StoreValue& v : values) {
     const auto* bytes = std::get_if<std::string>(&v.value);
-    out = reinterpret_cast<char*>(PutValue(v.name.data(), v.name.size(), bytes,
-                                           bytes ? 0 : std::get<long long>(v.value),
-                                           reinterpret_cast<unsigned char*>(out)));
+    out = PutValue(v.name.data(), v.name.size(), bytes, bytes ? 0 : std::get<long long>(v.value),
+                   out);
   }
   return out;
 }
 
-// The section of one object's values: its own encoding when it keeps one.
-std::size_t SectionSize(const StoreObject* object) {
-  static const std::vector<StoreValue> kNoValues;
-  const unsigned char* data = nullptr;
-  std::size_t size = 0;
-  if (object != nullptr && Access::Encoded(*object, &data, &size)) return size;
-  return ValuesSize(object ? object->Values() : kNoValues);
-}
-
-char* PutSection(const StoreObject* object, char* out) {
-  static const std::vector<StoreValue> kNoValues;
-  const unsigned char* data = nullptr;
-  std::size_t size = 0;
-  if (object != nullptr && Access::Encoded(*object, &data, &size)) {
-    std::memcpy(out, data, size);
-    return out + size;
+// One object's "values" section, given as it keeps it encoded where it
+// does (read objects, and new ones until a name is set twice).
+struct Section {
+  explicit Section(const StoreObject* object) {
+    static const std::vector<StoreValue> kNoValues;
+    if (object == nullptr) {
+      values = &kNoValues;
+    } else if (!Access::Encoded(*object, &encoded, &encodedSize)) {
+      values = &object->Values();
+    }
   }
-  return PutValues(object ? object->Values() : kNoValues, out);
-}
+  std::size_t Size() const { return values ? ValuesSize(*values) : encodedSize; }
+  char* Put(char* out) const {
+    if (values) return PutValues(*values, out);
+    std::memcpy(out, encoded, encodedSize);
+    return out + encodedSize;
+  }
+
+  const std::vector<StoreValue>* values = nullptr;
+  const unsigned char* encoded = nullptr;
+  std::size_t encodedSize = 0;
+};
 
 // A bounds-checked cursor: every read checks what is left first. Bodies are
 // checked in full when decoded, so the later readers never meet damage; they
@@ -190,20 +192,20 @@ class Reader {
 void EncodeObject(const ConfigStoreObject& object, std::string* out) {
   // Sized first and written in one go: no regrowing of "out".
   const std::vector<SubObjectEntry>& subs = object.SubObjects();
-  std::size_t size = 1 + SectionSize(&object) + VarintSize(subs.size());
+  std::size_t size = 1 + Section(&object).Size() + VarintSize(subs.size());
   for (const SubObjectEntry& e : subs) {
-    size += BytesSize(e.id.Array()) + BytesSize(e.id.Key()) + SectionSize(e.object.get());
+    size += BytesSize(e.id.Array()) + BytesSize(e.id.Key()) + Section(e.object.get()).Size();
   }
   const std::size_t start = out->size();
   out->resize(start + size);
   char* p = &(*out)[start];
   *p++ = static_cast<char>(kFormat);
-  p = PutSection(&object, p);
+  p = Section(&object).Put(p);
   p = PutVarint(subs.size(), p);
   for (const SubObjectEntry& e : subs) {
     p = PutBytes(e.id.Array(), p);
     p = PutBytes(e.id.Key(), p);
-    p = PutSection(e.object.get(), p);
+    p = Section(e.object.get()).Put(p);
   }
 }
 
@@ -212,9 +214,9 @@ std::size_t ValueSize(std::size_t nameSize, const std::string* bytes, long long 
          (bytes ? BytesSize(*bytes) : VarintSize(Zigzag(integer)));
 }
 
-unsigned char* PutValue(const char* name, std::size_t nameSize, const std::string* bytes,
-                        long long integer, unsigned char* out) {
-  char* p = PutVarint(nameSize, reinterpret_cast<char*>(out));
+char* PutValue(const char* name, std::size_t nameSize, const std::string* bytes, long long integer,
+               char* out) {
+  char* p = PutVarint(nameSize, out);
   std::memcpy(p, name, nameSize);
   p += nameSize;
   if (bytes) {
@@ -224,7 +226,7 @@ unsigned char* PutValue(const char* name, std::size_t nameSize, const std::strin
     *p++ = static_cast<char>(kKindInteger);
     p = PutVarint(Zigzag(integer), p);
   }
-  return reinterpret_cast<unsigned char*>(p);
+  return p;
 }
 
 std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId&& id, const unsigned char* data,

@@ -48,8 +48,8 @@ std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId&& id, const 
 // The bytes a value takes: a byte string when "bytes" is set, else "integer".
 std::size_t ValueSize(std::size_t nameSize, const std::string* bytes, long long integer);
 // Writes it at "out", which has room for ValueSize bytes; returns the end.
-unsigned char* PutValue(const char* name, std::size_t nameSize, const std::string* bytes,
-                        long long integer, unsigned char* out);
+char* PutValue(const char* name, std::size_t nameSize, const std::string* bytes, long long integer,
+               char* out);
 
 // ---- Readers of a checked "values" section ---------------------------------
 

@@ -110,7 +110,7 @@ bool StoreObject::Append(const char* name, const std::string* bytes, long long i
     encoded_ = data;
     ownsEncoding_ = true;
   }
-  codec::PutValue(name, nameSize, bytes, integer, data + used);
+  codec::PutValue(name, nameSize, bytes, integer, reinterpret_cast<char*>(data + used));
   ++data[0];
   encodedSize_ = needed;
   return true;

@@ -604,8 +604,8 @@ class EtcdStore final : public ConfigStore {
     if (!current) {
       lastGen_.erase(collection);
     } else {
-      if (lastGen_[collection].gen != current->gen)
-        lastGen_[collection] = LastRead{current->gen, std::string()};
+      LastRead& remembered = lastGen_[collection];
+      if (remembered.gen != current->gen) remembered = LastRead{current->gen, std::string()};
       ReadGeneration(current->gen, instance, pointers.revision, &replies->first, entries);
       if (!instance) RememberSplit(collection, *entries);
     }
