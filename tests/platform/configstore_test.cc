@@ -311,6 +311,13 @@ TEST_P(StoreConformance, ObjectsHandedOutAreCopies) {
   // Changing what was written or read changes only that copy; what was read
   // writes back whole.
   auto expected = make();
+  // An assigned object is a copy too, identifier included, and only equal
+  // identifiers compare equal.
+  ConfigStoreObject assigned(ConfigStoreObjectId("other", "g", "c", "i"));
+  EXPECT_FALSE(assigned.Id() == read->Id());
+  assigned = *read;
+  EXPECT_EQ(Describe(assigned), Describe(*read));
+  EXPECT_TRUE(assigned.Id() == read->Id());
   for (const auto& changed : {written, read, expected}) {
     changed->GetSubObject(SubObjectId("arr", "1"))->SetValue("n", 3LL);
     changed->SetValue("count", std::string("now a string"));
