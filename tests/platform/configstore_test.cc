@@ -5,6 +5,7 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -687,6 +688,20 @@ TEST_F(SqliteStoreTest, ThreadsMayReadOneObjectTogether) {
     for (auto& thread : threads) thread.join();
     EXPECT_EQ(failures, 0);
   }
+}
+
+// An object read alone may be kept for long: it holds its own bytes, not a
+// block sized for the objects of a listing.
+TEST_F(SqliteStoreTest, ObjectsReadAloneHoldOnlyTheirOwnBytes) {
+  auto store = NewSqliteStore(Path());
+  const auto written = Sample("kept");
+  Set(*store, written);
+  const std::size_t before = mallinfo2().uordblks;
+  std::vector<std::shared_ptr<ConfigStoreObject>> kept;
+  for (int i = 0; i < 200; ++i) kept.push_back(store->GetObject(written->Id()));
+  // About 0.5 KiB each; a 64 KiB block each would be 12.5 MiB.
+  EXPECT_LT(mallinfo2().uordblks - before, std::size_t{1} << 20);
+  EXPECT_EQ(Describe(*kept.back()), Describe(*written));
 }
 
 // GetStore's per-thread connection follows TAVO_CONFIGSTORE_PATH. A

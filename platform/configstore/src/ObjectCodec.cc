@@ -256,7 +256,7 @@ std::shared_ptr<ConfigStoreObject> Access::NewObject(ConfigStoreObjectId&& id,
                                                      std::size_t subs, BodyArena* arena) {
   // The sub-objects live next to the body: listing them costs no allocation.
   unsigned char* copy = nullptr;
-  BodyArena own;
+  BodyArena own(0);
   std::shared_ptr<Body> block = (arena != nullptr ? arena : &own)->NewBody(subs, size, &copy);
   if (size != 0) std::memcpy(copy, body, size);
   block->subsSize = size - subsBegin;
@@ -295,7 +295,7 @@ std::shared_ptr<Body> BodyArena::NewBody(std::size_t subs, std::size_t size,
       (sizeof(Body) + subs * sizeof(Body::Sub) + size + kAlign - 1) / kAlign * kAlign;
   if (!chunk_ || chunk_->capacity - chunk_->used < need) {
     // A body too large for a shared chunk gets one of its own size.
-    const std::size_t capacity = need > kChunkSize / 4 ? need : kChunkSize;
+    const std::size_t capacity = need > chunkSize_ / 4 ? need : chunkSize_;
     unsigned char* area = nullptr;
     chunk_ = std::allocate_shared<Chunk>(TrailingBytes<Chunk>(capacity, &area));
     chunk_->area = area;

@@ -140,12 +140,17 @@ class BodyArena {
  public:
   static constexpr std::size_t kChunkSize = std::size_t{64} * 1024;
 
+  // "chunkSize" 0 gives each body a block of its own exact size: for an
+  // object read alone, which may be kept long after the read.
+  explicit BodyArena(std::size_t chunkSize = kChunkSize) : chunkSize_(chunkSize) {}
+
   // A new body with room for "subs" sub-objects and "size" bytes, which
   // start at "*bytes".
   std::shared_ptr<Body> NewBody(std::size_t subs, std::size_t size, unsigned char** bytes);
 
  private:
   struct Chunk;
+  std::size_t chunkSize_;
   std::shared_ptr<Chunk> chunk_;
 };
 
