@@ -143,12 +143,13 @@ std::string PolicyText(const KarstPolicyInfo& policy) {
   return text;
 }
 
-// Crc32Hex of the policy's text, without building it: the CRC runs on
-// across the pieces where they lie, so the blobs are not copied first.
-std::string PolicyDigest(const KarstPolicyInfo& policy) {
+// Crc32Hex of the text "forEachPiece" hands out piece by piece, without
+// building it: the CRC runs on across the pieces where they lie.
+template <typename ForEachPiece>
+std::string DigestOfPieces(ForEachPiece forEachPiece) {
   std::uint32_t crc = 0;
   std::size_t length = 0;
-  ForEachPolicyPiece(policy, [&](const char* data, std::size_t size) {
+  forEachPiece([&](const char* data, std::size_t size) {
     crc = Crc32(data, size, crc);
     length += size;
   });
@@ -182,7 +183,8 @@ std::string GetPolicyDbHash() {
       [&](std::size_t i) {
         if (i + 2 < policies.size()) PrefetchBlobList(policies[i + 2]);
         if (i + 1 < policies.size()) PrefetchBlobs(policies[i + 1]);
-        return PolicyDigest(policies[i]);
+        return DigestOfPieces(
+            [&](auto append) { ForEachPolicyPiece(policies[i], append); });
       },
       [&](std::size_t i) { return PolicyText(policies[i]); });
 }
@@ -195,9 +197,18 @@ std::string GetDatastoreDbHash() {
                               d.datastore_namespace.size(), d.drp_policy_id.data(),
                               d.drp_policy_id.size());
   };
+  // The digest of the text textOf builds, from its three pieces in place.
+  auto digestOf = [&](std::size_t i) {
+    const KarstDatastoreInfo& d = datastores[i];
+    return DigestOfPieces([&d](auto append) {
+      for (const std::string* piece : {&d.url, &d.datastore_namespace, &d.drp_policy_id}) {
+        append(piece->data(), piece->size());
+      }
+    });
+  };
   return DigestOfDigests(
       datastores.size(), [&](std::size_t i) -> const std::string& { return datastores[i].url; },
-      [&](std::size_t i) { return Crc32Hex(textOf(i)); }, textOf);
+      digestOf, textOf);
 }
 
 std::pair<std::string, std::string> ComputeDbHash() {
