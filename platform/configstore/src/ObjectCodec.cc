@@ -254,11 +254,11 @@ std::shared_ptr<ConfigStoreObject> Access::NewObject(ConfigStoreObjectId&& id,
                                                      const unsigned char* body, std::size_t size,
                                                      std::size_t valuesBegin, std::size_t subsBegin,
                                                      std::size_t subs, BodyArena* arena) {
-  // The sub-objects live next to the body: listing them costs no allocation.
   unsigned char* copy = nullptr;
   BodyArena own(0);
-  std::shared_ptr<Body> block = (arena != nullptr ? arena : &own)->NewBody(subs, size, &copy);
+  std::shared_ptr<Body> block = (arena != nullptr ? arena : &own)->NewBody(size, &copy);
   if (size != 0) std::memcpy(copy, body, size);
+  block->capacity = subs;
   block->subsSize = size - subsBegin;
 
   auto object = std::make_shared<ConfigStoreObject>(std::move(id));
@@ -286,13 +286,9 @@ struct BodyArena::Chunk {
   }
 };
 
-std::shared_ptr<Body> BodyArena::NewBody(std::size_t subs, std::size_t size,
-                                         unsigned char** bytes) {
-  using Body = Body;
+std::shared_ptr<Body> BodyArena::NewBody(std::size_t size, unsigned char** bytes) {
   constexpr std::size_t kAlign = alignof(std::max_align_t);
-  static_assert(sizeof(Body) % alignof(Body::Sub) == 0, "sub-objects follow the body");
-  const std::size_t need =
-      (sizeof(Body) + subs * sizeof(Body::Sub) + size + kAlign - 1) / kAlign * kAlign;
+  const std::size_t need = (sizeof(Body) + size + kAlign - 1) / kAlign * kAlign;
   if (!chunk_ || chunk_->capacity - chunk_->used < need) {
     // A body too large for a shared chunk gets one of its own size.
     const std::size_t capacity = need > chunkSize_ / 4 ? need : chunkSize_;
@@ -305,9 +301,7 @@ std::shared_ptr<Body> BodyArena::NewBody(std::size_t subs, std::size_t size,
   auto* body = new (at) Body();
   body->footprint = need;
   chunk_->used += need;
-  body->subs = reinterpret_cast<Body::Sub*>(at + sizeof(Body));
-  body->capacity = subs;
-  *bytes = at + sizeof(Body) + subs * sizeof(Body::Sub);
+  *bytes = at + sizeof(Body);
   return std::shared_ptr<Body>(chunk_, body);
 }
 

@@ -94,8 +94,7 @@ class SubReader {
 // Builds objects over encoded memory; the friend the object classes allow.
 class Access {
  public:
-  // With room for "subs" sub-objects, built on first access: a scan that
-  // reads one value of each object never pays for them.
+  // Its "subs" sub-objects are built on first access.
   static std::shared_ptr<ConfigStoreObject> NewObject(ConfigStoreObjectId&& id,
                                                       const unsigned char* body, std::size_t size,
                                                       std::size_t valuesBegin,
@@ -110,19 +109,17 @@ class Access {
   }
 };
 
-// The bodies of the objects of one listing, placed one after another in
-// shared chunks. One allocation then serves dozens of objects, and bodies,
-// larger than what malloc keeps on its fast paths, stop costing a slow one
-// each. A chunk lives while any object or sub-object placed in it does.
-// The memory of an object read from the store (see BodyArena): the header,
-// room for its sub-objects, then the encoded body.
+// The memory of an object read from the store (see BodyArena): this header,
+// then the encoded body. Its sub-objects are built when first asked for, in
+// room allocated then: a listing holds every body at once before the first
+// is read, and a scan that reads one value of each object never needs them.
 struct Body {
   struct Sub {
     std::string_view array;
     std::string_view key;
     StoreObject object;
   };
-  Sub* subs = nullptr;  // room for "capacity", of which "built" are built
+  Sub* subs = nullptr;  // room for "capacity" once built, of which "built" are
   std::size_t capacity = 0;
   std::size_t built = 0;
   std::size_t subsSize = 0;   // of the encoded "count, sub*" section
@@ -133,9 +130,14 @@ struct Body {
   Body& operator=(const Body&) = delete;
   ~Body() {
     for (std::size_t i = 0; i < built; ++i) subs[i].~Sub();
+    ::operator delete(subs);
   }
 };
 
+// The bodies of the objects of one listing, placed one after another in
+// shared chunks. One allocation then serves dozens of objects, and bodies,
+// larger than what malloc keeps on its fast paths, stop costing a slow one
+// each. A chunk lives while any object or sub-object placed in it does.
 class BodyArena {
  public:
   static constexpr std::size_t kChunkSize = std::size_t{64} * 1024;
@@ -144,9 +146,8 @@ class BodyArena {
   // object read alone, which may be kept long after the read.
   explicit BodyArena(std::size_t chunkSize = kChunkSize) : chunkSize_(chunkSize) {}
 
-  // A new body with room for "subs" sub-objects and "size" bytes, which
-  // start at "*bytes".
-  std::shared_ptr<Body> NewBody(std::size_t subs, std::size_t size, unsigned char** bytes);
+  // A new body of "size" bytes, which start at "*bytes".
+  std::shared_ptr<Body> NewBody(std::size_t size, unsigned char** bytes);
 
  private:
   struct Chunk;

@@ -135,10 +135,9 @@ class CONFIGSTORE_EXPORT ConfigStoreObject : public StoreObject {
   // built in body_; subObjects_ is filled, sharing them, only when asked for.
   mutable std::vector<SubObjectEntry> subObjects_;
   const unsigned char* encodedSubs_ = nullptr;
-  // Holds the encoded values and sub-objects; shared with the sub-objects
+  // The memory of an object read from the store: its encoded values and
+  // sub-objects, and the sub-objects once built. Shared with the sub-objects
   // handed out, which may outlive this object.
-  // The memory of an object read from the store: its encoded body and room
-  // for its sub-objects, which are built there on first access.
   std::shared_ptr<codec::Body> body_;
   mutable std::atomic<bool> subsBuilt_{false};
   mutable std::atomic<bool> subsExpanded_{false};
