@@ -183,8 +183,7 @@ std::string GetPolicyDbHash() {
       [&](std::size_t i) {
         if (i + 2 < policies.size()) PrefetchBlobList(policies[i + 2]);
         if (i + 1 < policies.size()) PrefetchBlobs(policies[i + 1]);
-        return DigestOfPieces(
-            [&](auto append) { ForEachPolicyPiece(policies[i], append); });
+        return DigestOfPieces([&](auto append) { ForEachPolicyPiece(policies[i], append); });
       },
       [&](std::size_t i) { return PolicyText(policies[i]); });
 }
