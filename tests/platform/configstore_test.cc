@@ -662,11 +662,13 @@ TEST_F(SqliteStoreTest, DamagedBodiesFailOnlyTheirOwnReads) {
 }
 
 // The lazily built parts of an object read from the store may be built by
-// several threads at once, each taking the lazy paths in another order.
-TEST_F(SqliteStoreTest, ThreadsMayReadOneObjectTogether) {
+// several threads at once, each taking the lazy paths in another order; the
+// objects of one listing share where their sub-objects are built.
+TEST_F(SqliteStoreTest, ThreadsMayReadObjectsTogether) {
   auto store = NewSqliteStore(Path());
   const auto written = Sample("t", 40);
   Set(*store, written);
+  for (int i = 0; i < 30; ++i) Set(*store, Sample("s" + std::to_string(i), i % 5));
   const std::function<bool(const ConfigStoreObject&)> checks[] = {
       [&](const ConfigStoreObject& o) { return Describe(o) == Describe(*written); },
       [](const ConfigStoreObject& o) { return o.GetSubObjectInstances(nullptr).size() == 40; },
@@ -688,6 +690,25 @@ TEST_F(SqliteStoreTest, ThreadsMayReadOneObjectTogether) {
     for (auto& thread : threads) thread.join();
     EXPECT_EQ(failures, 0);
   }
+  const auto listed = store->GetObjects(Filter("pool"));
+  ASSERT_EQ(listed.size(), 31u);
+  std::atomic<int> wrong{0};
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 4; ++t) {
+    threads.emplace_back([&, t] {
+      for (std::size_t k = 0; k < listed.size(); ++k) {
+        const ConfigStoreObject& o = *listed[(k * 7 + t * 5) % listed.size()];
+        const int subs =
+            o.Id().InstanceId() == "t" ? 40 : std::stoi(o.Id().InstanceId().substr(1)) % 5;
+        const auto instances = o.GetSubObjectInstances(nullptr);
+        long long last = -1;
+        wrong += static_cast<int>(instances.size()) != subs ||
+                 (subs != 0 && !(instances.back()->GetValue("n", &last) && last == subs - 1));
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  EXPECT_EQ(wrong, 0);
 }
 
 // An object read alone may be kept for long: it holds its own bytes, not a

@@ -273,6 +273,8 @@ struct BodyArena::Chunk {
   unsigned char* area = nullptr;
   std::size_t capacity = 0;
   std::size_t used = 0;
+  // Outlives the bodies, which point to it.
+  std::shared_ptr<SubRooms> rooms;
 
   Chunk() = default;
   Chunk(const Chunk&) = delete;
@@ -296,13 +298,45 @@ std::shared_ptr<Body> BodyArena::NewBody(std::size_t size, unsigned char** bytes
     chunk_ = std::allocate_shared<Chunk>(TrailingBytes<Chunk>(capacity, &area));
     chunk_->area = area;
     chunk_->capacity = capacity;
+    if (chunkSize_ != 0) {
+      if (!rooms_) rooms_ = std::make_shared<SubRooms>();
+      chunk_->rooms = rooms_;
+    }
   }
   unsigned char* at = chunk_->area + chunk_->used;
   auto* body = new (at) Body();
   body->footprint = need;
+  body->rooms = chunk_->rooms.get();
   chunk_->used += need;
   *bytes = at + sizeof(Body);
   return std::shared_ptr<Body>(chunk_, body);
+}
+
+void Body::TakeRoom() {
+  if (subs != nullptr || capacity == 0) return;
+  if (rooms != nullptr) {
+    subs = rooms->Take(capacity, &room);
+  } else {
+    subs = static_cast<Sub*>(::operator new(capacity * sizeof(Sub)));
+  }
+}
+
+Body::Sub* SubRooms::Take(std::size_t count, std::shared_ptr<void>* owner) {
+  static_assert(alignof(Body::Sub) <= alignof(std::max_align_t), "blocks are aligned for any type");
+  constexpr std::size_t kAlign = alignof(Body::Sub);
+  constexpr std::size_t kBlockSize = BodyArena::kChunkSize;
+  const std::size_t need = count * sizeof(Body::Sub);
+  if (!block_ || capacity_ - used_ < need) {
+    // Room too large for a shared block gets one of its own size.
+    capacity_ = need > kBlockSize / 4 ? need : kBlockSize;
+    struct Block {};
+    block_ = std::allocate_shared<Block>(TrailingBytes<Block>(capacity_, &area_));
+    used_ = 0;
+  }
+  auto* room = reinterpret_cast<Body::Sub*>(area_ + used_);
+  used_ += (need + kAlign - 1) / kAlign * kAlign;
+  *owner = block_;
+  return room;
 }
 
 std::vector<StoreValue> DecodeValues(const unsigned char* data, std::size_t size) {

@@ -109,10 +109,12 @@ class Access {
   }
 };
 
+class SubRooms;
+
 // The memory of an object read from the store (see BodyArena): this header,
 // then the encoded body. Its sub-objects are built when first asked for, in
-// room allocated then: a listing holds every body at once before the first
-// is read, and a scan that reads one value of each object never needs them.
+// room taken then: a listing holds every body at once before the first is
+// read, and a scan that reads one value of each object never needs them.
 struct Body {
   struct Sub {
     std::string_view array;
@@ -124,14 +126,37 @@ struct Body {
   std::size_t built = 0;
   std::size_t subsSize = 0;   // of the encoded "count, sub*" section
   std::size_t footprint = 0;  // bytes taken in its arena chunk
+  // Where a listing's bodies take their room (null for an object read
+  // alone, which allocates its own), and what keeps the room taken there.
+  SubRooms* rooms = nullptr;
+  std::shared_ptr<void> room;
 
   Body() = default;
   Body(const Body&) = delete;
   Body& operator=(const Body&) = delete;
   ~Body() {
     for (std::size_t i = 0; i < built; ++i) subs[i].~Sub();
-    ::operator delete(subs);
+    if (!room) ::operator delete(subs);
   }
+
+  // Gives "subs" room for "capacity" sub-objects. Callers hold the lock that
+  // serialises lazy building, which also guards "rooms".
+  void TakeRoom();
+};
+
+// Room for the sub-objects of a listing's objects, taken in shared blocks as
+// each object's are first built: one allocation then serves a few hundred
+// objects instead of one each. A block lives while any body whose
+// sub-objects it holds does, so a listing read in order frees them in order.
+class SubRooms {
+ public:
+  Body::Sub* Take(std::size_t count, std::shared_ptr<void>* owner);
+
+ private:
+  std::shared_ptr<void> block_;
+  unsigned char* area_ = nullptr;
+  std::size_t capacity_ = 0;
+  std::size_t used_ = 0;
 };
 
 // The bodies of the objects of one listing, placed one after another in
@@ -153,6 +178,7 @@ class BodyArena {
   struct Chunk;
   std::size_t chunkSize_;
   std::shared_ptr<Chunk> chunk_;
+  std::shared_ptr<SubRooms> rooms_;
 };
 
 // An allocator for allocate_shared that asks for "extra" bytes more than the

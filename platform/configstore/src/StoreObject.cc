@@ -208,11 +208,8 @@ const codec::Body& ConfigStoreObject::BuiltSubs() const {
   if (!subsBuilt_.load(std::memory_order_acquire)) {
     std::lock_guard<std::mutex> lock(gExpandMu);
     if (!subsBuilt_.load(std::memory_order_relaxed)) {
-      // Views into the body, in room of their own.
-      if (body_->subs == nullptr && body_->capacity != 0) {
-        body_->subs = static_cast<codec::Body::Sub*>(
-            ::operator new(body_->capacity * sizeof(codec::Body::Sub)));
-      }
+      // Views into the body, in room taken now.
+      body_->TakeRoom();
       codec::SubReader reader(encodedSubs_, body_->subsSize);
       codec::SubRef ref;
       while (body_->built < body_->capacity && reader.Next(&ref)) {
