@@ -65,7 +65,7 @@ TEST(DbHashTest, WorkedExample) {
 // One record's digest is the digest of its text's digest.
 TEST(DbHashTest, TextOfOneRecord) {
   ScopedFaultStore store(TavoConfigStore::NewMemoryStore());
-  const std::pair<TavoKarst::KarstPolicyInfo, std::string> policies[] = {
+  std::vector<std::pair<TavoKarst::KarstPolicyInfo, std::string>> policies = {
       // name, policy_id, description, decimal generation, then each blob's
       // namespace and bytes in ascending namespace order.
       {Policy("ab", "id", {{"2", "z"}, {"1", "y"}}, "d", 1), "abidd1y1z2"},
@@ -77,6 +77,17 @@ TEST(DbHashTest, TextOfOneRecord) {
       {Policy("a", "i", {{std::string("b\0", 2), std::string("n\0", 2)}}, "", 0),
        std::string("ai0n\0b\0", 7)},
   };
+  // A policy's blobs are put in order on the stack up to eight, past that on
+  // the heap; here they come in reverse.
+  for (int count : {8, 9}) {
+    std::vector<TavoKarst::KarstPolicyBlob> blobs;
+    std::string text = "mi0";
+    for (int i = 0; i < count; ++i) {
+      blobs.insert(blobs.begin(), {"b" + std::to_string(i), "n" + std::to_string(i)});
+      text += "n" + std::to_string(i) + "b" + std::to_string(i);
+    }
+    policies.push_back({Policy("m", "i", blobs, "", 0), text});
+  }
   for (const auto& [policy, text] : policies) {
     KarstLib::AddPolicyInfo({policy});
     EXPECT_EQ(KarstLib::GetDbHash().first, Crc32Hex(Crc32Hex(text)))
