@@ -668,7 +668,12 @@ TEST_F(SqliteStoreTest, ThreadsMayReadObjectsTogether) {
   auto store = NewSqliteStore(Path());
   const auto written = Sample("t", 40);
   Set(*store, written);
-  for (int i = 0; i < 30; ++i) Set(*store, Sample("s" + std::to_string(i), i % 5));
+  // "s<i>-<n>" has n sub-objects; 200 take more room than the listing's
+  // objects share in one block.
+  for (int i = 0; i < 30; ++i) {
+    const int subs = i == 7 ? 200 : i % 5;
+    Set(*store, Sample("s" + std::to_string(i) + "-" + std::to_string(subs), subs));
+  }
   const std::function<bool(const ConfigStoreObject&)> checks[] = {
       [&](const ConfigStoreObject& o) { return Describe(o) == Describe(*written); },
       [](const ConfigStoreObject& o) { return o.GetSubObjectInstances(nullptr).size() == 40; },
@@ -698,8 +703,8 @@ TEST_F(SqliteStoreTest, ThreadsMayReadObjectsTogether) {
     threads.emplace_back([&, t] {
       for (std::size_t k = 0; k < listed.size(); ++k) {
         const ConfigStoreObject& o = *listed[(k * 7 + t * 5) % listed.size()];
-        const int subs =
-            o.Id().InstanceId() == "t" ? 40 : std::stoi(o.Id().InstanceId().substr(1)) % 5;
+        const std::string& id = o.Id().InstanceId();
+        const int subs = id == "t" ? 40 : std::stoi(id.substr(id.find('-') + 1));
         const auto instances = o.GetSubObjectInstances(nullptr);
         long long last = -1;
         wrong += static_cast<int>(instances.size()) != subs ||

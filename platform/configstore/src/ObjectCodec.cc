@@ -325,11 +325,17 @@ Body::Sub* SubRooms::Take(std::size_t count, std::shared_ptr<void>* owner) {
   static_assert(alignof(Body::Sub) <= alignof(std::max_align_t), "blocks are aligned for any type");
   constexpr std::size_t kAlign = alignof(Body::Sub);
   constexpr std::size_t kBlockSize = BodyArena::kChunkSize;
+  struct Block {};
   const std::size_t need = count * sizeof(Body::Sub);
+  if (need > kBlockSize / 4) {
+    // Room too large for a shared block gets one of its own size, and the
+    // shared one stays for the objects after it.
+    unsigned char* area = nullptr;
+    *owner = std::allocate_shared<Block>(TrailingBytes<Block>(need, &area));
+    return reinterpret_cast<Body::Sub*>(area);
+  }
   if (!block_ || capacity_ - used_ < need) {
-    // Room too large for a shared block gets one of its own size.
-    capacity_ = need > kBlockSize / 4 ? need : kBlockSize;
-    struct Block {};
+    capacity_ = kBlockSize;
     block_ = std::allocate_shared<Block>(TrailingBytes<Block>(capacity_, &area_));
     used_ = 0;
   }
