@@ -16,6 +16,7 @@
 #include <vector>
 
 #include "EtcdCluster.h"
+#include "EtcdKeys.h"
 #include "Records.h"
 #include "TavoConfigStore/ConfigStore.h"
 #include "TavoConfigStore/EtcdStore.h"
@@ -25,7 +26,9 @@ namespace TavoConfigStore {
 namespace {
 
 using karst_test::EtcdCluster;
+using karst_test::EtcdKeys;
 using karst_test::EtcdOptions;
+using karst_test::StoreRoot;
 using Clock = std::chrono::steady_clock;
 
 std::shared_ptr<ConfigStoreObject> Obj(const std::string& instance, const std::string& value = "",
@@ -58,14 +61,12 @@ void Clear(ConfigStore& store, const std::string& key = "k") {
   store.DeleteObjects(std::make_shared<FilterSpecObject>(ConfigStoreObjectId(key, "g", "c")));
 }
 
-// The keys etcd holds under "/<prefix>/<area>/".
+// The keys etcd holds under "area" of the store at "prefix".
 std::vector<std::string> RawKeys(const EtcdCluster& etcd, const std::string& prefix,
                                  const std::string& area) {
-  std::istringstream out(
-      etcd.Etcdctl({"get", "--prefix", "--keys-only", "/" + prefix + "/" + area}));
   std::vector<std::string> keys;
-  for (std::string line; std::getline(out, line);) {
-    if (!line.empty()) keys.push_back(line);
+  for (const auto& kv : EtcdKeys(etcd.Endpoint(0)).List(StoreRoot(prefix) + area)) {
+    keys.push_back(kv.first);
   }
   return keys;
 }
@@ -275,22 +276,19 @@ TEST(EtcdStoreTest, ADeadWritersGenerationIsRemovedByTheNextWriter) {
   auto store = OpenStore(etcd.Locator("dead"));
   Set(*store, Obj("kept", "old"));
   // What a writer leaves when it dies after its first batch.
-  const std::string lease = [&] {
-    std::istringstream out(etcd.Etcdctl({"lease", "grant", "60"}));
-    std::string word, id;
-    out >> word >> id;
-    return id;
-  }();
-  etcd.Etcdctl({"put", "--lease=" + lease, "/dead/w/0123456789abcdef", "k"});
-  etcd.Etcdctl({"put", "/dead/r/0123456789abcdef", "k"});
-  etcd.Etcdctl({"put", std::string("/dead/g/0123456789abcdef/x") + "\\0" + "0000", "junk"});
-  etcd.Etcdctl({"put", "/dead/g/0123456789abcdef/y", "junk"});
+  const EtcdKeys raw(etcd.Endpoint(0));
+  const std::int64_t lease = raw.GrantLease(60);
+  const std::string root = StoreRoot("dead");
+  raw.Put(root + "w/0123456789abcdef", "k", lease);
+  raw.Put(root + "r/0123456789abcdef", "k");
+  raw.Put(root + "g/0123456789abcdef/x" + '\0' + "0000", "junk");
+  raw.Put(root + "g/0123456789abcdef/y", "junk");
 
   EXPECT_EQ(Dump(*store), std::vector<std::string>{"kept=old"});
   Clear(*store);
   Set(*store, Obj("new", "1"));  // the writer's lease still runs: left alone
   EXPECT_EQ(RawKeys(etcd, "dead", "g/0123456789abcdef/").size(), 2u);
-  etcd.Etcdctl({"lease", "revoke", lease});
+  raw.RevokeLease(lease);
   Clear(*store);
   Set(*store, Obj("newer", "2"));
   EXPECT_THAT(RawKeys(etcd, "dead", "g/0123456789abcdef/"), ::testing::IsEmpty());

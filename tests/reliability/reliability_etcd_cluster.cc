@@ -150,11 +150,12 @@ std::string MemberLocator(const EtcdCluster& etcd, int member, const std::string
 
 // The generations etcd holds under "area" ("g/", "r/" or "w/").
 std::set<std::string> Generations(const EtcdCluster& etcd, const std::string& area) {
-  const std::string root = "/" + kPrefix + "/" + area;
-  std::istringstream keys(etcd.Etcdctl({"get", "--prefix", "--keys-only", root}));
+  // The store's root ends in a zero byte, which no argument can carry.
+  const std::string root = "/" + kPrefix + "/" + '\0' + area;
+  std::istringstream keys(etcd.Etcdctl({"get", "--prefix", "--keys-only", "/" + kPrefix + "/"}));
   std::set<std::string> gens;
   for (std::string line; std::getline(keys, line);) {
-    if (!line.empty()) gens.insert(line.substr(root.size(), 16));
+    if (line.compare(0, root.size(), root) == 0) gens.insert(line.substr(root.size(), 16));
   }
   return gens;
 }

@@ -98,6 +98,10 @@ bool ReadHeader(std::string_view* value, Header* header) {
   return true;
 }
 
+bool IsGenerationId(std::string_view text) {
+  return text.size() == 16 && text.find_first_not_of("0123456789abcdef") == std::string_view::npos;
+}
+
 std::string Keys::PartSuffix(std::size_t part) {
   char text[17];
   std::snprintf(text, sizeof text, "%04zx", part);

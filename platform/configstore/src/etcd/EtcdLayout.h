@@ -1,4 +1,5 @@
-// How a store lies in etcd, under "/<prefix>/":
+// How a store lies in etcd, under its root "/<prefix>/\0" (the prefix escaped
+// as below, so that it holds no \0):
 //
 //   p/<collection>           the collection's current generation id. Rewritten
 //                            by every commit that changes the collection, so
@@ -15,6 +16,13 @@
 // each escaped so that it holds no \0 (\0 -> \1\1, \1 -> \1\2): keys then
 // sort part by part, and one object's keys are contiguous.
 //
+// Every root holds exactly one \0, its last byte, so no root starts with
+// another: the keys and ranges of two stores never meet, whatever their
+// prefixes (one inside the other, siblings, any bytes). The "/" before it
+// keeps a store's keys under "/<prefix>/", where etcd roles are granted.
+// Earlier versions used "/<prefix>/" itself as the root (Keys::Legacy): a
+// store at "m" then read the keys of one at "m/r" as its own "r/" keys.
+//
 // The first part's header: u8 1, varint order kind, varint revision, varint index,
 // varint part count. An object's place in write order is (revision, index);
 // the revision is the one written (kind 0, an object carried into a new
@@ -28,6 +36,7 @@
 #include <cstdint>
 #include <string>
 #include <string_view>
+#include <utility>
 
 #include "TavoConfigStore/ConfigStoreObjectId.h"
 
@@ -60,9 +69,15 @@ void AppendHeader(const Header& header, std::string* out);
 // Reads the header at the start of "*value" and drops it from the view.
 bool ReadHeader(std::string_view* value, Header* header);
 
+// True for a generation's id: 16 lower-case hexadecimal digits.
+bool IsGenerationId(std::string_view text);
+
 class Keys {
  public:
-  explicit Keys(const std::string& prefix) : root_("/" + prefix + "/") {}
+  explicit Keys(std::string_view prefix) : root_("/" + Escape(prefix) + "/" + '\0') {}
+  // The root of earlier versions, which a store still reads until its first
+  // write moves the catalogue under its own root.
+  static Keys Legacy(std::string_view prefix) { return Keys("/" + std::string(prefix) + "/", 0); }
   std::string Pointers() const { return root_ + "p/"; }
   std::string Pointer(const std::string& collection) const { return Pointers() + collection; }
   std::string Generation(const std::string& gen) const { return root_ + "g/" + gen + "/"; }
@@ -76,6 +91,7 @@ class Keys {
   const std::string& Root() const { return root_; }
 
  private:
+  Keys(std::string root, int /*raw*/) : root_(std::move(root)) {}
   std::string root_;
 };
 

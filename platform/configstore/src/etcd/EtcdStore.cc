@@ -60,6 +60,7 @@ constexpr int kDeadlineCode =
     kErrorEtcdBase + static_cast<int>(grpc::StatusCode::DEADLINE_EXCEEDED);
 constexpr int kUnavailableCode = kErrorEtcdBase + static_cast<int>(grpc::StatusCode::UNAVAILABLE);
 constexpr int kLeaseGoneCode = kErrorEtcdBase + static_cast<int>(grpc::StatusCode::NOT_FOUND);
+constexpr int kDeniedCode = kErrorEtcdBase + static_cast<int>(grpc::StatusCode::PERMISSION_DENIED);
 
 std::string NewId() {
   static std::mutex mu;
@@ -102,6 +103,9 @@ struct Current {
 struct Pointers {
   std::int64_t revision = 0;
   std::map<std::string, Current> byCollection;
+  // The layout they were read in: the store's own, or that of an earlier
+  // version whose catalogue the store's first write has not moved yet.
+  const Keys* keys = nullptr;
   // Read by a commit only: generations at that revision whose writer died
   // before making them current (registered, no live writer, no pointer).
   // Nothing can make such a generation current any more.
@@ -343,7 +347,8 @@ class ChangeFeed {
 
 class EtcdStore final : public ConfigStore {
  public:
-  explicit EtcdStore(const EtcdStoreOptions& options) : client_(options), keys_(options.prefix) {}
+  explicit EtcdStore(const EtcdStoreOptions& options)
+      : client_(options), keys_(options.prefix), legacyKeys_(Keys::Legacy(options.prefix)) {}
 
   ~EtcdStore() override { feed_.reset(); }
 
@@ -396,7 +401,7 @@ class EtcdStore final : public ConfigStore {
       // (the library's Reset) must not commit as if it had asked for none.
       const std::string exact = ExactCollection(want);
       const Pointers pointers =
-          exact.empty() ? Reading([&] { return ReadPointers(std::string()); }) : Pointers();
+          exact.empty() ? Reading([&] { return VisiblePointers(std::string()); }) : Pointers();
       std::set<std::string> names = Matching(*filter, pointers);
       if (!exact.empty()) names.insert(exact);
       for (const std::string& name : names) {
@@ -519,33 +524,90 @@ class EtcdStore final : public ConfigStore {
   }
 
   // The pointer of "collection", or of every collection when it is "", as
-  // the cluster has them now.
+  // the cluster has them now under the store's own root.
   Pointers ReadPointers(const std::string& collection) {
     etcdwire::Reply reply;
-    client_.Read(PointersRequest(collection), &reply);
-    return PointersOf(reply.ranges[0], reply.revision);
+    client_.Read(PointersRequest(keys_, collection), &reply);
+    return PointersOf(keys_, reply.ranges[0], reply.revision);
   }
 
-  RangeRequest PointersRequest(const std::string& collection) const {
+  // The same for a reader: the catalogue an earlier version wrote, while no
+  // write has moved it under the store's own root yet.
+  Pointers VisiblePointers(const std::string& collection) {
+    std::optional<Pointers> legacy = LegacyPointers();
+    if (!legacy) return ReadPointers(collection);
+    if (!collection.empty()) {
+      for (auto it = legacy->byCollection.begin(); it != legacy->byCollection.end();) {
+        it = it->first == collection ? std::next(it) : legacy->byCollection.erase(it);
+      }
+    }
+    return std::move(*legacy);
+  }
+
+  // The catalogue at the root earlier versions used, when there is one and
+  // nothing is under the store's own root yet. Asked once a store while
+  // there is none; while there is, at every read, as any write moves it.
+  std::optional<Pointers> LegacyPointers() {
+    if (layout_ == Layout::kCurrent) return std::nullopt;
+    TxnRequest txn;
+    RangeRequest* own = txn.add_success()->mutable_request_range();
+    *own = PointersRequest(keys_, std::string());
+    own->set_keys_only(true);
+    own->set_limit(1);
+    *txn.add_success()->mutable_request_range() = PointersRequest(legacyKeys_, std::string());
+    etcdwire::Reply reply;
+    try {
+      client_.Read(txn, &reply);
+    } catch (const ConfigStoreException& e) {
+      // A role granted on the store's own root alone: whatever lies at the
+      // old root is not this user's catalogue.
+      if (e.Code() != kDeniedCode) throw;
+      layout_ = Layout::kCurrent;
+      return std::nullopt;
+    }
+    if (reply.ranges.size() != 2) {
+      client_.Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unexpected reply"), "read");
+    }
+    Pointers legacy = PointersOf(legacyKeys_, reply.ranges[1], reply.revision);
+    // The old root may hold other stores' keys (those of "m/p/x" lie under
+    // "m"'s "p/"): only a collection's name with a generation's id is a
+    // pointer.
+    for (auto it = legacy.byCollection.begin(); it != legacy.byCollection.end();) {
+      ConfigStoreObjectId id("", "", "");
+      const bool pointer =
+          etcdlayout::ParseCollection(it->first, &id) && etcdlayout::IsGenerationId(it->second.gen);
+      it = pointer ? std::next(it) : legacy.byCollection.erase(it);
+    }
+    if (!reply.ranges[0].kvs.empty() || legacy.byCollection.empty()) {
+      layout_ = Layout::kCurrent;
+      return std::nullopt;
+    }
+    layout_ = Layout::kLegacy;
+    return legacy;
+  }
+
+  static RangeRequest PointersRequest(const Keys& keys, const std::string& collection) {
     RangeRequest request;
     if (collection.empty()) {
-      request.set_key(keys_.Pointers());
-      request.set_range_end(PrefixEnd(keys_.Pointers()));
+      request.set_key(keys.Pointers());
+      request.set_range_end(PrefixEnd(keys.Pointers()));
     } else {
-      request.set_key(keys_.Pointer(collection));
+      request.set_key(keys.Pointer(collection));
     }
     return request;
   }
 
-  Pointers PointersOf(const etcdwire::Range& range, std::int64_t revision) const {
+  static Pointers PointersOf(const Keys& keys, const etcdwire::Range& range,
+                             std::int64_t revision) {
     Pointers pointers;
     pointers.revision = revision;
+    pointers.keys = &keys;
     for (const etcdwire::KeyValue& kv : range.kvs) {
       Current current;
       current.gen = GenerationOf(kv.value);
       current.token = TokenOf(kv.value);
       current.version = kv.modRevision;
-      pointers.byCollection.emplace(kv.key.substr(keys_.Pointers().size()), std::move(current));
+      pointers.byCollection.emplace(kv.key.substr(keys.Pointers().size()), std::move(current));
     }
     return pointers;
   }
@@ -562,18 +624,27 @@ class EtcdStore final : public ConfigStore {
   // otherwise the generation is read again at the first one's.
   Pointers ReadCollection(const std::string& collection, const std::string* instance,
                           Replies* replies, std::vector<Entry>* entries) {
-    auto last = lastGen_.find(collection);
     Pointers pointers;
-    if (last == lastGen_.end()) {
+    auto last = lastGen_.find(collection);
+    if (layout_ != Layout::kCurrent) {
+      pointers = VisiblePointers(collection);
+      if (pointers.keys == &legacyKeys_) {
+        if (const Current* current = Find(pointers, collection)) {
+          ReadGeneration(legacyKeys_, current->gen, instance, pointers.revision, &replies->first,
+                         entries);
+        }
+        return pointers;
+      }
+    } else if (last == lastGen_.end()) {
       pointers = ReadPointers(collection);
     } else {
       const std::string& gen = last->second.gen;
       const std::string* split =
           instance == nullptr && !last->second.split.empty() ? &last->second.split : nullptr;
       TxnRequest txn;
-      *txn.add_success()->mutable_request_range() = PointersRequest(collection);
+      *txn.add_success()->mutable_request_range() = PointersRequest(keys_, collection);
       RangeRequest* head = txn.add_success()->mutable_request_range();
-      *head = GenerationRequest(gen, instance);
+      *head = GenerationRequest(keys_, gen, instance);
       std::future<void> rest;
       if (split) {
         RangeRequest tail = *head;
@@ -589,13 +660,13 @@ class EtcdStore final : public ConfigStore {
       if (reply.ranges.size() != 2) {
         client_.Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unexpected reply"), "read");
       }
-      pointers = PointersOf(reply.ranges[0], reply.revision);
+      pointers = PointersOf(keys_, reply.ranges[0], reply.revision);
       const Current* current = Find(pointers, collection);
       if (current && current->gen == gen &&
           (!split || replies->second.revision == reply.revision)) {
         std::vector<const etcdwire::Range*> ranges{&reply.ranges[1]};
         if (split) ranges.push_back(&replies->second.ranges[0]);
-        ParseGeneration(gen, ranges, entries);
+        ParseGeneration(keys_, gen, ranges, entries);
         if (!instance) RememberSplit(collection, *entries);
         return pointers;
       }
@@ -606,7 +677,7 @@ class EtcdStore final : public ConfigStore {
     } else {
       LastRead& remembered = lastGen_[collection];
       if (remembered.gen != current->gen) remembered = LastRead{current->gen, std::string()};
-      ReadGeneration(current->gen, instance, pointers.revision, &replies->first, entries);
+      ReadGeneration(keys_, current->gen, instance, pointers.revision, &replies->first, entries);
       if (!instance) RememberSplit(collection, *entries);
     }
     return pointers;
@@ -622,9 +693,10 @@ class EtcdStore final : public ConfigStore {
                      : keys_.Object(last.gen, entries[entries.size() / 2].instance);
   }
 
-  RangeRequest GenerationRequest(const std::string& gen, const std::string* instance) const {
+  static RangeRequest GenerationRequest(const Keys& keys, const std::string& gen,
+                                        const std::string* instance) {
     RangeRequest request;
-    request.set_key(instance ? keys_.Object(gen, *instance) : keys_.Generation(gen));
+    request.set_key(instance ? keys.Object(gen, *instance) : keys.Generation(gen));
     request.set_range_end(PrefixEnd(request.key()));
     return request;
   }
@@ -632,28 +704,31 @@ class EtcdStore final : public ConfigStore {
   // The objects of a generation (or its one object "instance") at
   // "revision", in the order the cluster keeps the keys. Their bytes stay
   // in "*reply".
-  void ReadGeneration(const std::string& gen, const std::string* instance, std::int64_t revision,
-                      etcdwire::Reply* reply, std::vector<Entry>* entries) {
-    RangeRequest request = GenerationRequest(gen, instance);
+  void ReadGeneration(const Keys& keys, const std::string& gen, const std::string* instance,
+                      std::int64_t revision, etcdwire::Reply* reply, std::vector<Entry>* entries) {
+    RangeRequest request = GenerationRequest(keys, gen, instance);
     request.set_revision(revision);
     client_.Read(request, reply);
-    ParseGeneration(gen, {&reply->ranges[0]}, entries);
+    ParseGeneration(keys, gen, {&reply->ranges[0]}, entries);
   }
 
   // The objects in "ranges", consecutive ranges of one generation's keys
   // that split it between objects.
-  void ParseGeneration(const std::string& gen, const std::vector<const etcdwire::Range*>& ranges,
-                       std::vector<Entry>* entries) const {
+  static void ParseGeneration(const Keys& keys, const std::string& gen,
+                              const std::vector<const etcdwire::Range*>& ranges,
+                              std::vector<Entry>* entries) {
     std::int64_t headRevision = 0;
-    for (const etcdwire::Range* range : ranges) ParseRange(gen, *range, entries, &headRevision);
+    for (const etcdwire::Range* range : ranges) {
+      ParseRange(keys, gen, *range, entries, &headRevision);
+    }
     for (Entry& entry : *entries) {
       if (entry.order.revision == -1) entry.order.revision = headRevision;
     }
   }
 
-  void ParseRange(const std::string& gen, const etcdwire::Range& range, std::vector<Entry>* entries,
-                  std::int64_t* headRevision) const {
-    const std::string base = keys_.Generation(gen);
+  static void ParseRange(const Keys& keys, const std::string& gen, const etcdwire::Range& range,
+                         std::vector<Entry>* entries, std::int64_t* headRevision) {
+    const std::string base = keys.Generation(gen);
     // Keys are compared as views against a suffix made once: a string built
     // per key cost a listing more than half the instructions of receiving it.
     const std::string firstPart = Keys::PartSuffix(0);
@@ -766,8 +841,8 @@ class EtcdStore final : public ConfigStore {
     const std::string exact = ExactCollection(want);
     Replies replies;
     std::vector<Entry> entries;
-    const Pointers pointers =
-        exact.empty() ? ReadPointers(exact) : ReadCollection(exact, instance, &replies, &entries);
+    const Pointers pointers = exact.empty() ? VisiblePointers(exact)
+                                            : ReadCollection(exact, instance, &replies, &entries);
 
     struct Listed {
       Order order;
@@ -784,7 +859,8 @@ class EtcdStore final : public ConfigStore {
       if (current && !(pending && pending->cleared)) {
         if (name != exact) {
           entries.clear();
-          ReadGeneration(current->gen, instance, pointers.revision, &replies.first, &entries);
+          ReadGeneration(*pointers.keys, current->gen, instance, pointers.revision, &replies.first,
+                         &entries);
         }
         for (const Entry& entry : entries) {
           if (pending &&
@@ -852,11 +928,16 @@ class EtcdStore final : public ConfigStore {
     }
     if (pendingNames.empty()) return;
     for (int attempt = 1;; ++attempt) {
+      // A catalogue an earlier version wrote moves under the store's own
+      // root with the first write, every collection of it in this commit's
+      // switch.
+      const std::optional<Pointers> legacy = LegacyPointers();
       Pointers now = ReadCommitState();
+      const Pointers& base = legacy ? *legacy : now;
       bool readAny = false;
       std::vector<std::string> touched;
       for (const std::string& name : pendingNames) {
-        const Current* current = Find(now, name);
+        const Current* current = Find(base, name);
         auto seen = observed_.find(name);
         if (seen != observed_.end()) {
           readAny = true;
@@ -867,9 +948,15 @@ class EtcdStore final : public ConfigStore {
         if (current || !txn_.collections.at(name).puts.empty()) touched.push_back(name);
       }
       if (touched.empty()) return;
+      if (legacy) {
+        for (const auto& entry : legacy->byCollection) touched.push_back(entry.first);
+        std::sort(touched.begin(), touched.end());
+        touched.erase(std::unique(touched.begin(), touched.end()), touched.end());
+      }
       const std::string token = NewId();
-      if (FitsInPlace(touched, now) ? CommitInPlace(touched, now, token)
-                                    : CommitGenerations(touched, now, token)) {
+      if (!legacy && FitsInPlace(touched, now)
+              ? CommitInPlace(touched, now, token)
+              : CommitGenerations(touched, base, token, now.orphans)) {
         return;
       }
       // Another writer got in between: only a transaction that read none of
@@ -1000,8 +1087,20 @@ class EtcdStore final : public ConfigStore {
     }
   }
 
-  bool CommitGenerations(const std::vector<std::string>& touched, const Pointers& now,
-                         const std::string& token) {
+  // What the open transaction did to "collection"; nothing when it left it
+  // alone (a collection an upgrade carries over).
+  const Pending& PendingFor(const std::string& collection) const {
+    static const Pending kUntouched;
+    auto it = txn_.collections.find(collection);
+    return it == txn_.collections.end() ? kUntouched : it->second;
+  }
+
+  // "base" holds the collections as they are now: under the store's own
+  // root, or under the old one when this commit moves them (then "touched"
+  // holds every one of them).
+  bool CommitGenerations(const std::vector<std::string>& touched, const Pointers& base,
+                         const std::string& token, const std::vector<std::string>& orphans) {
+    const bool upgrade = base.keys != &keys_;
     const std::int64_t lease = TakeLease();
     std::map<std::string, std::string> fresh;  // collection -> its new generation
     // The registrations go with the first batch of objects, in one
@@ -1043,14 +1142,14 @@ class EtcdStore final : public ConfigStore {
       }
       auto lastKeepAlive = leaseRenewed_;
       for (const std::string& name : touched) {
-        const Pending& pending = txn_.collections.at(name);
-        const Current* current = Find(now, name);
+        const Pending& pending = PendingFor(name);
+        const Current* current = Find(base, name);
         const std::string& gen = fresh[name];
         std::size_t written = 0;
         if (current && !pending.cleared) {
           etcdwire::Reply reply;
           std::vector<Entry> entries;
-          ReadGeneration(current->gen, nullptr, now.revision, &reply, &entries);
+          ReadGeneration(*base.keys, current->gen, nullptr, base.revision, &reply, &entries);
           for (const Entry& entry : entries) {
             if (pending.deleted.count(entry.instance) || pending.puts.count(entry.instance))
               continue;
@@ -1087,9 +1186,10 @@ class EtcdStore final : public ConfigStore {
     std::vector<RequestOp> ops;
     std::string anyWritten;
     for (const std::string& name : touched) {
-      const Current* current = Find(now, name);
+      const Current* current = Find(base, name);
       const std::string& gen = fresh[name];
-      AddCompareVersion(&txn, keys_.Pointer(name), current ? *current : Current());
+      AddCompareVersion(&txn, base.keys->Pointer(name), current ? *current : Current());
+      if (upgrade) AddCompareVersion(&txn, keys_.Pointer(name), Current());
       AddWriterAlive(&txn, gen);
       if (empty[name]) {
         AddDelete(&ops, keys_.Pointer(name));
@@ -1100,7 +1200,10 @@ class EtcdStore final : public ConfigStore {
         AddPut(&ops, keys_.Generation(gen), name);
         anyWritten = name;
       }
-      if (current) {
+      if (upgrade) {
+        // Its generations go after the switch, key by key (RemoveLegacy).
+        AddDelete(&ops, base.keys->Pointer(name));
+      } else if (current) {
         AddDeletePrefix(&ops, keys_.Generation(current->gen));
         AddDelete(&ops, keys_.Registered() + current->gen);
       }
@@ -1114,8 +1217,10 @@ class EtcdStore final : public ConfigStore {
     // The switch removed this commit's writer keys: the lease holds nothing
     // now and serves the next commit.
     lease_ = lease;
+    if (upgrade) layout_ = Layout::kCurrent;
     try {
-      RemoveOrphans(now.orphans);
+      RemoveOrphans(orphans);
+      if (upgrade) RemoveLegacy(base);
     } catch (const ConfigStoreException&) {
       // Tidying only: the commit stands, and a later writer tidies up.
     }
@@ -1150,7 +1255,7 @@ class EtcdStore final : public ConfigStore {
   // The pointers, and the generations a dead writer left, in one read.
   Pointers ReadCommitState() {
     TxnRequest snapshot;
-    *snapshot.add_success()->mutable_request_range() = PointersRequest(std::string());
+    *snapshot.add_success()->mutable_request_range() = PointersRequest(keys_, std::string());
     for (const std::string& prefix : {keys_.Registered(), keys_.Writers()}) {
       RangeRequest* range = snapshot.add_success()->mutable_request_range();
       range->set_key(prefix);
@@ -1162,7 +1267,7 @@ class EtcdStore final : public ConfigStore {
     if (reply.ranges.size() != 3) {
       client_.Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unexpected reply"), "read");
     }
-    Pointers now = PointersOf(reply.ranges[0], reply.revision);
+    Pointers now = PointersOf(keys_, reply.ranges[0], reply.revision);
     std::set<std::string> live;
     for (const etcdwire::KeyValue& kv : reply.ranges[2].kvs) {
       live.insert(std::string(kv.key.substr(keys_.Writers().size())));
@@ -1173,6 +1278,41 @@ class EtcdStore final : public ConfigStore {
       if (!live.count(gen)) now.orphans.push_back(std::move(gen));
     }
     return now;
+  }
+
+  // Deletes the generations of a catalogue an upgrade moved, which nothing
+  // points at any more. Only keys of the old layout's shapes go: the head,
+  // each object's parts and the registration. A store whose prefix lies
+  // inside the old root (one at "m/g/<gen>" beside "m") keeps all of its
+  // keys: after their \0 comes "p/", "g/", "r/" or "w/", never a part's
+  // four hexadecimal digits alone.
+  void RemoveLegacy(const Pointers& moved) {
+    std::vector<RequestOp> ops;
+    auto flush = [&](std::size_t limit) {
+      if (ops.size() >= limit) client_.Txn(TxnOf(&ops), true);
+    };
+    for (const auto& [name, current] : moved.byCollection) {
+      const std::string head = moved.keys->Generation(current.gen);
+      RangeRequest request;
+      request.set_key(head);
+      request.set_range_end(PrefixEnd(head));
+      request.set_keys_only(true);
+      etcdwire::Reply reply;
+      client_.Read(request, &reply);
+      for (const etcdwire::KeyValue& kv : reply.ranges[0].kvs) {
+        const std::string_view rest = std::string_view(kv.key).substr(head.size());
+        const std::size_t zero = rest.find('\0');
+        const bool object =
+            zero != std::string_view::npos && rest.size() == zero + 5 &&
+            rest.find_first_not_of("0123456789abcdef", zero + 1) == std::string_view::npos;
+        if (!rest.empty() && !object) continue;
+        AddDelete(&ops, std::string(kv.key));
+        flush(etcdlayout::kBatchOps);
+      }
+      AddDelete(&ops, moved.keys->Registered() + current.gen);
+      flush(etcdlayout::kBatchOps);
+    }
+    flush(1);
   }
 
   void RemoveOrphans(const std::vector<std::string>& orphans) {
@@ -1189,6 +1329,10 @@ class EtcdStore final : public ConfigStore {
   std::mutex mu_;
   EtcdClient client_;
   Keys keys_;
+  Keys legacyKeys_;
+  // Whether the old root may still hold this store's catalogue
+  // (LegacyPointers).
+  enum class Layout { kUnknown, kLegacy, kCurrent } layout_ = Layout::kUnknown;
   int depth_ = 0;
   TxnState txn_;
   std::vector<TxnState> saved_;  // the state at each inner Begin
