@@ -103,7 +103,7 @@ grpc::Status EtcdClient::Token(EtcdMember& member, Clock::time_point deadline, s
     grpc::ClientContext context;
     context.set_deadline(SystemTime(deadline));
     context.set_wait_for_ready(false);
-    const grpc::Status status = member.auth->Authenticate(&context, request, &response);
+    grpc::Status status = member.auth->Authenticate(&context, request, &response);
     if (status.ok()) {
       token_ = response.token();
     } else if (!Contains(status.error_message(), "authentication is not enabled")) {

@@ -78,7 +78,7 @@ class Socket {
     if (fd_ < 0) return false;
     fcntl(fd_, F_SETFL, fcntl(fd_, F_GETFL) & ~O_NONBLOCK);
     const int ms = MsUntil(deadline);
-    const timeval limit{ms / 1000, (ms % 1000) * 1000};
+    const timeval limit{ms / 1000, static_cast<suseconds_t>(ms % 1000) * 1000};
     setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
     setsockopt(fd_, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
     return true;
