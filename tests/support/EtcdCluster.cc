@@ -285,6 +285,14 @@ void EtcdCluster::Kill(int i) {
   members_[i].pid = -1;
 }
 
+void EtcdCluster::Pause(int i) {
+  if (members_.at(i).pid > 0) kill(members_[i].pid, SIGSTOP);
+}
+
+void EtcdCluster::Resume(int i) {
+  if (members_.at(i).pid > 0) kill(members_[i].pid, SIGCONT);
+}
+
 void EtcdCluster::Restart(int i) {
   Kill(i);
   members_[i].pid = Spawn(members_[i].argv, members_[i].dir + "/etcd.log");
@@ -335,6 +343,7 @@ void EtcdCluster::Stop() {
   for (Member& m : members_) {
     if (m.pid < 0) continue;
     kill(m.pid, SIGTERM);
+    kill(m.pid, SIGCONT);  // a paused member acts on it
     if (!Reap(m.pid, Clock::now() + std::chrono::milliseconds(500))) KillAndReap(m.pid);
     m.pid = -1;
   }

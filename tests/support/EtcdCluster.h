@@ -51,6 +51,10 @@ class EtcdCluster {
 
   // SIGKILL, and waits for the end.
   void Kill(int i);
+  // SIGSTOP and SIGCONT: a member that keeps its connections and answers
+  // nothing, as a hung machine would.
+  void Pause(int i);
+  void Resume(int i);
   // Same folder and ports, killing it first if it runs; returns once every
   // running member is healthy.
   void Restart(int i);

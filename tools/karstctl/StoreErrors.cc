@@ -111,6 +111,12 @@ const Names& StoreNames() {
       {kErrorBadLocator, "bad locator"},
       {kErrorConflict, "conflict"},
       {kErrorEtcdReply, "bad etcd reply"},
+      {kErrorTlsFile, "TLS file"},
+      {kErrorTlsUntrusted, "TLS untrusted"},
+      {kErrorTlsExpired, "TLS expired"},
+      {kErrorTlsName, "TLS name mismatch"},
+      {kErrorTlsClientCertificate, "TLS client certificate"},
+      {kErrorTlsProtocol, "TLS or plain text"},
   };
   return names;
 }

@@ -40,9 +40,20 @@ enum StoreErrorCode : std::int32_t {
   kErrorBadLocator = 1010,         // an etcd locator or option that cannot be used
   kErrorConflict = 1011,           // another writer changed what this transaction read or wrote
   kErrorEtcdReply = 1012,          // a reply from etcd that the store cannot read
+  // TLS with an etcd cluster, by what is wrong:
+  kErrorTlsFile = 1013,       // a CA, certificate or key file unreadable, not PEM of its kind,
+                              // or a key that is not the certificate's
+  kErrorTlsUntrusted = 1014,  // a member's certificate not signed by the CA given
+  kErrorTlsExpired = 1015,    // a certificate out of its validity: the CA's, the client's or a
+                              // member's
+  kErrorTlsName = 1016,       // a member's certificate that does not name the host dialled
+  kErrorTlsClientCertificate = 1017,  // a member that asks for a client certificate, or
+                                      // refuses the one given
+  kErrorTlsProtocol = 1018,           // plain text to a member that speaks TLS, or the reverse
   // etcd's own failures: this plus the gRPC status code, so 1104 is a
   // request that ran out of time (DEADLINE_EXCEEDED), 1114 a cluster that
-  // cannot be reached (UNAVAILABLE), 1116 refused credentials
+  // cannot be reached (UNAVAILABLE: every member refused the connection, or
+  // one was lost mid-request), 1116 refused credentials
   // (UNAUTHENTICATED) and 1107 a user without the right (PERMISSION_DENIED).
   kErrorEtcdBase = 1100,
 };

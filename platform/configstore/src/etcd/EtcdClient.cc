@@ -1,67 +1,62 @@
 #include "EtcdClient.h"
 
-#include <netdb.h>
-#include <sys/socket.h>
+#include <grpcpp/impl/client_unary_call.h>
 
 #include <algorithm>
-#include <fstream>
-#include <sstream>
+#include <cstring>
 #include <thread>
 #include <vector>
 
 namespace TavoConfigStore {
 namespace {
 
-std::string ReadPem(const std::string& path, const char* what) {
-  std::ifstream in(path, std::ios::binary);
-  std::ostringstream text;
-  text << in.rdbuf();
-  if (!in || text.str().empty()) {
-    throw ConfigStoreException("etcd: cannot read the " + std::string(what) + " file " + path,
-                               kErrorBadLocator);
+using Clock = std::chrono::steady_clock;
+using std::chrono::milliseconds;
+
+// The first round gives each member this long to answer (half the timeout
+// when that is less), each later round twice as long as the one before: a
+// hung member holds a request about a second, and a slow but healthy one
+// still gets the time a large reply needs.
+constexpr milliseconds kFirstAttempt{1000};
+// After a round in which every member said "not now" (an election under
+// way), the next starts after this pause.
+constexpr milliseconds kBetweenRounds{50};
+// A handshake of the client's own, to tell why TLS failed.
+constexpr milliseconds kProbeLimit{1000};
+// What a call may wait beyond its timeout to settle a failed write.
+constexpr milliseconds kSettling{1000};
+
+std::chrono::system_clock::time_point SystemTime(Clock::time_point deadline) {
+  return std::chrono::system_clock::now() +
+         std::chrono::duration_cast<std::chrono::system_clock::duration>(deadline - Clock::now());
+}
+
+bool Contains(const std::string& text, const char* part) {
+  return text.find(part) != std::string::npos;
+}
+
+// gRPC's account of a failed connection without its frame: "failed to
+// connect to all addresses; last error: UNKNOWN: ipv4:127.0.0.1:1: Failed to
+// connect to remote host: Connection refused" becomes the part after the
+// address.
+std::string LastError(const std::string& message) {
+  std::string last = message;
+  const std::size_t at = last.find("last error: ");
+  if (at != std::string::npos) last.erase(0, at + 12);
+  for (const char* scheme : {"ipv4:", "ipv6:", "unix:"}) {
+    const std::size_t address = last.find(scheme);
+    const std::size_t end =
+        address == std::string::npos ? address : last.find(": ", address + std::strlen(scheme));
+    if (end != std::string::npos) return last.substr(end + 2);
   }
-  return text.str();
+  return last;
 }
 
-std::string HostOf(const std::string& endpoint) {
-  std::string host = endpoint.substr(0, endpoint.rfind(':'));
-  if (host.size() > 1 && host.front() == '[') host = host.substr(1, host.size() - 2);
-  return host;
-}
-
-// gRPC takes one name, or a list of addresses: several members are resolved
-// here so that the channel can move from one to the next.
-std::string Target(const std::vector<std::string>& endpoints) {
-  if (endpoints.size() == 1) return "dns:///" + endpoints[0];
-  std::string v4;
-  std::string v6;
-  for (const std::string& endpoint : endpoints) {
-    const std::string port = endpoint.substr(endpoint.rfind(':') + 1);
-    addrinfo hints{};
-    hints.ai_socktype = SOCK_STREAM;
-    addrinfo* found = nullptr;
-    if (getaddrinfo(HostOf(endpoint).c_str(), port.c_str(), &hints, &found) != 0) {
-      throw ConfigStoreException("etcd: cannot resolve the endpoint " + endpoint,
-                                 kErrorEtcdBase + static_cast<int>(grpc::StatusCode::UNAVAILABLE));
-    }
-    for (addrinfo* a = found; a != nullptr; a = a->ai_next) {
-      char host[NI_MAXHOST];
-      if (getnameinfo(a->ai_addr, a->ai_addrlen, host, sizeof host, nullptr, 0, NI_NUMERICHOST) !=
-          0) {
-        continue;
-      }
-      if (a->ai_family == AF_INET) v4 += (v4.empty() ? "" : ",") + std::string(host) + ":" + port;
-      if (a->ai_family == AF_INET6) {
-        v6 += (v6.empty() ? "" : ",") + std::string("[") + host + "]:" + port;
-      }
-    }
-    freeaddrinfo(found);
-  }
-  return v4.empty() ? "ipv6:" + v6 : "ipv4:" + v4;
-}
-
-bool RetriesOn(const grpc::Status& status) {
-  return status.error_code() == grpc::StatusCode::UNAVAILABLE;
+// Whether the status says the channel could not connect, so the request
+// was never sent.
+bool NotConnected(const std::string& message) {
+  return Contains(message, "failed to connect to all addresses") ||
+         Contains(message, "empty address list") || Contains(message, "DNS resolution failed");
 }
 
 }  // namespace
@@ -77,131 +72,238 @@ std::string PrefixEnd(std::string prefix) {
   return std::string(1, '\0');  // every key
 }
 
-EtcdClient::EtcdClient(const EtcdStoreOptions& options) : options_(options) {
+EtcdClient::EtcdClient(const EtcdStoreOptions& options)
+    : options_(options),
+      material_(options.tls ? LoadTlsMaterial(options) : TlsMaterial()),
+      members_(options, material_),
+      budget_(milliseconds(options.timeoutMs)) {
   where_ = "etcd ";
   for (std::size_t i = 0; i < options.endpoints.size(); ++i) {
     where_ += (i ? "," : "") + options.endpoints[i];
   }
-  std::shared_ptr<grpc::ChannelCredentials> credentials = grpc::InsecureChannelCredentials();
-  grpc::ChannelArguments arguments;
-  arguments.SetMaxReceiveMessageSize(-1);
-  arguments.SetMaxSendMessageSize(-1);
-  arguments.SetLoadBalancingPolicyName("pick_first");
-  if (options.tls) {
-    grpc::SslCredentialsOptions ssl;
-    if (!options.caFile.empty()) ssl.pem_root_certs = ReadPem(options.caFile, "CA certificate");
-    if (!options.certFile.empty()) {
-      ssl.pem_cert_chain = ReadPem(options.certFile, "client certificate");
-      ssl.pem_private_key = ReadPem(options.keyFile, "client key");
-    }
-    credentials = grpc::SslCredentials(ssl);
-    // The certificate must name the host the locator names, whatever address
-    // the connection ends up on.
-    arguments.SetSslTargetNameOverride(HostOf(options.endpoints.at(0)));
-  }
-  channel_ = grpc::CreateCustomChannel(Target(options.endpoints), credentials, arguments);
-  kv_ = etcdserverpb::KV::NewStub(channel_);
-  rangeMethod_ = std::make_unique<grpc::internal::RpcMethod>(
-      "/etcdserverpb.KV/Range", grpc::internal::RpcMethod::NORMAL_RPC, channel_);
-  txnMethod_ = std::make_unique<grpc::internal::RpcMethod>(
-      "/etcdserverpb.KV/Txn", grpc::internal::RpcMethod::NORMAL_RPC, channel_);
-  lease_ = etcdserverpb::Lease::NewStub(channel_);
-  watch_ = etcdserverpb::Watch::NewStub(channel_);
-  auth_ = etcdserverpb::Auth::NewStub(channel_);
 }
 
 void EtcdClient::Fail(const grpc::Status& status, const char* what) const {
-  std::string message = where_ + ": " + what + ": ";
-  if (status.error_code() != grpc::StatusCode::DEADLINE_EXCEEDED) {
-    message += status.error_message();
-  } else if (channel_->GetState(false) == GRPC_CHANNEL_TRANSIENT_FAILURE) {
-    message += "could not connect to any member within " + std::to_string(options_.timeoutMs) +
-               " ms (refused, unreachable, or the TLS handshake failed)";
-  } else {
-    message += "no answer within " + std::to_string(options_.timeoutMs) + " ms";
-  }
-  throw ConfigStoreException(message, kErrorEtcdBase + static_cast<int>(status.error_code()));
+  throw ConfigStoreException(where_ + ": " + what + ": " + status.error_message(),
+                             kErrorEtcdBase + static_cast<int>(status.error_code()));
 }
 
-void EtcdClient::Prepare(grpc::ClientContext* context) {
-  // Wait for a member to answer until the deadline instead of failing at
-  // the first refused connection.
-  context->set_wait_for_ready(true);
-  if (!options_.user.empty()) {
-    Authenticate(std::min(context->deadline(), std::chrono::system_clock::now() +
-                                                   std::chrono::milliseconds(options_.timeoutMs)));
-    std::lock_guard<std::mutex> lock(tokenMu_);
-    if (!token_.empty()) context->AddMetadata("token", token_);
-  }
+void EtcdClient::AllowSettling() {
+  budget_.Extend(std::min(kSettling, milliseconds(options_.timeoutMs / 5)));
 }
 
-void EtcdClient::Authenticate(std::chrono::system_clock::time_point deadline) {
+grpc::Status EtcdClient::Token(EtcdMember& member, Clock::time_point deadline, std::string* token) {
+  if (options_.user.empty()) return grpc::Status::OK;
   std::lock_guard<std::mutex> lock(tokenMu_);
-  if (authenticated_) return;
-  etcdserverpb::AuthenticateRequest request;
-  request.set_name(options_.user);
-  request.set_password(options_.password);
-  etcdserverpb::AuthenticateResponse response;
-  grpc::ClientContext context;
-  context.set_deadline(deadline);
-  context.set_wait_for_ready(true);
-  const grpc::Status status = auth_->Authenticate(&context, request, &response);
-  if (status.ok()) {
-    token_ = response.token();
-  } else if (status.error_message().find("authentication is not enabled") == std::string::npos) {
-    Fail(status, ("authenticating as user " + options_.user).c_str());
+  if (!authenticated_) {
+    etcdserverpb::AuthenticateRequest request;
+    request.set_name(options_.user);
+    request.set_password(options_.password);
+    etcdserverpb::AuthenticateResponse response;
+    grpc::ClientContext context;
+    context.set_deadline(SystemTime(deadline));
+    context.set_wait_for_ready(false);
+    grpc::Status status = member.auth->Authenticate(&context, request, &response);
+    if (status.ok()) {
+      token_ = response.token();
+    } else if (!Contains(status.error_message(), "authentication is not enabled")) {
+      // The member's own trouble is told apart from a refusal of the user.
+      if (status.error_code() == grpc::StatusCode::UNAVAILABLE ||
+          status.error_code() == grpc::StatusCode::DEADLINE_EXCEEDED) {
+        return status;
+      }
+      return grpc::Status(status.error_code(), "authenticating as user " + options_.user + ": " +
+                                                   status.error_message());
+    }
+    authenticated_ = true;
   }
-  authenticated_ = true;
+  *token = token_;
+  return grpc::Status::OK;
 }
 
-template <typename Call>
-grpc::Status EtcdClient::Invoke(const Call& call, bool retry) {
-  // One deadline for every attempt: a request ends within the timeout
-  // however often a member drops it.
-  const auto deadline =
-      std::chrono::system_clock::now() + std::chrono::milliseconds(options_.timeoutMs);
+void EtcdClient::ForgetToken() {
+  std::lock_guard<std::mutex> lock(tokenMu_);
+  authenticated_ = false;
+  token_.clear();
+}
+
+TlsFinding EtcdClient::Diagnose(std::size_t i, const std::string& lastError,
+                                Clock::time_point deadline) {
+  const std::string& endpoint = members_[i].endpoint;
+  if (Contains(lastError, "Connection refused")) return {0, "connection refused"};
+  if (Contains(lastError, "Peer name ")) {
+    return {kErrorTlsName, "its certificate does not name " + HostOf(endpoint)};
+  }
+  const auto key = std::make_pair(i, lastError);
+  {
+    std::lock_guard<std::mutex> lock(findingsMu_);
+    auto known = findings_.find(key);
+    if (known != findings_.end()) return known->second;
+  }
+  const auto left = std::chrono::duration_cast<milliseconds>(deadline - Clock::now());
+  TlsFinding finding = ProbeTls(endpoint, options_, material_, std::min(kProbeLimit, left));
+  if (finding.code == 0 && options_.tls && Contains(lastError, "certificate verify failed")) {
+    finding = {kErrorTlsUntrusted,
+               "its certificate is not signed by " +
+                   (options_.caFile.empty() ? std::string("a CA this host trusts (no cacert given)")
+                                            : "the CA in " + options_.caFile)};
+  }
+  if (finding.code == 0) return {0, lastError};
+  std::lock_guard<std::mutex> lock(findingsMu_);
+  findings_[key] = finding;
+  return finding;
+}
+
+EtcdClient::Outcome EtcdClient::Classify(std::size_t i, const grpc::Status& status,
+                                         Clock::time_point deadline, TlsFinding* why) {
+  const std::string& message = status.error_message();
+  switch (status.error_code()) {
+    case grpc::StatusCode::DEADLINE_EXCEEDED:
+      why->text = members_[i].channel->GetState(false) == GRPC_CHANNEL_READY
+                      ? "no answer"
+                      : "not connected in time";
+      return Outcome::kNoAnswer;
+    case grpc::StatusCode::RESOURCE_EXHAUSTED:
+      if (!Contains(message, "too many requests")) return Outcome::kAnswer;
+      why->text = message;
+      return Outcome::kBusy;
+    case grpc::StatusCode::UNAVAILABLE:
+      break;
+    default:
+      return Outcome::kAnswer;
+  }
+  if (!NotConnected(message)) {
+    // etcd's answers during an election ("no leader", "leader changed",
+    // "request timed out"), or a connection lost mid-request.
+    why->text = message;
+    return Outcome::kBusy;
+  }
+  const std::string lastError = LastError(message);
+  // A connection that was accepted but not answered in time, during the
+  // TLS handshake or before etcd's first HTTP/2 frame.
+  if (Contains(lastError, "timed out") || Contains(lastError, "handshaker shutdown")) {
+    why->text = "accepted the connection but did not answer";
+    return Outcome::kNoAnswer;
+  }
+  *why = Diagnose(i, lastError, deadline);
+  return Outcome::kUnreachable;
+}
+
+template <typename Send>
+grpc::Status EtcdClient::Invoke(const char* what, bool retry, const Send& send,
+                                std::size_t* answeredBy, bool counted) {
+  const Clock::time_point deadline =
+      counted ? budget_.Deadline(Clock::now()) : Clock::now() + milliseconds(options_.timeoutMs);
+  const Clock::duration first =
+      std::min<Clock::duration>(kFirstAttempt, milliseconds(std::max(1, options_.timeoutMs / 2)));
+  // What each member did with the request, last time it was tried.
+  std::vector<std::string> story(members_.Size());
+  std::int32_t tlsCode = 0;
   bool reauthenticated = false;
-  while (true) {
-    grpc::ClientContext context;
-    context.set_deadline(deadline);
-    Prepare(&context);
-    grpc::Status status = call(&context);
-    if (status.ok()) return status;
-    // Tokens expire when unused for a while (five minutes by default).
-    if (status.error_code() == grpc::StatusCode::UNAUTHENTICATED && !options_.user.empty() &&
-        !reauthenticated) {
-      reauthenticated = true;
-      std::lock_guard<std::mutex> lock(tokenMu_);
-      authenticated_ = false;
-      token_.clear();
-      continue;
+  auto told = [&] {
+    std::string text;
+    for (std::size_t i = 0; i < story.size(); ++i) {
+      if (story[i].empty()) continue;
+      text += (text.empty() ? "" : "; ") + members_[i].endpoint + ": " + story[i];
     }
-    if (!retry || !RetriesOn(status) || std::chrono::system_clock::now() >= deadline) {
-      return status;
+    return text;
+  };
+  for (int round = 0;; ++round) {
+    bool reached = false;  // a member took the request, or may take it soon
+    bool stalled = false;
+    for (const std::size_t i : members_.Order()) {
+      const Clock::time_point start = Clock::now();
+      if (start >= deadline) break;
+      const Clock::time_point attemptEnd =
+          !retry || members_.Size() == 1
+              ? deadline
+              : std::min(deadline, start + first * (1 << std::min(round, 4)));
+      EtcdMember& member = members_[i];
+      grpc::Status status;
+      while (true) {
+        grpc::ClientContext context;
+        context.set_deadline(SystemTime(attemptEnd));
+        // A refused connection fails the attempt at once, so the next member
+        // is tried rather than this one waited for.
+        context.set_wait_for_ready(false);
+        std::string token;
+        status = Token(member, attemptEnd, &token);
+        if (status.ok()) {
+          if (!token.empty()) context.AddMetadata("token", token);
+          status = send(member, &context);
+        }
+        // Tokens expire when unused for a while (five minutes by default).
+        if (status.error_code() != grpc::StatusCode::UNAUTHENTICATED || options_.user.empty() ||
+            reauthenticated) {
+          break;
+        }
+        reauthenticated = true;
+        ForgetToken();
+      }
+      TlsFinding why;
+      const Outcome outcome = Classify(i, status, attemptEnd, &why);
+      if (outcome == Outcome::kAnswer) {
+        members_.Answered(i);
+        if (answeredBy) *answeredBy = i;
+        return status;
+      }
+      if (counted) budget_.Charge(start, Clock::now());
+      story[i] = why.text;
+      if (outcome == Outcome::kUnreachable) {
+        if (tlsCode == 0) tlsCode = why.code;
+        continue;
+      }
+      reached = true;
+      if (outcome == Outcome::kNoAnswer) {
+        members_.Stalled(i);
+        stalled = true;
+      } else if (!retry) {
+        return status;  // it may have been applied: not sent again
+      }
     }
-    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    const Clock::time_point now = Clock::now();
+    if (now >= deadline) {
+      const std::string text = told();
+      throw ConfigStoreException(
+          where_ + ": " + what + ": no answer within " + std::to_string(options_.timeoutMs) +
+              " ms" +
+              (text.empty() ? " (this call has waited that long for members already)"
+                            : " (" + text + ")"),
+          kErrorEtcdBase + static_cast<int>(grpc::StatusCode::DEADLINE_EXCEEDED));
+    }
+    if (!reached) {
+      throw ConfigStoreException(
+          where_ + ": " + what + ": could not connect to any member: " + told(),
+          tlsCode != 0 ? tlsCode
+                       : kErrorEtcdBase + static_cast<int>(grpc::StatusCode::UNAVAILABLE));
+    }
+    if (!stalled) {
+      std::this_thread::sleep_until(std::min(deadline, now + kBetweenRounds));
+      if (counted) budget_.Charge(now, Clock::now());
+    }
   }
 }
 
 etcdserverpb::TxnResponse EtcdClient::Txn(const etcdserverpb::TxnRequest& request, bool retry) {
   etcdserverpb::TxnResponse response;
-  const grpc::Status status = Invoke(
-      [&](grpc::ClientContext* context) { return kv_->Txn(context, request, &response); }, retry);
+  const grpc::Status status =
+      Invoke("write", retry, [&](EtcdMember& member, grpc::ClientContext* context) {
+        return member.kv->Txn(context, request, &response);
+      });
   if (!status.ok()) Fail(status, "write");  // reads go through Read
   return response;
 }
 
 template <typename Request>
-void EtcdClient::Receive(const grpc::internal::RpcMethod& method, const Request& request,
+void EtcdClient::Receive(grpc::internal::RpcMethod EtcdMember::*method, const Request& request,
                          etcdwire::Reply* reply) {
   grpc::ByteBuffer received;
-  const grpc::Status status = Invoke(
-      [&](grpc::ClientContext* context) {
+  const grpc::Status status =
+      Invoke("read", true, [&](EtcdMember& member, grpc::ClientContext* context) {
         return grpc::internal::BlockingUnaryCall<Request, grpc::ByteBuffer,
                                                  grpc::protobuf::MessageLite, grpc::ByteBuffer>(
-            channel_.get(), method, context, request, &received);
-      },
-      true);
+            member.channel.get(), member.*method, context, request, &received);
+      });
   if (!status.ok()) Fail(status, "read");
   // A large reply arrives in several slices; the views need one.
   if (!received.TrySingleSlice(&reply->bytes).ok() &&
@@ -211,14 +313,14 @@ void EtcdClient::Receive(const grpc::internal::RpcMethod& method, const Request&
 }
 
 void EtcdClient::Read(const etcdserverpb::RangeRequest& request, etcdwire::Reply* reply) {
-  Receive(*rangeMethod_, request, reply);
+  Receive(&EtcdMember::range, request, reply);
   if (!etcdwire::ParseRangeResponse(reply)) {
     Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unreadable reply"), "read");
   }
 }
 
 void EtcdClient::Read(const etcdserverpb::TxnRequest& request, etcdwire::Reply* reply) {
-  Receive(*txnMethod_, request, reply);
+  Receive(&EtcdMember::txn, request, reply);
   if (!etcdwire::ParseTxnResponse(reply)) {
     Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unreadable reply"), "read");
   }
@@ -228,17 +330,18 @@ std::int64_t EtcdClient::LeaseGrant(std::int64_t ttlSeconds) {
   etcdserverpb::LeaseGrantRequest request;
   request.set_ttl(ttlSeconds);
   etcdserverpb::LeaseGrantResponse response;
-  const grpc::Status status = Invoke(
-      [&](grpc::ClientContext* context) { return lease_->LeaseGrant(context, request, &response); },
-      true);
+  const grpc::Status status =
+      Invoke("lease grant", true, [&](EtcdMember& member, grpc::ClientContext* context) {
+        return member.lease->LeaseGrant(context, request, &response);
+      });
   if (!status.ok()) Fail(status, "lease grant");
   return response.id();
 }
 
 void EtcdClient::LeaseKeepAlive(std::int64_t lease) {
-  const grpc::Status status = Invoke(
-      [&](grpc::ClientContext* context) {
-        auto stream = lease_->LeaseKeepAlive(context);
+  const grpc::Status status =
+      Invoke("lease keep-alive", true, [&](EtcdMember& member, grpc::ClientContext* context) {
+        auto stream = member.lease->LeaseKeepAlive(context);
         etcdserverpb::LeaseKeepAliveRequest request;
         request.set_id(lease);
         etcdserverpb::LeaseKeepAliveResponse response;
@@ -249,8 +352,7 @@ void EtcdClient::LeaseKeepAlive(std::int64_t lease) {
           return grpc::Status(grpc::StatusCode::NOT_FOUND, "the writer's lease has expired");
         }
         return finished;
-      },
-      true);
+      });
   if (!status.ok()) Fail(status, "lease keep-alive");
 }
 
@@ -258,16 +360,38 @@ void EtcdClient::LeaseRevoke(std::int64_t lease) {
   etcdserverpb::LeaseRevokeRequest request;
   request.set_id(lease);
   etcdserverpb::LeaseRevokeResponse response;
-  const grpc::Status status = Invoke(
-      [&](grpc::ClientContext* context) {
-        return lease_->LeaseRevoke(context, request, &response);
-      },
-      true);
+  const grpc::Status status =
+      Invoke("lease revoke", true, [&](EtcdMember& member, grpc::ClientContext* context) {
+        return member.lease->LeaseRevoke(context, request, &response);
+      });
   // A lease that is gone already (run out, or revoked by an earlier attempt
   // whose answer was lost) is what was asked for.
   if (!status.ok() && status.error_code() != grpc::StatusCode::NOT_FOUND) {
     Fail(status, "lease revoke");
   }
+}
+
+etcdserverpb::Watch::Stub& EtcdClient::WatchStub(const std::string& key,
+                                                 grpc::ClientContext* context,
+                                                 std::size_t* member) {
+  etcdserverpb::RangeRequest request;
+  request.set_key(key);
+  request.set_limit(1);
+  request.set_keys_only(true);
+  // Any answer will do, a refusal too: the watch then reports it.
+  Invoke(
+      "watch", true,
+      [&](EtcdMember& m, grpc::ClientContext* c) {
+        grpc::ByteBuffer received;
+        return grpc::internal::BlockingUnaryCall<etcdserverpb::RangeRequest, grpc::ByteBuffer,
+                                                 grpc::protobuf::MessageLite, grpc::ByteBuffer>(
+            m.channel.get(), m.range, c, request, &received);
+      },
+      member, false);
+  context->set_wait_for_ready(false);
+  std::lock_guard<std::mutex> lock(tokenMu_);
+  if (!token_.empty()) context->AddMetadata("token", token_);
+  return *members_[*member].watch;
 }
 
 }  // namespace TavoConfigStore

@@ -284,8 +284,10 @@ class ChangeFeed {
   void Run() {
     while (true) {
       auto context = std::make_shared<grpc::ClientContext>();
+      std::size_t member = 0;
+      etcdserverpb::Watch::Stub* stub = nullptr;
       try {
-        client_.Prepare(context.get());
+        stub = &client_.WatchStub(key_, context.get(), &member);
       } catch (const ConfigStoreException&) {
         // Credentials refused or cluster away: the wait below says "look
         // again", and the caller's read reports the failure.
@@ -295,25 +297,7 @@ class ChangeFeed {
         if (stopping_) return;
         context_ = context;
       }
-      auto stream = client_.WatchStub().Watch(context.get());
-      etcdserverpb::WatchRequest request;
-      auto* create = request.mutable_create_request();
-      create->set_key(key_);
-      create->set_range_end(PrefixEnd(key_));
-      create->set_start_revision(next_);
-      etcdserverpb::WatchResponse response;
-      if (stream->Write(request)) {
-        while (stream->Read(&response)) {
-          if (response.compact_revision() > 0) next_ = response.compact_revision();
-          if (response.events_size() > 0) {
-            next_ = response.events(response.events_size() - 1).kv().mod_revision() + 1;
-          }
-          if (response.events_size() > 0 || response.compact_revision() > 0) Signal();
-          if (response.canceled()) break;
-        }
-      }
-      context->TryCancel();
-      stream->Finish();
+      if (stub != nullptr) Follow(*stub, context.get(), member);
       {
         std::unique_lock<std::mutex> lock(mu_);
         context_.reset();
@@ -326,6 +310,31 @@ class ChangeFeed {
         if (stopping_) return;
       }
     }
+  }
+
+  // Reads the watch's events until the stream ends; a stream that broke
+  // sends the next watch to another member.
+  void Follow(etcdserverpb::Watch::Stub& stub, grpc::ClientContext* context, std::size_t member) {
+    auto stream = stub.Watch(context);
+    etcdserverpb::WatchRequest request;
+    auto* create = request.mutable_create_request();
+    create->set_key(key_);
+    create->set_range_end(PrefixEnd(key_));
+    create->set_start_revision(next_);
+    etcdserverpb::WatchResponse response;
+    if (stream->Write(request)) {
+      while (stream->Read(&response)) {
+        if (response.compact_revision() > 0) next_ = response.compact_revision();
+        if (response.events_size() > 0) {
+          next_ = response.events(response.events_size() - 1).kv().mod_revision() + 1;
+        }
+        if (response.events_size() > 0 || response.compact_revision() > 0) Signal();
+        if (response.canceled()) break;
+      }
+    }
+    context->TryCancel();
+    const grpc::Status status = stream->Finish();
+    if (status.error_code() != grpc::StatusCode::CANCELLED) client_.StreamLost(member);
   }
 
   void Signal() {
@@ -497,9 +506,13 @@ class EtcdStore final : public ConfigStore {
   // cannot commit without the cluster. So a caller that goes on after a
   // failure (a reset clearing one collection after another) still ends
   // within about one timeout.
+  //
+  // The requests of one call share one wait (EtcdClient::Call): a member
+  // that did not answer one of them costs the call its wait once.
   template <typename Call>
   auto Reaching(const Call& call) -> decltype(call()) {
     if (depth_ > 0 && unreachable_) throw ConfigStoreException(*unreachable_);
+    const EtcdClient::Call counted(client_);
     try {
       return call();
     } catch (const ConfigStoreException& e) {
@@ -895,6 +908,7 @@ class EtcdStore final : public ConfigStore {
       return;
     }
     depth_ = 1;
+    const EtcdClient::Call counted(client_);
     try {
       change();
       Apply();
@@ -1043,6 +1057,9 @@ class EtcdStore final : public ConfigStore {
     } catch (const ConfigStoreException&) {
       bool committed = false;
       try {
+        // The call has waited its time for the switch; telling its outcome
+        // may take a little more.
+        client_.AllowSettling();
         // A switch compares on its writer's key: once the lease that key
         // lives on is revoked, a request still on its way can no longer be
         // applied, and the pointer tells for certain.
