@@ -382,13 +382,10 @@ TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
        "karstctl: configuration store " + store_ +
            ": starting a transaction: database is locked (SQLITE_BUSY, 5)\n"},
       {{"--store", garbage, "watch"}, "(SQLITE_NOTADB, 26)\n"},
-      // A bad etcd locator, never with its password; a good one is no file.
-      {{"--store", "etcd://u:cret/cret@h:1/p", "watch"},
-       "karstctl: etcd locator: '@' after the endpoints: write it as %40, and a '/' in a user "
-       "name or password as %2F (bad locator, 1010)\n"},
-      {{"--store", "etcd://u:cret@h/p", "blob", "default", "u"},
-       "karstctl: etcd locator: endpoint \"h\" is not HOST:PORT (bad locator, 1010)\n"},
+      // A good etcd locator is no file.
       {{"--store", "etcd://127.0.0.1:9/p", "--wait", "1", "export"}, " (etcd "},
+      // A path may look like a locator; its password is not shown.
+      {{"--store", "./etcd:/u:cret@h:1/p", "hash"}, "karstctl: no store at ./etcd:***@h:1/p\n"},
   };
   for (const auto& [args, err] : cases) {
     const auto start = std::chrono::steady_clock::now();
@@ -398,11 +395,6 @@ TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
   EXPECT_NE(access(none.c_str(), F_OK), 0);
   ExpectFailure(RunTool({"--store", garbage, "import", "-"}, "["), 2, "<stdin>:1:2: ");
   EXPECT_EQ(ReadFile(garbage), std::string(8192, 'G'));
-  // A bad locator, though, comes before the input, from the environment too.
-  setenv("TAVO_CONFIGSTORE_PATH", "etcds://u:cret@h:1/p?cert=c", 1);
-  ExpectFailure(RunTool({"import", "-"}, "["), 1,
-                "karstctl: etcd locator: a client certificate needs its key and a key its "
-                "certificate (cert and key) (bad locator, 1010)\n");
 
   // Without a store path nor anything to derive one from, nothing is guessed.
   std::vector<std::pair<std::string, std::string>> saved;
@@ -412,6 +404,31 @@ TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
   }
   ExpectFailure(RunTool({"export"}), 1, "(no store path, 1008)\n");
   for (const auto& [name, value] : saved) setenv(name.c_str(), value.c_str(), 1);
+}
+
+// A locator that cannot be used, from --store or the environment, is a usage
+// error found before the input is read, and nothing is created for it.
+TEST_F(Karstctl, BadLocatorsExitTwoBeforeAnythingIsCreated) {
+  const std::string cwd = std::filesystem::current_path(), here = dir_.File("here");
+  std::filesystem::create_directory(here);
+  std::filesystem::current_path(here);
+  const std::pair<std::vector<std::string>, std::string> cases[] = {
+      {{"--store", "ETCD://u:cret@h:1/p", "import", "-"},
+       "karstctl: store locator \"ETCD://u:***@h:1/p\" looks like a URL but is no etcd:// or "
+       "etcds:// locator; put ./ in front to make it a file path (bad locator, 1010)\n"},
+      {{"--store", "etcd://u:cret/cret@h:1/p", "watch"},
+       "karstctl: etcd locator: '@' after the endpoints: write it as %40, and a '/' in a user "
+       "name or password as %2F (bad locator, 1010)\n"},
+      {{"--store", "etcd://u:cret@h/p", "blob", "default", "u"},
+       "karstctl: etcd locator: endpoint \"h\" is not HOST:PORT (bad locator, 1010)\n"},
+      {{"policies", "set", "-"},
+       "karstctl: etcd locator: a client certificate needs its key and a key its "
+       "certificate (cert and key) (bad locator, 1010)\n"},
+  };
+  setenv("TAVO_CONFIGSTORE_PATH", "etcds://u:cret@h:1/p?cert=c", 1);
+  for (const auto& [args, err] : cases) ExpectFailure(RunTool(args, "["), 2, err);
+  std::filesystem::current_path(cwd);
+  EXPECT_TRUE(std::filesystem::is_empty(here));
 }
 
 // watch prints hash's digests on one line, then a line at each change, soon

@@ -154,7 +154,7 @@ void RunCommand(const Invocation& invocation) {
     default:
       break;
   }
-  StoreSession session(invocation);  // a bad etcd locator fails here, before any input
+  StoreSession session(invocation);  // a bad locator fails here, before any input
   switch (invocation.command) {
     case Command::kReset:
       session.Open(StoreUse::kWrite);

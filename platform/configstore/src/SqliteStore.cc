@@ -95,7 +95,7 @@ struct OneShot {
 class SqliteStore final : public ConfigStore {
  public:
   SqliteStore(const std::string& path, const SqliteStoreOptions& options)
-      : path_(path), options_(options) {
+      : path_(path), where_("configuration store " + RedactLocator(path)), options_(options) {
     if (path.empty()) {
       throw ConfigStoreException("configuration store: empty path", kErrorNoStorePath);
     }
@@ -340,15 +340,17 @@ class SqliteStore final : public ConfigStore {
     struct stat st {};
     if (lstat(file.c_str(), &st) == 0) {
       if (S_ISLNK(st.st_mode)) {
-        throw ConfigStoreException(
-            Where() + ": " + file + " is a symbolic link; the store does not follow links",
-            kErrorSymlink);
+        throw ConfigStoreException(Where() + ": " + RedactLocator(file) +
+                                       " is a symbolic link; the store does not follow links",
+                                   kErrorSymlink);
       }
       return true;
     }
-    if (errno == ENOENT || errno == ENOTDIR) return false;
-    throw ConfigStoreException(Where() + ": cannot look up " + file + ": " + std::strerror(errno),
-                               SQLITE_CANTOPEN);
+    const int error = errno;
+    if (error == ENOENT || error == ENOTDIR) return false;
+    throw ConfigStoreException(
+        Where() + ": cannot look up " + RedactLocator(file) + ": " + std::strerror(error),
+        SQLITE_CANTOPEN);
   }
 
   // Missing directories 0700 and the file 0600, whatever the umask allows:
@@ -364,9 +366,12 @@ class SqliteStore final : public ConfigStore {
       at = next;
       if (dir.empty() || dir.back() == '/') continue;  // "/" or "a//b"
       if (mkdir(dir.c_str(), 0700) != 0 && errno != EEXIST) {
-        throw ConfigStoreException(
-            Where() + ": cannot create directory " + dir + ": " + std::strerror(errno),
-            SQLITE_CANTOPEN);
+        const int error = errno;
+        // A folder's name could end inside a password the whole path hides.
+        const bool hidden = RedactLocator(path_) != path_;
+        throw ConfigStoreException(Where() + ": cannot create directory " +
+                                       (hidden ? "on its path" : dir) + ": " + std::strerror(error),
+                                   SQLITE_CANTOPEN);
       }
     }
     // Made under a name of its own and linked into place: closing a
@@ -502,7 +507,9 @@ class SqliteStore final : public ConfigStore {
     }
   }
 
-  std::string Where() const { return "configuration store " + path_; }
+  // Names the store in every message, never with a password that a
+  // URL-like path may hold.
+  const std::string& Where() const { return where_; }
 
   // Once SQLite has rolled the caller's transaction back by itself (full
   // disk, I/O error, interrupt), a write would be committed on its own at
@@ -774,6 +781,7 @@ class SqliteStore final : public ConfigStore {
   // between threads anyway (SetGlobalStore) from corrupting the connection.
   std::mutex mu_;
   std::string path_;
+  std::string where_;
   Connection conn_;
   sqlite3* db_ = nullptr;
   SqliteStoreOptions options_;
