@@ -491,6 +491,43 @@ TEST_F(Karstctl, UnwritableOutputExitsOne) {
   }
 }
 
+// Started with standard input or output closed, karstctl reads and writes
+// nothing there, never a descriptor some library opened in its place.
+TEST_F(Karstctl, ClosedStandardDescriptorsAreNobodyElses) {
+  Ok({"import", "-"}, R"({"policies": [{"name": "kept"}]})");
+  const std::string before = ReadFile(store_);
+  const struct {
+    std::vector<int> closed;
+    std::vector<std::string> args;
+    int status;
+    std::string err;  // "" with standard error closed
+  } cases[] = {
+      {{0}, {"import", "-"}, 2, "karstctl: <stdin>:1:1: syntax error while parsing value"},
+      {{1}, {"hash"}, 0, ""},
+      {{0, 1, 2}, {"import", "-"}, 2, ""},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.args[0]);
+    const std::string err = dir_.File("stderr");
+    WriteFile(err, "");
+    const ChildResult child = RunChild(
+        [&](int resultFd) {
+          dup2(resultFd, 1);
+          dup2(open(err.c_str(), O_WRONLY), 2);
+          for (int fd : c.closed) close(fd);
+          std::vector<std::string> args = {"--store", store_};
+          args.insert(args.end(), c.args.begin(), c.args.end());
+          ExecKarstctl(args);
+        },
+        60);
+    EXPECT_TRUE(child.exited) << child.Describe();
+    EXPECT_EQ(child.code, c.status);
+    EXPECT_EQ(child.output, "");
+    EXPECT_THAT(ReadFile(err), ::testing::StartsWith(c.err));
+    EXPECT_EQ(ReadFile(store_), before);
+  }
+}
+
 TEST_F(Karstctl, HelpAndVersionNeedNoStore) {
   const ToolResult help = RunTool({"--store", dir_.Path(), "--help"});
   EXPECT_EQ(help.status, 0);
