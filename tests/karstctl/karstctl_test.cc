@@ -23,6 +23,7 @@
 #include "Args.h"
 #include "Child.h"
 #include "Cli.h"
+#include "EtcdCluster.h"
 #include "FaultVfs.h"
 #include "Files.h"
 #include "RawSqlite.h"
@@ -479,6 +480,30 @@ TEST_F(Karstctl, WatchWaitsForTheStoreAndOutlastsFailedReads) {
             0);
   EXPECT_EQ(watch.NextLine(10), HashLine(later));
   EXPECT_EQ(watch.Stop(SIGTERM), 0);
+}
+
+// A watcher on etcd whose role loses its permission still hears of the
+// commit it may no longer read: it reads again every second, and prints the
+// new digests once it may, without waiting for another commit.
+TEST_F(Karstctl, WatchReadsAgainUntilAReadSucceeds) {
+  EtcdCluster etcd({1, false, true});
+  const std::string store = etcd.Locator("limited/karst");
+  ASSERT_EQ(RunTool({"--store", store, "import", "-"}, R"({"policies": [{"name": "a"}]})").status,
+            0);
+  const std::string err = dir_.File("watch.err");
+  Background watch({"--store", etcd.Locator("limited/karst", {"limited"}), "watch"}, err);
+  EXPECT_EQ(watch.NextLine(10), HashLine(store));
+
+  etcd.Etcdctl(
+      {"role", "revoke-permission", "limited", "--prefix=true", EtcdCluster::kLimitedPrefix});
+  ASSERT_EQ(RunTool({"--store", store, "import", "-"}, R"({"policies": [{"name": "b"}]})").status,
+            0);
+  for (int i = 0; i < 200 && ReadFile(err).empty(); ++i) usleep(50000);
+  EXPECT_THAT(ReadFile(err), HasSubstr("(etcd PERMISSION_DENIED, 1107); trying again\n"));
+  etcd.Etcdctl({"role", "grant-permission", "limited", "--prefix=true", "readwrite",
+                EtcdCluster::kLimitedPrefix});
+  EXPECT_EQ(watch.NextLine(10), HashLine(store));
+  EXPECT_EQ(watch.Stop(SIGINT), 0);
 }
 
 TEST_F(Karstctl, UnwritableOutputExitsOne) {

@@ -85,6 +85,9 @@ struct SqliteStoreOptions {
 // umask may remove bits only). A path whose last component is a symbolic
 // link is refused. A file the process may read but not write is opened
 // read-only: reads work, writes fail with SQLite's SQLITE_READONLY.
+// WaitForChange follows the path: another file moved there, or the file
+// removed (and perhaps made again), is a change, and the store lets go of
+// the old file and reads whatever is at the path from then on.
 CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewSqliteStore(const std::string& path);
 CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewSqliteStore(const std::string& path,
                                                                const SqliteStoreOptions& options);
