@@ -15,14 +15,13 @@ namespace karstctl {
 StoreSession::StoreSession(const Invocation& invocation)
     : locator_(invocation.store ? *invocation.store : TavoConfigStore::DefaultStorePath()),
       waitMs_(invocation.waitMs) {
-  using TavoConfigStore::ConfigStoreException;
   try {
     if (TavoConfigStore::KindOfLocator(locator_) == TavoConfigStore::LocatorKind::kEtcd) {
       etcd_ = TavoConfigStore::ParseEtcdLocator(locator_);
       // A locator's timeout is at least 1 ms, and so is this one.
       if (waitMs_) etcd_->timeoutMs = std::max(*waitMs_, 1);
     }
-  } catch (const ConfigStoreException& e) {
+  } catch (const TavoConfigStore::ConfigStoreException& e) {
     // A locator that cannot be used is a mistake in the command line or the
     // environment, like a bad option.
     if (e.Code() == TavoConfigStore::kErrorBadLocator) throw UsageError(DescribeStoreError(e));
