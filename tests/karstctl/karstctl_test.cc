@@ -23,6 +23,7 @@
 #include "Args.h"
 #include "Child.h"
 #include "Cli.h"
+#include "EtcdCluster.h"
 #include "FaultVfs.h"
 #include "Files.h"
 #include "RawSqlite.h"
@@ -382,13 +383,10 @@ TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
        "karstctl: configuration store " + store_ +
            ": starting a transaction: database is locked (SQLITE_BUSY, 5)\n"},
       {{"--store", garbage, "watch"}, "(SQLITE_NOTADB, 26)\n"},
-      // A bad etcd locator, never with its password; a good one is no file.
-      {{"--store", "etcd://u:cret/cret@h:1/p", "watch"},
-       "karstctl: etcd locator: '@' after the endpoints: write it as %40, and a '/' in a user "
-       "name or password as %2F (bad locator, 1010)\n"},
-      {{"--store", "etcd://u:cret@h/p", "blob", "default", "u"},
-       "karstctl: etcd locator: endpoint \"h\" is not HOST:PORT (bad locator, 1010)\n"},
+      // A good etcd locator is no file.
       {{"--store", "etcd://127.0.0.1:9/p", "--wait", "1", "export"}, " (etcd "},
+      // A path may look like a locator; its password is not shown.
+      {{"--store", "./etcd:/u:cret@h:1/p", "hash"}, "karstctl: no store at ./etcd:***@h:1/p\n"},
   };
   for (const auto& [args, err] : cases) {
     const auto start = std::chrono::steady_clock::now();
@@ -398,11 +396,6 @@ TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
   EXPECT_NE(access(none.c_str(), F_OK), 0);
   ExpectFailure(RunTool({"--store", garbage, "import", "-"}, "["), 2, "<stdin>:1:2: ");
   EXPECT_EQ(ReadFile(garbage), std::string(8192, 'G'));
-  // A bad locator, though, comes before the input, from the environment too.
-  setenv("TAVO_CONFIGSTORE_PATH", "etcds://u:cret@h:1/p?cert=c", 1);
-  ExpectFailure(RunTool({"import", "-"}, "["), 1,
-                "karstctl: etcd locator: a client certificate needs its key and a key its "
-                "certificate (cert and key) (bad locator, 1010)\n");
 
   // Without a store path nor anything to derive one from, nothing is guessed.
   std::vector<std::pair<std::string, std::string>> saved;
@@ -412,6 +405,29 @@ TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {
   }
   ExpectFailure(RunTool({"export"}), 1, "(no store path, 1008)\n");
   for (const auto& [name, value] : saved) setenv(name.c_str(), value.c_str(), 1);
+}
+
+// A locator that cannot be used, from --store or the environment, is a usage
+// error found before the input is read, and nothing is created for it.
+TEST_F(Karstctl, BadLocatorsExitTwoBeforeAnythingIsCreated) {
+  const std::string cwd = std::filesystem::current_path(), here = dir_.File("here");
+  std::filesystem::create_directory(here);
+  std::filesystem::current_path(here);
+  const std::pair<std::vector<std::string>, std::string> cases[] = {
+      {{"--store", "ETCD://u:cret@h:1/p", "import", "-"},
+       "karstctl: store locator \"ETCD://u:***@h:1/p\" looks like a URL but is no etcd:// or "
+       "etcds:// locator; put ./ in front to make it a file path (bad locator, 1010)\n"},
+      {{"--store", "etcd://u:cret/cret@h:1/p", "watch"},
+       "karstctl: etcd locator: '@' after the endpoints: write it as %40, and a '/' in a user "
+       "name or password as %2F (bad locator, 1010)\n"},
+      {{"policies", "set", "-"},
+       "karstctl: etcd locator: a client certificate needs its key and a key its "
+       "certificate (cert and key) (bad locator, 1010)\n"},
+  };
+  setenv("TAVO_CONFIGSTORE_PATH", "etcds://u:cret@h:1/p?cert=c", 1);
+  for (const auto& [args, err] : cases) ExpectFailure(RunTool(args, "["), 2, err);
+  std::filesystem::current_path(cwd);
+  EXPECT_TRUE(std::filesystem::is_empty(here));
 }
 
 // watch prints hash's digests on one line, then a line at each change, soon
@@ -464,6 +480,30 @@ TEST_F(Karstctl, WatchWaitsForTheStoreAndOutlastsFailedReads) {
   EXPECT_EQ(watch.Stop(SIGTERM), 0);
 }
 
+// A watcher on etcd whose role loses its permission still hears of the
+// commit it may no longer read: it reads again every second, and prints the
+// new digests once it may, without waiting for another commit.
+TEST_F(Karstctl, WatchReadsAgainUntilAReadSucceeds) {
+  EtcdCluster etcd({1, false, true});
+  const std::string store = etcd.Locator("limited/karst");
+  ASSERT_EQ(RunTool({"--store", store, "import", "-"}, R"({"policies": [{"name": "a"}]})").status,
+            0);
+  const std::string err = dir_.File("watch.err");
+  Background watch({"--store", etcd.Locator("limited/karst", {"limited"}), "watch"}, err);
+  EXPECT_EQ(watch.NextLine(10), HashLine(store));
+
+  etcd.Etcdctl(
+      {"role", "revoke-permission", "limited", "--prefix=true", EtcdCluster::kLimitedPrefix});
+  ASSERT_EQ(RunTool({"--store", store, "import", "-"}, R"({"policies": [{"name": "b"}]})").status,
+            0);
+  for (int i = 0; i < 200 && ReadFile(err).empty(); ++i) usleep(50000);
+  EXPECT_THAT(ReadFile(err), HasSubstr("(etcd PERMISSION_DENIED, 1107); trying again\n"));
+  etcd.Etcdctl({"role", "grant-permission", "limited", "--prefix=true", "readwrite",
+                EtcdCluster::kLimitedPrefix});
+  EXPECT_EQ(watch.NextLine(10), HashLine(store));
+  EXPECT_EQ(watch.Stop(SIGINT), 0);
+}
+
 TEST_F(Karstctl, UnwritableOutputExitsOne) {
   Ok({"import", "-"},
      R"({"policies": [{"name": "n", "policy_id": "p", "blobs": [{"datastore_namespace": "CORRA", "blob": "b"}]}]})");
@@ -471,6 +511,43 @@ TEST_F(Karstctl, UnwritableOutputExitsOne) {
       {"--store", store_, "export"}, {"--store", store_, "blob", "corra-by-id", "p"}, {"--help"}};
   for (const auto& args : commands) {
     ExpectFailure(RunTool(args, "", "/dev/full"), 1, "cannot write standard output");
+  }
+}
+
+// Started with standard input or output closed, karstctl reads and writes
+// nothing there, never a descriptor some library opened in its place.
+TEST_F(Karstctl, ClosedStandardDescriptorsAreNobodyElses) {
+  Ok({"import", "-"}, R"({"policies": [{"name": "kept"}]})");
+  const std::string before = ReadFile(store_);
+  const struct {
+    std::vector<int> closed;
+    std::vector<std::string> args;
+    int status;
+    std::string err;  // "" with standard error closed
+  } cases[] = {
+      {{0}, {"import", "-"}, 2, "karstctl: <stdin>:1:1: syntax error while parsing value"},
+      {{1}, {"hash"}, 0, ""},
+      {{0, 1, 2}, {"import", "-"}, 2, ""},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.args[0]);
+    const std::string err = dir_.File("stderr");
+    WriteFile(err, "");
+    const ChildResult child = RunChild(
+        [&](int resultFd) {
+          dup2(resultFd, 1);
+          dup2(open(err.c_str(), O_WRONLY), 2);
+          for (int fd : c.closed) close(fd);
+          std::vector<std::string> args = {"--store", store_};
+          args.insert(args.end(), c.args.begin(), c.args.end());
+          ExecKarstctl(args);
+        },
+        60);
+    EXPECT_TRUE(child.exited) << child.Describe();
+    EXPECT_EQ(child.code, c.status);
+    EXPECT_EQ(child.output, "");
+    EXPECT_THAT(ReadFile(err), ::testing::StartsWith(c.err));
+    EXPECT_EQ(ReadFile(store_), before);
   }
 }
 

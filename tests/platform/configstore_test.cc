@@ -536,6 +536,29 @@ TEST_F(SqliteStoreTest, WaitForChangeSeesOtherConnectionsCommits) {
   watcher->AbortTransaction();
 }
 
+// The watcher follows the path, not the file: a store moved over it (as a
+// deploy does) or removed and made again is a change, and reads then see
+// the file that is there, never pages the old file left in the log.
+TEST_F(SqliteStoreTest, WaitForChangeFollowsTheFileAtThePath) {
+  auto watcher = NewSqliteStore(Path());
+  Set(*NewSqliteStore(Path()), Sample("old"));
+  ASSERT_TRUE(watcher->WaitForChange(0));
+  ASSERT_THAT(List(*watcher), ElementsAre("old"));
+  Set(*NewSqliteStore(Path()), Sample("in the log"));  // the watcher's connection keeps the log
+  auto seesOnly = [&watcher](const std::vector<std::string>& names) {
+    EXPECT_TRUE(watcher->WaitForChange(10000));
+    EXPECT_EQ(List(*watcher), names);
+    EXPECT_FALSE(watcher->WaitForChange(100));
+  };
+  Set(*NewSqliteStore(Path("new.db")), Sample("moved"));
+  std::filesystem::rename(Path("new.db"), Path());
+  seesOnly({"moved"});
+  std::filesystem::remove(Path());
+  seesOnly({});
+  Set(*NewSqliteStore(Path()), Sample("again"));
+  seesOnly({"again"});
+}
+
 // After an I/O error SQLite rolls the transaction back by itself. A write
 // after that would be committed alone at once, beyond the caller's Abort,
 // and a Commit reporting success would lose the earlier writes silently.

@@ -1,13 +1,18 @@
-// Reading etcd locators: what each part becomes, what etcdctl's environment
-// fills in, and what is refused, in words that never repeat the password.
+// Store locators: which are paths, which etcd locators and which are
+// refused, as messages show them. Then reading etcd locators: what each part
+// becomes, what etcdctl's environment fills in, and what is refused, in
+// words that never repeat the password.
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <array>
 #include <cstdlib>
+#include <filesystem>
 #include <string>
 
+#include "Files.h"
+#include "TavoConfigStore/ConfigStore.h"
 #include "TavoConfigStore/EtcdStore.h"
 
 namespace TavoConfigStore {
@@ -16,6 +21,83 @@ namespace {
 using ::testing::HasSubstr;
 using ::testing::Not;
 using ::testing::StartsWith;
+
+// The message of the ConfigStoreException "f" throws with kErrorBadLocator,
+// or why there is none.
+template <typename F>
+std::string RefusalOf(F&& f) {
+  try {
+    f();
+  } catch (const ConfigStoreException& e) {
+    return e.Code() == kErrorBadLocator ? e.Message() : "code " + std::to_string(e.Code());
+  }
+  return "not refused";
+}
+
+// A mistyped etcd locator must not become a folder named after the cluster
+// with the password in it, neither through OpenStore nor through the
+// default store's variable; and no message shows a password ("cret").
+TEST(StoreLocatorTest, PathsAndEtcdLocatorsOnlyAndNoMessageShowsThePassword) {
+  enum Kind { kPath, kEtcd, kRefused };
+  const struct {
+    const char* locator;
+    Kind kind;
+    const char* shown;
+  } cases[] = {
+      {"store.db", kPath, "store.db"},
+      {"etcd.db", kPath, "etcd.db"},
+      {"file:x.db?mode=memory", kPath, "file:x.db?mode=memory"},  // no '/' after the colon
+      {"./ETCD://u:cret@h:1/p", kPath, "./ETCD:***@h:1/p"},
+      {"/srv/u:cret@h/p", kPath, "/srv/u:***@h/p"},
+      {"etcd://u:cret@h:1/p", kEtcd, "etcd://u:***@h:1/p"},
+      {"etcd://u:/cr@et@h:1/p", kEtcd, "etcd://u:***@h:1/p"},
+      {"etcds://u@[::1]:2379/p", kEtcd, "etcds://u@[::1]:2379/p"},
+      {"ETCD://u:cret@h:1/p", kRefused, "ETCD://u:***@h:1/p"},
+      {"etcd:/u:cret@h:1/p", kRefused, "etcd:/u:***@h:1/p"},
+      {"etcdS//u:cret@h:1/p", kRefused, "etcdS//u:***@h:1/p"},
+      {"etcd:u:cret@h:1/p", kRefused, "etcd:***@h:1/p"},
+      {"etcdx://u:cret@h:1/p", kRefused, "etcdx://u:***@h:1/p"},
+      {"etcd3://u:cret/cr:et@h:1/p", kRefused, "etcd3://u:***@h:1/p"},
+      {"http://u:cret@h/p", kRefused, "http://u:***@h/p"},
+  };
+  karst_test::ScratchDir dir;
+  const auto cwd = std::filesystem::current_path();
+  std::filesystem::current_path(dir.Path());
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.locator);
+    EXPECT_EQ(RedactLocator(c.locator), c.shown);
+    if (c.kind != kRefused) {
+      EXPECT_EQ(KindOfLocator(c.locator),
+                c.kind == kEtcd ? LocatorKind::kEtcd : LocatorKind::kPath);
+      continue;
+    }
+    const std::string refusal = RefusalOf([&] { KindOfLocator(c.locator); });
+    EXPECT_EQ(refusal, std::string("store locator \"") + c.shown +
+                           "\" looks like a URL but is no etcd:// or etcds:// locator; put ./ in "
+                           "front to make it a file path");
+    EXPECT_EQ(RefusalOf([&] { OpenStore(c.locator); }), refusal);
+    setenv("TAVO_CONFIGSTORE_PATH", c.locator, 1);
+    EXPECT_EQ(RefusalOf([] { ConfigStore::GetStore(sGlobalNamespace)->GetObjects(nullptr); }),
+              refusal);
+    unsetenv("TAVO_CONFIGSTORE_PATH");
+  }
+  EXPECT_TRUE(std::filesystem::is_empty(dir.Path()));
+
+  // A path is a path, and the store's own messages hide its password too.
+  karst_test::WriteFile("file", "");
+  try {
+    std::int32_t flags = 0;
+    OpenStore("file/u:cret@h/store.db")
+        ->SetObject(std::make_shared<ConfigStoreObject>(ConfigStoreObjectId("k", "g", "c", "i")),
+                    flags);
+    ADD_FAILURE() << "a store under a file was written";
+  } catch (const ConfigStoreException& e) {
+    EXPECT_EQ(e.Message(),
+              "configuration store file/u:***@h/store.db: cannot create directory on its path: "
+              "Not a directory");
+  }
+  std::filesystem::current_path(cwd);
+}
 
 // etcdctl's variables in this order; a null leaves one unset.
 constexpr std::array<const char*, 5> kVariables = {"ETCDCTL_USER", "ETCDCTL_PASSWORD",

@@ -69,11 +69,14 @@ std::string HelpText() {
       "with %XX for any of @/?&,% in its parts; etcds:// uses TLS. What it leaves out\n"
       "comes from ETCDCTL_USER (USER[:PASSWORD]), ETCDCTL_PASSWORD and, for etcds://,\n"
       "ETCDCTL_CACERT, ETCDCTL_CERT and ETCDCTL_KEY. A new etcd catalogue reads as empty.\n"
+      "Anything else that looks like a URL (http:/, ETCD://, etcd:/, etcd//, in any case)\n"
+      "is refused rather than taken as a file; ./ in front makes it a path.\n"
       "\n"
       "Exit status:\n"
       "  0  success\n"
       "  1  store error, or any other failure\n"
-      "  2  usage or input error; the input is checked whole before the store is touched\n";
+      "  2  usage or input error, or a locator that cannot be used; the input is checked\n"
+      "     whole before the store is touched\n";
   return out;
 }
 

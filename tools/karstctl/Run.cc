@@ -76,13 +76,25 @@ void StopWatching(int /*signal*/) { gStopWatching = 1; }
 
 // A wait for a change lasts at most this long, so that a signal ends the
 // watch within about as long.
-constexpr int kWatchWaitMs = 200;
+constexpr std::chrono::milliseconds kWatchWait(200);
 // After a failed read (a lock held through a crash recovery, say), before
 // the next try.
 constexpr std::chrono::seconds kWatchRetryPause(1);
 
+// Sleeps kWatchRetryPause, or less when a signal ends the watch.
+void PauseBeforeRetry() {
+  const auto end = std::chrono::steady_clock::now() + kWatchRetryPause;
+  while (gStopWatching == 0 && std::chrono::steady_clock::now() < end) {
+    std::this_thread::sleep_for(kWatchWait);
+  }
+}
+
 // The first read fails the command like any other; later failures are
-// reported and tried again, as a watch is meant to outlast them.
+// reported, and the read is tried again every second until one succeeds.
+// Only then does the watch wait for the next change: the change that a
+// failed read missed has been announced already (on etcd, a watcher whose
+// role is revoked still hears of commits it may not read), and waiting for
+// another would keep the old digests until some later commit.
 void Watch(StoreSession& session) {
   session.Open(StoreUse::kWatch);
   struct sigaction stop {};
@@ -92,14 +104,21 @@ void Watch(StoreSession& session) {
   auto store = TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace);
   std::string last = Digests().dump() + "\n";
   WriteOutput(last);
+  bool failed = false;
   while (gStopWatching == 0) {
     try {
-      if (!store->WaitForChange(kWatchWaitMs)) continue;
+      if (failed) {
+        PauseBeforeRetry();
+        if (gStopWatching != 0) break;
+      } else if (!store->WaitForChange(static_cast<int>(kWatchWait.count()))) {
+        continue;
+      }
       std::string line = Digests().dump() + "\n";
+      failed = false;
       if (line != last) WriteOutput(last = std::move(line));
     } catch (const TavoConfigStore::ConfigStoreException& e) {
+      failed = true;
       WriteDiagnostic("warning: " + DescribeStoreError(e) + "; trying again");
-      std::this_thread::sleep_for(kWatchRetryPause);
     }
   }
 }
@@ -154,7 +173,7 @@ void RunCommand(const Invocation& invocation) {
     default:
       break;
   }
-  StoreSession session(invocation);  // a bad etcd locator fails here, before any input
+  StoreSession session(invocation);  // a bad locator fails here, before any input
   switch (invocation.command) {
     case Command::kReset:
       session.Open(StoreUse::kWrite);

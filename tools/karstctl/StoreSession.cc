@@ -6,6 +6,8 @@
 #include <cerrno>
 #include <stdexcept>
 
+#include "Errors.h"
+#include "StoreErrors.h"
 #include "TavoConfigStore/ConfigStore.h"
 
 namespace karstctl {
@@ -13,10 +15,17 @@ namespace karstctl {
 StoreSession::StoreSession(const Invocation& invocation)
     : locator_(invocation.store ? *invocation.store : TavoConfigStore::DefaultStorePath()),
       waitMs_(invocation.waitMs) {
-  if (TavoConfigStore::IsEtcdLocator(locator_)) {
-    etcd_ = TavoConfigStore::ParseEtcdLocator(locator_);
-    // A locator's timeout is at least 1 ms, and so is this one.
-    if (waitMs_) etcd_->timeoutMs = std::max(*waitMs_, 1);
+  try {
+    if (TavoConfigStore::KindOfLocator(locator_) == TavoConfigStore::LocatorKind::kEtcd) {
+      etcd_ = TavoConfigStore::ParseEtcdLocator(locator_);
+      // A locator's timeout is at least 1 ms, and so is this one.
+      if (waitMs_) etcd_->timeoutMs = std::max(*waitMs_, 1);
+    }
+  } catch (const TavoConfigStore::ConfigStoreException& e) {
+    // A locator that cannot be used is a mistake in the command line or the
+    // environment, like a bad option.
+    if (e.Code() == TavoConfigStore::kErrorBadLocator) throw UsageError(DescribeStoreError(e));
+    throw;
   }
 }
 
@@ -28,7 +37,7 @@ void StoreSession::Open(StoreUse use) {
   struct stat info;
   if (use == StoreUse::kRead && lstat(locator_.c_str(), &info) != 0 &&
       (errno == ENOENT || errno == ENOTDIR)) {
-    throw std::runtime_error("no store at " + locator_);
+    throw std::runtime_error("no store at " + TavoConfigStore::RedactLocator(locator_));
   }
   TavoConfigStore::SqliteStoreOptions options;
   if (waitMs_) options.busyTimeoutMs = *waitMs_;

@@ -11,10 +11,11 @@ namespace karstctl {
 
 // The store one command works on: the --store locator or else the default
 // one, a SQLite file or an etcd locator. Constructing it touches nothing but
-// reads an etcd locator, so a bad one is reported (ConfigStoreException,
-// kErrorBadLocator) before any input is read. Open installs the store as
-// the library's for as long as this object lives, with --wait as the lock
-// timeout of a file or the request timeout of etcd. For a read, a file path
+// reads the locator, so one that cannot be used (a bad etcd locator, or a
+// URL that is none) is reported as a UsageError before any input is read or
+// anything created. Open installs the store as the library's for as long as
+// this object lives, with --wait as the lock timeout of a file or the
+// request timeout of etcd. For a read, a file path
 // with nothing there fails with "no store at PATH" (std::runtime_error)
 // instead of reading as an empty catalogue; on etcd an empty catalogue is
 // simply empty. Store failures throw ConfigStoreException.

@@ -86,7 +86,9 @@ bool ConfigStore::WaitForChange(int timeoutMs) {
 }
 
 std::shared_ptr<ConfigStore> OpenStore(const std::string& locator) {
-  if (IsEtcdLocator(locator)) return NewEtcdStore(ParseEtcdLocator(locator));
+  if (KindOfLocator(locator) == LocatorKind::kEtcd) {
+    return NewEtcdStore(ParseEtcdLocator(locator));
+  }
   return NewSqliteStore(locator);
 }
 

@@ -57,9 +57,9 @@ namespace {
 // puts 16 KiB pages into the log rather than 4 KiB ones.
 constexpr int kPageSize = 16384;
 
-// How often WaitForChange looks: a look is one read of the shared-memory
-// index (or one lstat while there is no file), so a watcher costs next to
-// nothing and still answers within a twentieth of a second.
+// How often WaitForChange looks: a look is one lstat of the path and one
+// read of the shared-memory index, so a watcher costs next to nothing and
+// still answers within a twentieth of a second.
 constexpr std::chrono::milliseconds kChangePoll(50);
 
 // Owns the connection, so that it is closed even when the store's
@@ -95,7 +95,7 @@ struct OneShot {
 class SqliteStore final : public ConfigStore {
  public:
   SqliteStore(const std::string& path, const SqliteStoreOptions& options)
-      : path_(path), options_(options) {
+      : path_(path), where_("configuration store " + RedactLocator(path)), options_(options) {
     if (path.empty()) {
       throw ConfigStoreException("configuration store: empty path", kErrorNoStorePath);
     }
@@ -295,7 +295,14 @@ class SqliteStore final : public ConfigStore {
  private:
   // Without a connection there was no file when last looked: its appearance
   // is the change, and connecting (never creating) sets the new baseline.
+  // Another file at the path, or none, is a change too: the connection
+  // follows the path, not the file it first found there.
   bool ChangedSinceLastLook() {
+    if (db_ != nullptr && FileReplaced()) {
+      Disconnect();
+      Open(false);
+      return true;
+    }
     if (db_ == nullptr) return Open(false);
     const sqlite3_int64 version = DataVersion();
     if (version == seenVersion_) return false;
@@ -340,15 +347,17 @@ class SqliteStore final : public ConfigStore {
     struct stat st {};
     if (lstat(file.c_str(), &st) == 0) {
       if (S_ISLNK(st.st_mode)) {
-        throw ConfigStoreException(
-            Where() + ": " + file + " is a symbolic link; the store does not follow links",
-            kErrorSymlink);
+        throw ConfigStoreException(Where() + ": " + RedactLocator(file) +
+                                       " is a symbolic link; the store does not follow links",
+                                   kErrorSymlink);
       }
       return true;
     }
-    if (errno == ENOENT || errno == ENOTDIR) return false;
-    throw ConfigStoreException(Where() + ": cannot look up " + file + ": " + std::strerror(errno),
-                               SQLITE_CANTOPEN);
+    const int error = errno;
+    if (error == ENOENT || error == ENOTDIR) return false;
+    throw ConfigStoreException(
+        Where() + ": cannot look up " + RedactLocator(file) + ": " + std::strerror(error),
+        SQLITE_CANTOPEN);
   }
 
   // Missing directories 0700 and the file 0600, whatever the umask allows:
@@ -364,9 +373,12 @@ class SqliteStore final : public ConfigStore {
       at = next;
       if (dir.empty() || dir.back() == '/') continue;  // "/" or "a//b"
       if (mkdir(dir.c_str(), 0700) != 0 && errno != EEXIST) {
-        throw ConfigStoreException(
-            Where() + ": cannot create directory " + dir + ": " + std::strerror(errno),
-            SQLITE_CANTOPEN);
+        const int error = errno;
+        // A folder's name could end inside a password the whole path hides.
+        const bool hidden = RedactLocator(path_) != path_;
+        throw ConfigStoreException(Where() + ": cannot create directory " +
+                                       (hidden ? "on its path" : dir) + ": " + std::strerror(error),
+                                   SQLITE_CANTOPEN);
       }
     }
     // Made under a name of its own and linked into place: closing a
@@ -396,6 +408,11 @@ class SqliteStore final : public ConfigStore {
 
   void Connect() {
     for (const char* suffix : {"-wal", "-shm"}) Exists(path_ + suffix);
+    // Taken before opening: should the file be replaced in between, the
+    // next look finds another file and connects again, rather than never.
+    struct stat st {};
+    connectedFile_ = lstat(path_.c_str(), &st) == 0 ? std::pair{st.st_dev, st.st_ino}
+                                                    : std::pair<dev_t, ino_t>{};
     // Without SQLITE_OPEN_CREATE: the file exists, and should it vanish
     // meanwhile, SQLite must not make one with its own default mode.
     Connection conn;
@@ -413,6 +430,39 @@ class SqliteStore final : public ConfigStore {
       throw;
     }
     std::swap(conn_.db, conn.db);
+  }
+
+  // Whether the path names another file than the connected one, or none: a
+  // deploy may move a new store over it, or remove it and create it again.
+  // A failed look (a folder made unreadable) changes nothing.
+  bool FileReplaced() const {
+    struct stat st {};
+    if (lstat(path_.c_str(), &st) != 0) return errno == ENOENT || errno == ENOTDIR;
+    return std::pair{st.st_dev, st.st_ino} != connectedFile_;
+  }
+
+  // Closes the connection to a file no longer at the path, with everything
+  // prepared on it; the next use connects to whatever is there then.
+  void Disconnect() {
+    // SQLite neither checkpoints nor empties the log when the last
+    // connection to a moved or deleted file closes, and a log left with
+    // that file's pages would be read as part of the next file at the path.
+    // Best effort, without waiting for a lock: another connection to the
+    // old file may still hold one.
+    sqlite3_busy_timeout(db_, 0);
+    sqlite3_wal_checkpoint_v2(db_, nullptr, SQLITE_CHECKPOINT_TRUNCATE, nullptr, nullptr);
+    collections_.clear();  // their statements are finalized with the connection
+    last_ = nullptr;
+    collectionQueries_.fill(nullptr);
+    for (sqlite3_stmt** s :
+         {&begin_, &beginImmediate_, &commit_, &rollback_, &savepoint_, &release_, &rollbackTo_,
+          &findCollection_, &addCollection_, &readSeq_, &writeSeq_, &dataVersion_}) {
+      *s = nullptr;
+    }
+    seqLoaded_ = seqDirty_ = false;
+    db_ = nullptr;
+    Connection closing;
+    std::swap(closing.db, conn_.db);
   }
 
   void Configure() {
@@ -502,7 +552,9 @@ class SqliteStore final : public ConfigStore {
     }
   }
 
-  std::string Where() const { return "configuration store " + path_; }
+  // Names the store in every message, never with a password that a
+  // URL-like path may hold.
+  const std::string& Where() const { return where_; }
 
   // Once SQLite has rolled the caller's transaction back by itself (full
   // disk, I/O error, interrupt), a write would be committed on its own at
@@ -774,6 +826,7 @@ class SqliteStore final : public ConfigStore {
   // between threads anyway (SetGlobalStore) from corrupting the connection.
   std::mutex mu_;
   std::string path_;
+  std::string where_;
   Connection conn_;
   sqlite3* db_ = nullptr;
   SqliteStoreOptions options_;
@@ -799,7 +852,8 @@ class SqliteStore final : public ConfigStore {
   bool seqLoaded_ = false;      // nextSeq_ was read within the open write
   bool seqDirty_ = false;       // and has been used since
   sqlite3_int64 nextSeq_ = 0;
-  sqlite3_int64 seenVersion_ = 0;  // data_version when WaitForChange last looked
+  sqlite3_int64 seenVersion_ = 0;          // data_version when WaitForChange last looked
+  std::pair<dev_t, ino_t> connectedFile_;  // the file at the path when connecting
 };
 
 }  // namespace

@@ -85,13 +85,32 @@ struct SqliteStoreOptions {
 // umask may remove bits only). A path whose last component is a symbolic
 // link is refused. A file the process may read but not write is opened
 // read-only: reads work, writes fail with SQLite's SQLITE_READONLY.
+// WaitForChange follows the path: another file moved there, or the file
+// removed (and perhaps made again), is a change, and the store lets go of
+// the old file and reads whatever is at the path from then on.
 CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewSqliteStore(const std::string& path);
 CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewSqliteStore(const std::string& path,
                                                                const SqliteStoreOptions& options);
 CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> NewMemoryStore();
 
-// The store a locator names: an "etcd://" or "etcds://" locator (see
-// EtcdStore.h), otherwise the path of a SQLite store.
+// A store locator is an etcd locator ("etcd://" or "etcds://", see
+// EtcdStore.h) or the path of a SQLite store, nothing in between.
+enum class LocatorKind { kPath, kEtcd };
+
+// The kind of "locator". Anything else that looks like a URL is refused with
+// ConfigStoreException(kErrorBadLocator) rather than taken as a path: a
+// scheme and a slash ("http:/", "ETCD://", "etcdx://"), or "etcd" or
+// "etcds" followed by ':' or "//", in any case. "./" in front makes such a
+// name a path. Only the start is looked at: ParseEtcdLocator reads the rest.
+CONFIGSTORE_EXPORT LocatorKind KindOfLocator(const std::string& locator);
+
+// "locator" as every message shows it: the password of a "user:password@"
+// replaced by "***", whatever else the locator holds.
+CONFIGSTORE_EXPORT std::string RedactLocator(const std::string& locator);
+
+// The store a locator names (see KindOfLocator): an etcd store or a SQLite
+// store. A locator that cannot be used throws kErrorBadLocator, and nothing
+// is created.
 CONFIGSTORE_EXPORT std::shared_ptr<ConfigStore> OpenStore(const std::string& locator);
 
 // $TAVO_CONFIGSTORE_PATH (a path or an etcd locator), else

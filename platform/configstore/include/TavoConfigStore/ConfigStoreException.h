@@ -37,7 +37,7 @@ enum StoreErrorCode : std::int32_t {
   kErrorNullArgument = 1007,       // a null object or filter handed to an operation
   kErrorNoStorePath = 1008,        // no store path given and no default to derive one from
   kErrorSymlink = 1009,            // a store path that names a symbolic link
-  kErrorBadLocator = 1010,         // an etcd locator or option that cannot be used
+  kErrorBadLocator = 1010,         // a store locator or etcd option that cannot be used
   kErrorConflict = 1011,           // another writer changed what this transaction read or wrote
   kErrorEtcdReply = 1012,          // a reply from etcd that the store cannot read
   // TLS with an etcd cluster, by what is wrong:

@@ -30,7 +30,7 @@ struct EtcdStoreOptions {
   int timeoutMs = 5000;
 };
 
-// True for "etcd://..." and "etcds://..."; anything else names a SQLite file.
+// True for "etcd://..." and "etcds://..." (see KindOfLocator for the rest).
 CONFIGSTORE_EXPORT bool IsEtcdLocator(const std::string& locator);
 
 // Reads a locator

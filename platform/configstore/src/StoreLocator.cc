@@ -1,0 +1,76 @@
+// Telling a store locator's kind, and showing one without its password.
+
+#include <cctype>
+#include <string>
+#include <string_view>
+
+#include "TavoConfigStore/ConfigStore.h"
+#include "TavoConfigStore/EtcdStore.h"
+
+namespace TavoConfigStore {
+namespace {
+
+bool IsAsciiLetter(char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'); }
+
+bool IsSchemeCharacter(char c) {
+  return IsAsciiLetter(c) || (c >= '0' && c <= '9') || c == '+' || c == '-' || c == '.';
+}
+
+// A URL's scheme and the slash after it: a letter, then letters, digits,
+// '+', '-' or '.', then ":/" ("http:/", "ETCD://", "etcdx://").
+bool StartsWithScheme(std::string_view text) {
+  if (text.empty() || !IsAsciiLetter(text[0])) return false;
+  std::size_t end = 1;
+  while (end < text.size() && IsSchemeCharacter(text[end])) ++end;
+  return text.substr(end, 2) == ":/";
+}
+
+bool StartsWithIgnoringCase(std::string_view text, std::string_view prefix) {
+  if (text.size() < prefix.size()) return false;
+  for (std::size_t i = 0; i < prefix.size(); ++i) {
+    if (std::tolower(static_cast<unsigned char>(text[i])) != prefix[i]) return false;
+  }
+  return true;
+}
+
+// "etcd" or "etcds" in any case, then ':' or "//": an etcd locator with a
+// slash or the colon missing ("etcd:host:2379/p", "etcd//host:2379/p").
+bool StartsLikeEtcd(std::string_view text) {
+  for (std::string_view scheme : {"etcds", "etcd"}) {
+    if (!StartsWithIgnoringCase(text, scheme)) continue;
+    const std::string_view rest = text.substr(scheme.size());
+    if (rest.substr(0, 1) == ":" || rest.substr(0, 2) == "//") return true;
+  }
+  return false;
+}
+
+}  // namespace
+
+LocatorKind KindOfLocator(const std::string& locator) {
+  if (IsEtcdLocator(locator)) return LocatorKind::kEtcd;
+  // Taken as a path, a mistyped etcd locator would become a store file
+  // under a folder named after the cluster, its password included, and the
+  // catalogue would never reach the cluster.
+  if (StartsWithScheme(locator) || StartsLikeEtcd(locator)) {
+    throw ConfigStoreException("store locator \"" + RedactLocator(locator) +
+                                   "\" looks like a URL but is no etcd:// or etcds:// locator; "
+                                   "put ./ in front to make it a file path",
+                               kErrorBadLocator);
+  }
+  return LocatorKind::kPath;
+}
+
+// The password runs from the colon after the user name to the last '@': a
+// password may hold '@', '/' or ':' of its own when it is not %-escaped.
+// Without a scheme, whatever comes before the first colon is taken for the
+// user name, so at worst more is hidden than the password.
+std::string RedactLocator(const std::string& locator) {
+  const std::size_t at = locator.rfind('@');
+  if (at == std::string::npos) return locator;
+  std::size_t colon = locator.find(':');
+  if (StartsWithScheme(locator)) colon = locator.find(':', colon + 1);
+  if (colon == std::string::npos || colon > at) return locator;
+  return locator.substr(0, colon + 1) + "***" + locator.substr(at);
+}
+
+}  // namespace TavoConfigStore
