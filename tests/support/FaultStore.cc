@@ -15,7 +15,6 @@ using TavoConfigStore::ConfigStoreObject;
 using TavoConfigStore::ConfigStoreObjectId;
 using TavoConfigStore::FilterSpecObject;
 using TavoConfigStore::StoreObject;
-using TavoConfigStore::SubObjectEntry;
 using TavoConfigStore::SubObjectId;
 
 namespace {
@@ -42,7 +41,7 @@ class ReportsValueReads : public Base {
 };
 
 std::shared_ptr<StoreObject> WatchSub(FaultStore* store, const std::shared_ptr<StoreObject>& sub) {
-  return sub ? std::make_shared<ReportsValueReads<StoreObject>>(store, sub->Values()) : nullptr;
+  return sub ? std::make_shared<ReportsValueReads<StoreObject>>(store, *sub) : nullptr;
 }
 
 // A copy of a stored object that reports its reads, and those of its
@@ -50,7 +49,7 @@ std::shared_ptr<StoreObject> WatchSub(FaultStore* store, const std::shared_ptr<S
 class WatchedObject final : public ReportsValueReads<ConfigStoreObject> {
  public:
   WatchedObject(FaultStore* store, const ConfigStoreObject& object)
-      : ReportsValueReads(store, object.Id(), object.Values(), object.SubObjects()) {}
+      : ReportsValueReads(store, object) {}
   std::shared_ptr<StoreObject> GetSubObject(const SubObjectId& id) const override {
     store_->OnCall("GetSubObject");
     return WatchSub(store_, ConfigStoreObject::GetSubObject(id));

@@ -5,8 +5,9 @@
 #include <tuple>
 #include <vector>
 
-#include "DamagedObject.h"
 #include "TavoConfigStore/ConfigStore.h"
+#include "object/DamagedObject.h"
+#include "object/Objects.h"
 
 namespace TavoConfigStore {
 namespace {
@@ -17,10 +18,20 @@ IdKey KeyOf(const ConfigStoreObjectId& id) {
   return {id.Key(), id.Group(), id.Component(), id.InstanceId()};
 }
 
+// An object as written: kept encoded, as the other backends keep it.
+struct Stored {
+  ConfigStoreObjectId id;
+  std::string body;
+};
+
+std::shared_ptr<ConfigStoreObject> Read(const Stored& stored) {
+  return objectmodel::DecodeObject(stored.id, stored.body, nullptr);
+}
+
 struct State {
   std::uint64_t nextSeq = 1;
-  // Write order; objects are immutable copies, so a snapshot shares them.
-  std::map<std::uint64_t, std::shared_ptr<const ConfigStoreObject>> bySeq;
+  // Write order; what is stored never changes, so a snapshot shares it.
+  std::map<std::uint64_t, std::shared_ptr<const Stored>> bySeq;
   std::map<IdKey, std::uint64_t> index;
 };
 
@@ -30,14 +41,15 @@ class MemoryStore final : public ConfigStore {
     std::lock_guard<std::mutex> lock(mu_);
     auto it = state_.index.find(KeyOf(id));
     if (it == state_.index.end()) return nullptr;
-    return state_.bySeq.at(it->second)->Clone();
+    return Read(*state_.bySeq.at(it->second));
   }
 
   void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
                  std::int32_t& /*flags*/) override {
     RefuseNull(object.get(), "SetObject");
     DamagedObject::RefuseWrite(*object);
-    std::shared_ptr<const ConfigStoreObject> copy = object->Clone();
+    auto copy = std::make_shared<Stored>(Stored{object->Id(), std::string()});
+    objectmodel::EncodeObject(*object, &copy->body);
     std::lock_guard<std::mutex> lock(mu_);
     IdKey key = KeyOf(object->Id());
     auto it = state_.index.find(key);
@@ -54,8 +66,8 @@ class MemoryStore final : public ConfigStore {
     RefuseNull(filter.get(), "DeleteObjects");
     std::lock_guard<std::mutex> lock(mu_);
     for (auto it = state_.bySeq.begin(); it != state_.bySeq.end();) {
-      if (filter->Matches(it->second->Id())) {
-        state_.index.erase(KeyOf(it->second->Id()));
+      if (filter->Matches(it->second->id)) {
+        state_.index.erase(KeyOf(it->second->id));
         it = state_.bySeq.erase(it);
       } else {
         ++it;
@@ -68,8 +80,8 @@ class MemoryStore final : public ConfigStore {
     RefuseNull(filter.get(), "GetObjects");
     std::lock_guard<std::mutex> lock(mu_);
     std::vector<std::shared_ptr<ConfigStoreObject>> out;
-    for (const auto& [seq, object] : state_.bySeq) {
-      if (filter->Matches(object->Id())) out.push_back(object->Clone());
+    for (const auto& [seq, stored] : state_.bySeq) {
+      if (filter->Matches(stored->id)) out.push_back(Read(*stored));
     }
     return out;
   }

@@ -42,10 +42,10 @@
 #include <utility>
 #include <vector>
 
-#include "DamagedObject.h"
-#include "ObjectCodec.h"
 #include "SqliteSchema.h"
 #include "TavoConfigStore/ConfigStore.h"
+#include "object/DamagedObject.h"
+#include "object/Objects.h"
 
 namespace TavoConfigStore {
 namespace {
@@ -126,7 +126,7 @@ class SqliteStore final : public ConfigStore {
     // run of writes allocates nothing here.
     thread_local std::string body;
     body.clear();
-    codec::EncodeObject(*object, &body);
+    objectmodel::EncodeObject(*object, &body);
     std::lock_guard<std::mutex> lock(mu_);
     OpenForWriting();
     Write([&] {
@@ -175,7 +175,7 @@ class SqliteStore final : public ConfigStore {
       // Objects of several collections are merged into write order by seq.
       std::vector<sqlite3_int64> seqs;
       std::string id;  // keeps its capacity from one object to the next
-      codec::BodyArena arena;
+      objectmodel::Arena arena;
       for (Collection* c : matching) {
         sqlite3_stmt* s = StatementOf(c, instance.empty() ? kList : kListOne);
         Resetter reset(s);
@@ -808,18 +808,12 @@ class SqliteStore final : public ConfigStore {
   }
 
   std::shared_ptr<ConfigStoreObject> Decode(ConfigStoreObjectId id, sqlite3_stmt* s, int column,
-                                            codec::BodyArena* arena = nullptr) {
+                                            objectmodel::Arena* arena = nullptr) {
     const void* data = sqlite3_column_blob(s, column);
-    const int size = sqlite3_column_bytes(s, column);
-    try {
-      return codec::DecodeObject(std::move(id), static_cast<const unsigned char*>(data),
-                                 data == nullptr ? 0 : static_cast<std::size_t>(size), arena);
-    } catch (const ConfigStoreException& e) {
-      // The object still lists: a caller going through a collection loses
-      // this one record, not the catalogue.
-      return std::make_shared<DamagedObject>(
-          std::move(id), ConfigStoreException(Where() + ": " + e.Message(), e.Code()));
-    }
+    const std::string_view body(
+        static_cast<const char*>(data),
+        data == nullptr ? 0 : static_cast<std::size_t>(sqlite3_column_bytes(s, column)));
+    return objectmodel::DecodeOrDamaged(std::move(id), body, arena, Where());
   }
 
   // NOMUTEX turns off SQLite's own locking; this keeps a store that is shared

@@ -33,8 +33,8 @@
 #include <utility>
 #include <vector>
 
-#include "../DamagedObject.h"
-#include "../ObjectCodec.h"
+#include "../object/DamagedObject.h"
+#include "../object/Objects.h"
 #include "EtcdClient.h"
 #include "EtcdLayout.h"
 #include "EtcdWire.h"
@@ -376,7 +376,7 @@ class EtcdStore final : public ConfigStore {
       const Current* current = Find(pointers, collection);
       Observe(collection, current ? *current : Current());
       if (entries.empty()) return nullptr;
-      return Decode(id, entries.front(), nullptr);
+      return Decode(id, entries.front());
     });
   }
 
@@ -387,7 +387,7 @@ class EtcdStore final : public ConfigStore {
     }
     DamagedObject::RefuseWrite(*object);
     Put put;
-    codec::EncodeObject(*object, &put.body);
+    objectmodel::EncodeObject(*object, &put.body);
     std::lock_guard<std::mutex> lock(mu_);
     InTransaction([&] {
       Pending& pending = txn_.collections[etcdlayout::CollectionOf(object->Id())];
@@ -796,30 +796,21 @@ class EtcdStore final : public ConfigStore {
   }
 
   std::shared_ptr<ConfigStoreObject> Decode(const ConfigStoreObjectId& collection,
-                                            const Entry& entry, codec::BodyArena* arena) {
+                                            const Entry& entry,
+                                            objectmodel::Arena* arena = nullptr) {
     ConfigStoreObjectId id(collection.Key(), collection.Group(), collection.Component());
     id.SetInstanceId(entry.instance);
-    std::string damage = entry.damage;
-    if (damage.empty()) {
-      try {
-        return codec::DecodeObject(std::move(id),
-                                   reinterpret_cast<const unsigned char*>(entry.body.data()),
-                                   entry.body.size(), arena);
-      } catch (const ConfigStoreException& e) {
-        damage = e.Message();
-      }
+    if (!entry.damage.empty()) {
+      return std::make_shared<DamagedObject>(
+          std::move(id),
+          ConfigStoreException(client_.Where() + ": " + entry.damage, kErrorCorruptObject));
     }
-    // The object still lists: a caller going through a collection loses
-    // this one record, not the catalogue.
-    return std::make_shared<DamagedObject>(
-        std::move(id), ConfigStoreException(client_.Where() + ": " + damage, kErrorCorruptObject));
+    return objectmodel::DecodeOrDamaged(std::move(id), entry.body, arena, client_.Where());
   }
 
   static std::shared_ptr<ConfigStoreObject> DecodePut(const ConfigStoreObjectId& id,
                                                       const Put& put) {
-    ConfigStoreObjectId copy(id);
-    return codec::DecodeObject(
-        std::move(copy), reinterpret_cast<const unsigned char*>(put.body.data()), put.body.size());
+    return objectmodel::DecodeObject(id, put.body, nullptr);
   }
 
   // What the open transaction did to a collection, if anything.
@@ -862,7 +853,7 @@ class EtcdStore final : public ConfigStore {
       std::shared_ptr<ConfigStoreObject> object;
     };
     std::vector<Listed> listed;
-    codec::BodyArena arena;
+    objectmodel::Arena arena;
     for (const std::string& name : Matching(filter, pointers)) {
       ConfigStoreObjectId collection("", "", "");
       etcdlayout::ParseCollection(name, &collection);

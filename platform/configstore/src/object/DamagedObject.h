@@ -2,8 +2,8 @@
 // identifier like any other, and every read of its contents throws the
 // decoding error, so that only the reads of this one object fail.
 
-#ifndef TAVOCONFIGSTORE_SRC_DAMAGED_OBJECT_H_
-#define TAVOCONFIGSTORE_SRC_DAMAGED_OBJECT_H_
+#ifndef TAVOCONFIGSTORE_SRC_OBJECT_DAMAGED_OBJECT_H_
+#define TAVOCONFIGSTORE_SRC_OBJECT_DAMAGED_OBJECT_H_
 
 #include <memory>
 #include <string>
@@ -41,4 +41,4 @@ class DamagedObject final : public ConfigStoreObject {
 
 }  // namespace TavoConfigStore
 
-#endif  // TAVOCONFIGSTORE_SRC_DAMAGED_OBJECT_H_
+#endif  // TAVOCONFIGSTORE_SRC_OBJECT_DAMAGED_OBJECT_H_
