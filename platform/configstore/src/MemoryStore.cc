@@ -5,8 +5,8 @@
 #include <tuple>
 #include <vector>
 
+#include "Backend.h"
 #include "TavoConfigStore/ConfigStore.h"
-#include "object/DamagedObject.h"
 #include "object/Objects.h"
 
 namespace TavoConfigStore {
@@ -35,23 +35,22 @@ struct State {
   std::map<IdKey, std::uint64_t> index;
 };
 
-class MemoryStore final : public ConfigStore {
+class MemoryStore final : public Backend {
  public:
-  std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
+  std::string Where() const override { return "memory store"; }
+
+  std::shared_ptr<ConfigStoreObject> Get(const ConfigStoreObjectId& id) override {
     std::lock_guard<std::mutex> lock(mu_);
     auto it = state_.index.find(KeyOf(id));
     if (it == state_.index.end()) return nullptr;
     return Read(*state_.bySeq.at(it->second));
   }
 
-  void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
-                 std::int32_t& /*flags*/) override {
-    RefuseNull(object.get(), "SetObject");
-    DamagedObject::RefuseWrite(*object);
-    auto copy = std::make_shared<Stored>(Stored{object->Id(), std::string()});
-    objectmodel::EncodeObject(*object, &copy->body);
+  void Set(const ConfigStoreObject& object) override {
+    auto copy = std::make_shared<Stored>(Stored{object.Id(), std::string()});
+    objectmodel::EncodeObject(object, &copy->body);
     std::lock_guard<std::mutex> lock(mu_);
-    IdKey key = KeyOf(object->Id());
+    IdKey key = KeyOf(object.Id());
     auto it = state_.index.find(key);
     if (it != state_.index.end()) {
       state_.bySeq.erase(it->second);
@@ -62,11 +61,10 @@ class MemoryStore final : public ConfigStore {
     state_.index.emplace(std::move(key), seq);
   }
 
-  void DeleteObjects(const std::shared_ptr<FilterSpecObject>& filter) override {
-    RefuseNull(filter.get(), "DeleteObjects");
+  void Delete(const FilterSpecObject& filter) override {
     std::lock_guard<std::mutex> lock(mu_);
     for (auto it = state_.bySeq.begin(); it != state_.bySeq.end();) {
-      if (filter->Matches(it->second->id)) {
+      if (filter.Matches(it->second->id)) {
         state_.index.erase(KeyOf(it->second->id));
         it = state_.bySeq.erase(it);
       } else {
@@ -75,13 +73,11 @@ class MemoryStore final : public ConfigStore {
     }
   }
 
-  std::vector<std::shared_ptr<ConfigStoreObject>> GetObjects(
-      const std::shared_ptr<FilterSpecObject>& filter) override {
-    RefuseNull(filter.get(), "GetObjects");
+  std::vector<std::shared_ptr<ConfigStoreObject>> List(const FilterSpecObject& filter) override {
     std::lock_guard<std::mutex> lock(mu_);
     std::vector<std::shared_ptr<ConfigStoreObject>> out;
     for (const auto& [seq, stored] : state_.bySeq) {
-      if (filter->Matches(stored->id)) out.push_back(Read(*stored));
+      if (filter.Matches(stored->id)) out.push_back(Read(*stored));
     }
     return out;
   }
@@ -95,8 +91,7 @@ class MemoryStore final : public ConfigStore {
   void CommitTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
     if (saved_.empty()) {
-      throw ConfigStoreException("configuration store: no transaction to commit",
-                                 kErrorNoTransaction);
+      throw ConfigStoreException(Where() + ": no transaction to commit", kErrorNoTransaction);
     }
     saved_.pop_back();
   }
@@ -109,13 +104,6 @@ class MemoryStore final : public ConfigStore {
   }
 
  private:
-  static void RefuseNull(const void* argument, const char* operation) {
-    if (argument == nullptr) {
-      throw ConfigStoreException(std::string("configuration store: ") + operation + " of null",
-                                 kErrorNullArgument);
-    }
-  }
-
   std::mutex mu_;
   State state_;
   std::vector<State> saved_;  // the state at each open BeginTransaction, outermost first

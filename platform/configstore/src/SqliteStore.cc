@@ -42,9 +42,9 @@
 #include <utility>
 #include <vector>
 
+#include "Backend.h"
 #include "SqliteSchema.h"
 #include "TavoConfigStore/ConfigStore.h"
-#include "object/DamagedObject.h"
 #include "object/Objects.h"
 
 namespace TavoConfigStore {
@@ -92,7 +92,7 @@ struct OneShot {
   ~OneShot() { sqlite3_finalize(s); }
 };
 
-class SqliteStore final : public ConfigStore {
+class SqliteStore final : public Backend {
  public:
   SqliteStore(const std::string& path, const SqliteStoreOptions& options)
       : path_(path), where_("configuration store " + RedactLocator(path)), options_(options) {
@@ -102,7 +102,7 @@ class SqliteStore final : public ConfigStore {
     Open(false);
   }
 
-  std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
+  std::shared_ptr<ConfigStoreObject> Get(const ConfigStoreObjectId& id) override {
     std::lock_guard<std::mutex> lock(mu_);
     if (!Open(false)) return nullptr;
     // A collection, once made, is never dropped: finding it and then its
@@ -118,19 +118,16 @@ class SqliteStore final : public ConfigStore {
     return Decode(ConfigStoreObjectId(id), s, 2);
   }
 
-  void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
-                 std::int32_t& /*flags*/) override {
-    if (!object) throw ConfigStoreException(Where() + ": SetObject of null", kErrorNullArgument);
-    DamagedObject::RefuseWrite(*object);
+  void Set(const ConfigStoreObject& object) override {
     // Encoded outside the lock into a buffer that keeps its capacity, so a
     // run of writes allocates nothing here.
     thread_local std::string body;
     body.clear();
-    objectmodel::EncodeObject(*object, &body);
+    objectmodel::EncodeObject(object, &body);
     std::lock_guard<std::mutex> lock(mu_);
     OpenForWriting();
     Write([&] {
-      const ConfigStoreObjectId& id = object->Id();
+      const ConfigStoreObjectId& id = object.Id();
       Collection* c = FindCollection(id.Key(), id.Group(), id.Component(), true);
       sqlite3_stmt* s = StatementOf(c, kPut);
       Resetter reset(s);
@@ -141,14 +138,12 @@ class SqliteStore final : public ConfigStore {
     });
   }
 
-  void DeleteObjects(const std::shared_ptr<FilterSpecObject>& filter) override {
-    if (!filter)
-      throw ConfigStoreException(Where() + ": DeleteObjects of null", kErrorNullArgument);
+  void Delete(const FilterSpecObject& filter) override {
     std::lock_guard<std::mutex> lock(mu_);
     OpenForWriting();
     Write([&] {
-      const std::string& instance = filter->Id().InstanceId();
-      for (Collection* c : MatchingCollections(filter->Id())) {
+      const std::string& instance = filter.Id().InstanceId();
+      for (Collection* c : MatchingCollections(filter.Id())) {
         // Without an instance id, the whole table: SQLite then frees its
         // pages at once instead of deleting row by row.
         sqlite3_stmt* s = StatementOf(c, instance.empty() ? kClear : kErase);
@@ -159,9 +154,7 @@ class SqliteStore final : public ConfigStore {
     });
   }
 
-  std::vector<std::shared_ptr<ConfigStoreObject>> GetObjects(
-      const std::shared_ptr<FilterSpecObject>& filter) override {
-    if (!filter) throw ConfigStoreException(Where() + ": GetObjects of null", kErrorNullArgument);
+  std::vector<std::shared_ptr<ConfigStoreObject>> List(const FilterSpecObject& filter) override {
     std::lock_guard<std::mutex> lock(mu_);
     std::vector<std::shared_ptr<ConfigStoreObject>> out;
     if (!Open(false)) return out;
@@ -170,8 +163,8 @@ class SqliteStore final : public ConfigStore {
     const bool ownRead = sqlite3_get_autocommit(db_) != 0;
     if (ownRead) Step(begin_, "starting a read");
     try {
-      const std::string& instance = filter->Id().InstanceId();
-      const std::vector<Collection*> matching = MatchingCollections(filter->Id());
+      const std::string& instance = filter.Id().InstanceId();
+      const std::vector<Collection*> matching = MatchingCollections(filter.Id());
       // Objects of several collections are merged into write order by seq.
       std::vector<sqlite3_int64> seqs;
       std::string id;  // keeps its capacity from one object to the next
@@ -554,7 +547,7 @@ class SqliteStore final : public ConfigStore {
 
   // Names the store in every message, never with a password that a
   // URL-like path may hold.
-  const std::string& Where() const { return where_; }
+  std::string Where() const override { return where_; }
 
   // Once SQLite has rolled the caller's transaction back by itself (full
   // disk, I/O error, interrupt), a write would be committed on its own at

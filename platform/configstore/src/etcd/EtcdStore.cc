@@ -33,7 +33,7 @@
 #include <utility>
 #include <vector>
 
-#include "../object/DamagedObject.h"
+#include "../Backend.h"
 #include "../object/Objects.h"
 #include "EtcdClient.h"
 #include "EtcdLayout.h"
@@ -354,14 +354,16 @@ class ChangeFeed {
   std::thread thread_;
 };
 
-class EtcdStore final : public ConfigStore {
+class EtcdStore final : public Backend {
  public:
   explicit EtcdStore(const EtcdStoreOptions& options)
       : client_(options), keys_(options.prefix), legacyKeys_(Keys::Legacy(options.prefix)) {}
 
   ~EtcdStore() override { feed_.reset(); }
 
-  std::shared_ptr<ConfigStoreObject> GetObject(const ConfigStoreObjectId& id) override {
+  std::string Where() const override { return client_.Where(); }
+
+  std::shared_ptr<ConfigStoreObject> Get(const ConfigStoreObjectId& id) override {
     std::lock_guard<std::mutex> lock(mu_);
     const std::string collection = etcdlayout::CollectionOf(id);
     if (const Pending* pending = PendingOf(collection)) {
@@ -380,38 +382,30 @@ class EtcdStore final : public ConfigStore {
     });
   }
 
-  void SetObject(const std::shared_ptr<ConfigStoreObject>& object,
-                 std::int32_t& /*flags*/) override {
-    if (!object) {
-      throw ConfigStoreException(client_.Where() + ": SetObject of null", kErrorNullArgument);
-    }
-    DamagedObject::RefuseWrite(*object);
+  void Set(const ConfigStoreObject& object) override {
     Put put;
-    objectmodel::EncodeObject(*object, &put.body);
+    objectmodel::EncodeObject(object, &put.body);
     std::lock_guard<std::mutex> lock(mu_);
     InTransaction([&] {
-      Pending& pending = txn_.collections[etcdlayout::CollectionOf(object->Id())];
+      Pending& pending = txn_.collections[etcdlayout::CollectionOf(object.Id())];
       put.seq = txn_.nextSeq++;
       // Erased first: a replaced object moves to the end of the write order.
-      pending.puts.erase(object->Id().InstanceId());
-      pending.puts.emplace(object->Id().InstanceId(), std::move(put));
+      pending.puts.erase(object.Id().InstanceId());
+      pending.puts.emplace(object.Id().InstanceId(), std::move(put));
     });
   }
 
-  void DeleteObjects(const std::shared_ptr<FilterSpecObject>& filter) override {
-    if (!filter) {
-      throw ConfigStoreException(client_.Where() + ": DeleteObjects of null", kErrorNullArgument);
-    }
+  void Delete(const FilterSpecObject& filter) override {
     std::lock_guard<std::mutex> lock(mu_);
     InTransaction([&] {
-      const ConfigStoreObjectId& want = filter->Id();
+      const ConfigStoreObjectId& want = filter.Id();
       // A collection named in full is not looked up: the commit finds out
       // whether it exists. A caller that goes on past a failed deletion
       // (the library's Reset) must not commit as if it had asked for none.
       const std::string exact = ExactCollection(want);
       const Pointers pointers =
           exact.empty() ? Reading([&] { return VisiblePointers(std::string()); }) : Pointers();
-      std::set<std::string> names = Matching(*filter, pointers);
+      std::set<std::string> names = Matching(filter, pointers);
       if (!exact.empty()) names.insert(exact);
       for (const std::string& name : names) {
         Pending& pending = txn_.collections[name];
@@ -427,13 +421,9 @@ class EtcdStore final : public ConfigStore {
     });
   }
 
-  std::vector<std::shared_ptr<ConfigStoreObject>> GetObjects(
-      const std::shared_ptr<FilterSpecObject>& filter) override {
-    if (!filter) {
-      throw ConfigStoreException(client_.Where() + ": GetObjects of null", kErrorNullArgument);
-    }
+  std::vector<std::shared_ptr<ConfigStoreObject>> List(const FilterSpecObject& filter) override {
     std::lock_guard<std::mutex> lock(mu_);
-    return Reading([&] { return List(*filter); });
+    return Reading([&] { return Listing(filter); });
   }
 
   void BeginTransaction() override {
@@ -839,7 +829,7 @@ class EtcdStore final : public ConfigStore {
     if (depth_ > 0) observed_.emplace(collection, current.version);
   }
 
-  std::vector<std::shared_ptr<ConfigStoreObject>> List(const FilterSpecObject& filter) {
+  std::vector<std::shared_ptr<ConfigStoreObject>> Listing(const FilterSpecObject& filter) {
     const ConfigStoreObjectId& want = filter.Id();
     const std::string* instance = want.InstanceId().empty() ? nullptr : &want.InstanceId();
     const std::string exact = ExactCollection(want);
