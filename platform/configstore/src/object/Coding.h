@@ -45,17 +45,28 @@ void PutLengthPrefixed(std::string* out, std::string_view bytes);
 // Read from the front of "*in" and drop what they read. False when the bytes
 // end first, or a varint is too long or overflows 64 bits; "*in" is then
 // left somewhere inside.
-bool GetVarintSlow(std::string_view* in, std::uint64_t* value);
 inline bool GetVarint(std::string_view* in, std::uint64_t* value) {
-  // One byte is the common case: lengths and counts below 128.
-  if (!in->empty() && static_cast<unsigned char>(in->front()) < 0x80) {
-    *value = static_cast<unsigned char>(in->front());
-    in->remove_prefix(1);
-    return true;
+  std::uint64_t result = 0;
+  const std::size_t n = in->size() < kMaxVarintLength ? in->size() : kMaxVarintLength;
+  for (std::size_t i = 0; i < n; ++i) {
+    const auto byte = static_cast<unsigned char>((*in)[i]);
+    if (i == kMaxVarintLength - 1 && byte > 1) return false;  // past 64 bits
+    result |= static_cast<std::uint64_t>(byte & 0x7f) << (7 * i);
+    if ((byte & 0x80) == 0) {
+      in->remove_prefix(i + 1);
+      *value = result;
+      return true;
+    }
   }
-  return GetVarintSlow(in, value);
+  return false;
 }
-bool GetLengthPrefixed(std::string_view* in, std::string_view* bytes);
+inline bool GetLengthPrefixed(std::string_view* in, std::string_view* bytes) {
+  std::uint64_t size = 0;
+  if (!GetVarint(in, &size) || size > in->size()) return false;
+  *bytes = in->substr(0, static_cast<std::size_t>(size));
+  in->remove_prefix(static_cast<std::size_t>(size));
+  return true;
+}
 
 // Signed numbers as varints: small negative ones stay short.
 inline std::uint64_t ZigZag(std::int64_t value) {

@@ -1,5 +1,8 @@
 #include "Format.h"
 
+#include <algorithm>
+#include <cstring>
+
 #include "Coding.h"
 #include "TavoConfigStore/ConfigStoreException.h"
 
@@ -14,9 +17,10 @@ constexpr char kKindInteger = 1;
   throw ConfigStoreException(std::string("corrupt object encoding: ") + why, kErrorCorruptObject);
 }
 
-// Reads one value from the front of "*in"; false when it is damaged.
-bool GetValue(std::string_view* in, Value* out) {
-  if (!coding::GetLengthPrefixed(in, &out->name) || in->empty()) return false;
+// Read a value's kind and payload from the front of "*in"; false when
+// they are damaged.
+bool GetPayload(std::string_view* in, Value* out) {
+  if (in->empty()) return false;
   const char kind = in->front();
   in->remove_prefix(1);
   if (kind == kKindBytes) {
@@ -28,6 +32,20 @@ bool GetValue(std::string_view* in, Value* out) {
   out->isInteger = true;
   out->integer = coding::UnZigZag(zigzag);
   return true;
+}
+
+bool SkipPayload(std::string_view* in) {
+  if (in->empty()) return false;
+  const char kind = in->front();
+  in->remove_prefix(1);
+  std::uint64_t ignored = 0;
+  if (kind == kKindInteger) return coding::GetVarint(in, &ignored);
+  std::string_view bytes;
+  return kind == kKindBytes && coding::GetLengthPrefixed(in, &bytes);
+}
+
+bool GetValue(std::string_view* in, Value* out) {
+  return coding::GetLengthPrefixed(in, &out->name) && GetPayload(in, out);
 }
 
 // A count of items that each take at least one byte: more than are left
@@ -43,21 +61,31 @@ bool GetCount(std::string_view* in, std::size_t* count) {
 void SkipValues(std::string_view* in) {
   std::size_t count = 0;
   if (!GetCount(in, &count)) Corrupt("truncated value count");
-  Value value;
+  std::string_view name;
   for (std::size_t i = 0; i < count; ++i) {
-    if (!GetValue(in, &value)) Corrupt("damaged value");
+    if (!coding::GetLengthPrefixed(in, &name) || !SkipPayload(in)) Corrupt("damaged value");
   }
 }
 
+std::size_t ValueSize(std::string_view name, const std::string* bytes, std::int64_t integer) {
+  return coding::VarintLength(name.size()) + name.size() + 1 +
+         (bytes ? coding::VarintLength(bytes->size()) + bytes->size()
+                : coding::VarintLength(coding::ZigZag(integer)));
+}
+
+// Appends one value, written in place after one resize.
 void PutValue(std::string* out, std::string_view name, const std::string* bytes,
               std::int64_t integer) {
-  coding::PutLengthPrefixed(out, name);
+  const std::size_t at = out->size();
+  out->resize(at + ValueSize(name, bytes, integer));
+  char* p = coding::EncodeVarint(&(*out)[at], name.size());
+  p = std::copy(name.begin(), name.end(), p);
   if (bytes != nullptr) {
-    out->push_back(kKindBytes);
-    coding::PutLengthPrefixed(out, *bytes);
+    *p++ = kKindBytes;
+    std::copy(bytes->begin(), bytes->end(), coding::EncodeVarint(p, bytes->size()));
   } else {
-    out->push_back(kKindInteger);
-    coding::PutVarint(out, coding::ZigZag(integer));
+    *p++ = kKindInteger;
+    coding::EncodeVarint(p, coding::ZigZag(integer));
   }
 }
 
@@ -87,8 +115,10 @@ Parts Split(std::string_view body) {
 bool FindValue(std::string_view values, std::string_view name, Value* out) {
   std::size_t count = 0;
   if (values.empty() || !GetCount(&values, &count)) return false;
-  for (std::size_t i = 0; i < count && GetValue(&values, out); ++i) {
-    if (out->name == name) return true;
+  for (std::size_t i = 0; i < count; ++i) {
+    if (!coding::GetLengthPrefixed(&values, &out->name)) return false;
+    if (out->name == name) return GetPayload(&values, out);
+    if (!SkipPayload(&values)) return false;
   }
   return false;
 }
@@ -113,25 +143,36 @@ std::vector<StoreValue> DecodeValues(std::string_view values) {
 
 void SetValue(std::string* values, std::string_view name, const std::string* bytes,
               std::int64_t integer) {
-  std::string encoded;
-  PutValue(&encoded, name, bytes, integer);
   std::string_view in(*values);
   std::size_t count = 0;
   if (!in.empty() && !GetCount(&in, &count)) Corrupt("damaged value count");
   const std::size_t countSize = values->size() - in.size();
-  Value value;
+  std::string_view candidate;
   for (std::size_t i = 0; i < count; ++i) {
     const std::size_t start = values->size() - in.size();
-    if (!GetValue(&in, &value)) Corrupt("damaged value");
-    if (value.name == name) {
+    if (!coding::GetLengthPrefixed(&in, &candidate) || !SkipPayload(&in)) {
+      Corrupt("damaged value");
+    }
+    if (candidate == name) {
+      std::string encoded;
+      PutValue(&encoded, name, bytes, integer);
       values->replace(start, values->size() - in.size() - start, encoded);
       return;
     }
   }
-  std::string newCount;
-  coding::PutVarint(&newCount, count + 1);
-  values->replace(0, countSize, newCount);
-  values->append(encoded);
+  // A new name goes at the end, written in place: the count is rewritten,
+  // and moves the rest only when it grows a byte.
+  char newCount[coding::kMaxVarintLength];
+  const std::size_t newCountSize =
+      static_cast<std::size_t>(coding::EncodeVarint(newCount, count + 1) - newCount);
+  // Room for a few more names and short values besides: most objects are
+  // set value after value.
+  const std::size_t needed =
+      values->size() + newCountSize - countSize + ValueSize(name, bytes, integer);
+  if (values->capacity() < needed) values->reserve(needed + 64);
+  if (newCountSize != countSize) values->insert(0, newCountSize - countSize, '\0');
+  std::memcpy(&(*values)[0], newCount, newCountSize);
+  PutValue(values, name, bytes, integer);
 }
 
 SubReader::SubReader(std::string_view subs) : rest_(subs) {

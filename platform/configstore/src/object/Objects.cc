@@ -1,6 +1,7 @@
 #include "Objects.h"
 
 #include <cstring>
+#include <new>
 #include <string_view>
 #include <utility>
 
@@ -28,17 +29,65 @@ bool SubMatches(const FilterSpecObject* filter, std::string_view array, std::str
 }  // namespace
 
 // The sub-objects of a read object: an object over each one's values in the
-// body, which the index keeps.
+// body, which the index keeps. The entries follow the index in the same
+// allocation (WithEntries).
 struct SubIndex {
   struct Entry {
     std::string_view array;
     std::string_view key;
     StoreObject object;
   };
+  SubIndex(std::size_t n, Entry* room) : count(n), entries(room) {}
+  SubIndex(const SubIndex&) = delete;
+  SubIndex& operator=(const SubIndex&) = delete;
+  ~SubIndex() {
+    for (std::size_t i = 0; i < count; ++i) entries[i].~Entry();
+  }
+  const Entry* begin() const { return entries; }
+  const Entry* end() const { return entries + count; }
+
   std::weak_ptr<SubIndex> self;
   std::shared_ptr<const void> body;
-  std::vector<Entry> entries;
+  std::size_t count;
+  Entry* entries;
 };
+
+namespace {
+
+// An allocator for allocate_shared that takes room for "count" entries
+// after what it allocates and says where: the index, its entries and the
+// shared count are then one allocation.
+template <typename T>
+struct WithEntries {
+  using value_type = T;
+  std::size_t count;
+  SubIndex::Entry** room;
+
+  WithEntries(std::size_t n, SubIndex::Entry** r) : count(n), room(r) {}
+  template <typename U>
+  WithEntries(const WithEntries<U>& other) : count(other.count), room(other.room) {}
+
+  static std::size_t Head(std::size_t n) {
+    constexpr std::size_t kAlign = alignof(SubIndex::Entry);
+    return (n * sizeof(T) + kAlign - 1) / kAlign * kAlign;
+  }
+  T* allocate(std::size_t n) {
+    char* p = static_cast<char*>(::operator new(Head(n) + count * sizeof(SubIndex::Entry)));
+    *room = reinterpret_cast<SubIndex::Entry*>(p + Head(n));
+    return reinterpret_cast<T*>(p);
+  }
+  void deallocate(T* p, std::size_t) { ::operator delete(p); }
+  template <typename U>
+  bool operator==(const WithEntries<U>& other) const {
+    return count == other.count && room == other.room;
+  }
+  template <typename U>
+  bool operator!=(const WithEntries<U>& other) const {
+    return !(*this == other);
+  }
+};
+
+}  // namespace
 
 // The one friend of the object classes: the object model's own code reaches
 // their representation through it.
@@ -67,17 +116,20 @@ class Access {
   }
 
   static std::shared_ptr<SubIndex> NewIndex(const ConfigStoreObject& object) {
-    auto index = std::make_shared<SubIndex>();
+    format::SubReader reader(EncodedSubs(object));
+    SubIndex::Entry* room = nullptr;
+    auto index = std::allocate_shared<SubIndex>(WithEntries<SubIndex>(reader.Count(), &room),
+                                                std::size_t{0}, room);
+    index->entries = room;
     index->self = index;
     index->body = object.body_;
-    format::SubReader reader(EncodedSubs(object));
-    index->entries.resize(reader.Count());
     format::Sub sub;
-    for (SubIndex::Entry& entry : index->entries) {
-      reader.Next(&sub);
-      entry.array = sub.array;
-      entry.key = sub.key;
-      View(entry.object, sub.values, nullptr);
+    while (reader.Next(&sub)) {
+      SubIndex::Entry* entry = new (room + index->count) SubIndex::Entry();
+      ++index->count;
+      entry->array = sub.array;
+      entry->key = sub.key;
+      View(entry->object, sub.values, nullptr);
     }
     return index;
   }
@@ -95,9 +147,9 @@ class Access {
     return object.subs_;
   }
 
-  static std::shared_ptr<ConfigStoreObject> Decode(ConfigStoreObjectId&& id, std::string_view body,
-                                                   Arena* arena) {
-    const format::Parts parts = format::Split(body);
+  // An object over "body", whose sections "parts" are.
+  static std::shared_ptr<ConfigStoreObject> Place(ConfigStoreObjectId&& id, std::string_view body,
+                                                  const format::Parts& parts, Arena* arena) {
     Arena alone;
     if (arena == nullptr) arena = &alone;
     std::shared_ptr<const void> owner;
@@ -143,18 +195,19 @@ void EncodeObject(const ConfigStoreObject& object, std::string* out) {
 
 std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId id, std::string_view body,
                                                 Arena* arena) {
-  return Access::Decode(std::move(id), body, arena);
+  return Access::Place(std::move(id), body, format::Split(body), arena);
 }
 
 std::shared_ptr<ConfigStoreObject> DecodeOrDamaged(ConfigStoreObjectId id, std::string_view body,
                                                    Arena* arena, const std::string& where) {
+  format::Parts parts;
   try {
-    // A copy: "id" is still needed should the body be damaged.
-    return Access::Decode(ConfigStoreObjectId(id), body, arena);
+    parts = format::Split(body);
   } catch (const ConfigStoreException& e) {
     return std::make_shared<DamagedObject>(
         std::move(id), ConfigStoreException(where + ": " + e.Message(), e.Code()));
   }
+  return Access::Place(std::move(id), body, parts, arena);
 }
 
 }  // namespace objectmodel
@@ -256,8 +309,8 @@ std::vector<SubObjectEntry> ConfigStoreObject::SubObjects() const {
   if (encodedSubs_ == nullptr) return subs_;
   const objectmodel::SubIndex& index = Index();
   std::vector<SubObjectEntry> out;
-  out.reserve(index.entries.size());
-  for (const auto& e : index.entries) {
+  out.reserve(index.count);
+  for (const auto& e : index) {
     out.push_back(SubObjectEntry{SubObjectId(std::string(e.array), std::string(e.key)),
                                  Access::Share(index, e)});
   }
@@ -287,7 +340,7 @@ std::shared_ptr<StoreObject> ConfigStoreObject::CreateSubObject(const SubObjectI
 std::shared_ptr<StoreObject> ConfigStoreObject::GetSubObject(const SubObjectId& id) const {
   if (encodedSubs_ != nullptr) {
     const objectmodel::SubIndex& index = Index();
-    for (const auto& e : index.entries) {
+    for (const auto& e : index) {
       if (e.array == id.Array() && e.key == id.Key()) return Access::Share(index, e);
     }
     return nullptr;
@@ -303,8 +356,8 @@ std::vector<std::shared_ptr<StoreObject>> ConfigStoreObject::GetSubObjectInstanc
   std::vector<std::shared_ptr<StoreObject>> out;
   if (encodedSubs_ != nullptr) {
     const objectmodel::SubIndex& index = Index();
-    out.reserve(index.entries.size());
-    for (const auto& e : index.entries) {
+    out.reserve(index.count);
+    for (const auto& e : index) {
       if (objectmodel::SubMatches(filter.get(), e.array, e.key)) {
         out.push_back(Access::Share(index, e));
       }
