@@ -147,13 +147,15 @@ Pointers EtcdReader::ReadPointers(const std::string& collection, bool orphans) {
   }
   Pointers pointers = PointersOf(keys_, reply.ranges[0], reply.revision);
   if (orphans) {
+    const std::string writers = keys_.Writers();
+    const std::string registered = keys_.Registered();
     std::set<std::string_view> live;
     for (const etcdwire::KeyValue& kv : reply.ranges.back().kvs) {
-      live.insert(Keys::NameIn(keys_.Writers(), kv.key));
+      live.insert(Keys::NameIn(writers, kv.key));
     }
     for (const auto& [name, current] : pointers.byCollection) live.insert(current.gen);
     for (const etcdwire::KeyValue& kv : reply.ranges[reply.ranges.size() - 2].kvs) {
-      const std::string_view gen = Keys::NameIn(keys_.Registered(), kv.key);
+      const std::string_view gen = Keys::NameIn(registered, kv.key);
       if (!live.count(gen)) pointers.orphans.emplace_back(gen);
     }
   }
