@@ -1,7 +1,5 @@
 #include "EtcdClient.h"
 
-#include <grpcpp/impl/client_unary_call.h>
-
 #include <algorithm>
 #include <cstring>
 #include <thread>
@@ -59,24 +57,47 @@ bool NotConnected(const std::string& message) {
          Contains(message, "empty address list") || Contains(message, "DNS resolution failed");
 }
 
-}  // namespace
-
-std::string PrefixEnd(std::string prefix) {
-  while (!prefix.empty()) {
-    if (static_cast<unsigned char>(prefix.back()) != 0xff) {
-      prefix.back() = static_cast<char>(static_cast<unsigned char>(prefix.back()) + 1);
-      return prefix;
-    }
-    prefix.pop_back();
-  }
-  return std::string(1, '\0');  // every key
+grpc::ByteBuffer Serialized(const grpc::protobuf::MessageLite& message) {
+  grpc::ByteBuffer buffer;
+  bool own = false;
+  grpc::SerializationTraits<grpc::protobuf::MessageLite>::Serialize(message, &buffer, &own);
+  return buffer;
 }
+
+// One unary call by name through gRPC's generic stub, driven on a queue of
+// its own as a blocking call is; the reply's bytes end up in one slice, as
+// the reader's views need.
+grpc::Status CallByName(EtcdMember& member, grpc::ClientContext* context, const char* method,
+                        const grpc::ByteBuffer& request, grpc::Slice* reply) {
+  grpc::CompletionQueue queue;
+  grpc::ByteBuffer received;
+  grpc::Status status;
+  {
+    auto call = member.calls.PrepareUnaryCall(context, method, request, &queue);
+    call->StartCall();
+    call->Finish(&received, &status, nullptr);
+    void* tag = nullptr;
+    bool ok = false;
+    queue.Next(&tag, &ok);
+  }
+  queue.Shutdown();
+  void* tag = nullptr;
+  bool ok = false;
+  while (queue.Next(&tag, &ok)) {
+  }
+  if (status.ok() && !received.TrySingleSlice(reply).ok() &&
+      !received.DumpToSingleSlice(reply).ok()) {
+    return grpc::Status(grpc::StatusCode::INTERNAL, "empty reply");
+  }
+  return status;
+}
+
+}  // namespace
 
 EtcdClient::EtcdClient(const EtcdStoreOptions& options)
     : options_(options),
       material_(options.tls ? LoadTlsMaterial(options) : TlsMaterial()),
-      members_(options, material_),
-      budget_(milliseconds(options.timeoutMs)) {
+      members_(options, material_) {
   where_ = "etcd ";
   for (std::size_t i = 0; i < options.endpoints.size(); ++i) {
     where_ += (i ? "," : "") + options.endpoints[i];
@@ -85,11 +106,40 @@ EtcdClient::EtcdClient(const EtcdStoreOptions& options)
 
 void EtcdClient::Fail(const grpc::Status& status, const char* what) const {
   throw ConfigStoreException(where_ + ": " + what + ": " + status.error_message(),
-                             kErrorEtcdBase + static_cast<int>(status.error_code()));
+                             EtcdCode(status.error_code()));
+}
+
+EtcdClient::Call::Call(EtcdClient& client) : client_(client) {
+  std::lock_guard<std::mutex> lock(client_.budgetMu_);
+  if (client_.callDepth_++ > 0) return;
+  client_.allowed_ = milliseconds(client_.options_.timeoutMs);
+  client_.spent_ = Clock::duration::zero();
+  client_.chargedUntil_ = Clock::time_point();
+}
+
+EtcdClient::Call::~Call() {
+  std::lock_guard<std::mutex> lock(client_.budgetMu_);
+  --client_.callDepth_;
 }
 
 void EtcdClient::AllowSettling() {
-  budget_.Extend(std::min(kSettling, milliseconds(options_.timeoutMs / 5)));
+  const milliseconds extra = std::min(kSettling, milliseconds(options_.timeoutMs / 5));
+  std::lock_guard<std::mutex> lock(budgetMu_);
+  if (callDepth_ > 0) allowed_ = std::max(allowed_, spent_ + Clock::duration(extra));
+}
+
+Clock::time_point EtcdClient::Deadline() {
+  const Clock::duration timeout = milliseconds(options_.timeoutMs);
+  std::lock_guard<std::mutex> lock(budgetMu_);
+  if (callDepth_ == 0) return Clock::now() + timeout;
+  return Clock::now() + std::min(timeout, std::max(allowed_ - spent_, Clock::duration::zero()));
+}
+
+void EtcdClient::Charge(Clock::time_point start, Clock::time_point end) {
+  std::lock_guard<std::mutex> lock(budgetMu_);
+  if (callDepth_ == 0 || end <= chargedUntil_) return;
+  spent_ += end - std::max(start, chargedUntil_);
+  chargedUntil_ = end;
 }
 
 grpc::Status EtcdClient::Token(EtcdMember& member, Clock::time_point deadline, std::string* token) {
@@ -99,11 +149,16 @@ grpc::Status EtcdClient::Token(EtcdMember& member, Clock::time_point deadline, s
     etcdserverpb::AuthenticateRequest request;
     request.set_name(options_.user);
     request.set_password(options_.password);
-    etcdserverpb::AuthenticateResponse response;
     grpc::ClientContext context;
     context.set_deadline(SystemTime(deadline));
     context.set_wait_for_ready(false);
-    grpc::Status status = member.auth->Authenticate(&context, request, &response);
+    grpc::Slice reply;
+    grpc::Status status = CallByName(member, &context, "/etcdserverpb.Auth/Authenticate",
+                                     Serialized(request), &reply);
+    etcdserverpb::AuthenticateResponse response;
+    if (status.ok() && !response.ParseFromArray(reply.begin(), static_cast<int>(reply.size()))) {
+      status = grpc::Status(grpc::StatusCode::INTERNAL, "unreadable reply");
+    }
     if (status.ok()) {
       token_ = response.token();
     } else if (!Contains(status.error_message(), "authentication is not enabled")) {
@@ -119,12 +174,6 @@ grpc::Status EtcdClient::Token(EtcdMember& member, Clock::time_point deadline, s
   }
   *token = token_;
   return grpc::Status::OK;
-}
-
-void EtcdClient::ForgetToken() {
-  std::lock_guard<std::mutex> lock(tokenMu_);
-  authenticated_ = false;
-  token_.clear();
 }
 
 TlsFinding EtcdClient::Diagnose(std::size_t i, const std::string& lastError,
@@ -190,24 +239,16 @@ EtcdClient::Outcome EtcdClient::Classify(std::size_t i, const grpc::Status& stat
 }
 
 template <typename Send>
-grpc::Status EtcdClient::Invoke(const char* what, bool retry, const Send& send,
-                                std::size_t* answeredBy, bool counted) {
+grpc::Status EtcdClient::Invoke(const char* what, const Send& send, std::size_t* answeredBy,
+                                bool counted) {
   const Clock::time_point deadline =
-      counted ? budget_.Deadline(Clock::now()) : Clock::now() + milliseconds(options_.timeoutMs);
+      counted ? Deadline() : Clock::now() + milliseconds(options_.timeoutMs);
   const Clock::duration first =
       std::min<Clock::duration>(kFirstAttempt, milliseconds(std::max(1, options_.timeoutMs / 2)));
   // What each member did with the request, last time it was tried.
   std::vector<std::string> story(members_.Size());
   std::int32_t tlsCode = 0;
   bool reauthenticated = false;
-  auto told = [&] {
-    std::string text;
-    for (std::size_t i = 0; i < story.size(); ++i) {
-      if (story[i].empty()) continue;
-      text += (text.empty() ? "" : "; ") + members_[i].endpoint + ": " + story[i];
-    }
-    return text;
-  };
   for (int round = 0;; ++round) {
     bool reached = false;  // a member took the request, or may take it soon
     bool stalled = false;
@@ -215,10 +256,8 @@ grpc::Status EtcdClient::Invoke(const char* what, bool retry, const Send& send,
       const Clock::time_point start = Clock::now();
       if (start >= deadline) break;
       const Clock::time_point attemptEnd =
-          !retry || members_.Size() == 1
-              ? deadline
-              : std::min(deadline, start + first * (1 << std::min(round, 4)));
-      EtcdMember& member = members_[i];
+          members_.Size() == 1 ? deadline
+                               : std::min(deadline, start + first * (1 << std::min(round, 4)));
       grpc::Status status;
       while (true) {
         grpc::ClientContext context;
@@ -227,18 +266,18 @@ grpc::Status EtcdClient::Invoke(const char* what, bool retry, const Send& send,
         // is tried rather than this one waited for.
         context.set_wait_for_ready(false);
         std::string token;
-        status = Token(member, attemptEnd, &token);
+        status = Token(members_[i], attemptEnd, &token);
         if (status.ok()) {
           if (!token.empty()) context.AddMetadata("token", token);
-          status = send(member, &context);
+          status = send(members_[i], &context);
         }
         // Tokens expire when unused for a while (five minutes by default).
         if (status.error_code() != grpc::StatusCode::UNAUTHENTICATED || options_.user.empty() ||
-            reauthenticated) {
+            std::exchange(reauthenticated, true)) {
           break;
         }
-        reauthenticated = true;
-        ForgetToken();
+        std::lock_guard<std::mutex> lock(tokenMu_);
+        authenticated_ = false;
       }
       TlsFinding why;
       const Outcome outcome = Classify(i, status, attemptEnd, &why);
@@ -247,7 +286,7 @@ grpc::Status EtcdClient::Invoke(const char* what, bool retry, const Send& send,
         if (answeredBy) *answeredBy = i;
         return status;
       }
-      if (counted) budget_.Charge(start, Clock::now());
+      if (counted) Charge(start, Clock::now());
       story[i] = why.text;
       if (outcome == Outcome::kUnreachable) {
         if (tlsCode == 0) tlsCode = why.code;
@@ -257,90 +296,84 @@ grpc::Status EtcdClient::Invoke(const char* what, bool retry, const Send& send,
       if (outcome == Outcome::kNoAnswer) {
         members_.Stalled(i);
         stalled = true;
-      } else if (!retry) {
-        return status;  // it may have been applied: not sent again
       }
+    }
+    std::string told;
+    for (std::size_t i = 0; i < story.size(); ++i) {
+      if (!story[i].empty())
+        told += (told.empty() ? "" : "; ") + members_[i].endpoint + ": " + story[i];
     }
     const Clock::time_point now = Clock::now();
     if (now >= deadline) {
-      const std::string text = told();
       throw ConfigStoreException(
           where_ + ": " + what + ": no answer within " + std::to_string(options_.timeoutMs) +
               " ms" +
-              (text.empty() ? " (this call has waited that long for members already)"
-                            : " (" + text + ")"),
-          kErrorEtcdBase + static_cast<int>(grpc::StatusCode::DEADLINE_EXCEEDED));
+              (told.empty() ? " (this call has waited that long for members already)"
+                            : " (" + told + ")"),
+          EtcdCode(grpc::StatusCode::DEADLINE_EXCEEDED));
     }
     if (!reached) {
       throw ConfigStoreException(
-          where_ + ": " + what + ": could not connect to any member: " + told(),
-          tlsCode != 0 ? tlsCode
-                       : kErrorEtcdBase + static_cast<int>(grpc::StatusCode::UNAVAILABLE));
+          where_ + ": " + what + ": could not connect to any member: " + told,
+          tlsCode != 0 ? tlsCode : EtcdCode(grpc::StatusCode::UNAVAILABLE));
     }
     if (!stalled) {
       std::this_thread::sleep_until(std::min(deadline, now + kBetweenRounds));
-      if (counted) budget_.Charge(now, Clock::now());
+      if (counted) Charge(now, Clock::now());
     }
   }
 }
 
-etcdserverpb::TxnResponse EtcdClient::Txn(const etcdserverpb::TxnRequest& request, bool retry) {
-  etcdserverpb::TxnResponse response;
-  const grpc::Status status =
-      Invoke("write", retry, [&](EtcdMember& member, grpc::ClientContext* context) {
-        return member.kv->Txn(context, request, &response);
-      });
-  if (!status.ok()) Fail(status, "write");  // reads go through Read
-  return response;
+grpc::Slice EtcdClient::Unary(const char* what, const char* method,
+                              const grpc::protobuf::MessageLite& request) {
+  const grpc::ByteBuffer sent = Serialized(request);
+  grpc::Slice reply;
+  const grpc::Status status = Invoke(what, [&](EtcdMember& member, grpc::ClientContext* context) {
+    return CallByName(member, context, method, sent, &reply);
+  });
+  if (!status.ok()) Fail(status, what);
+  return reply;
 }
 
-template <typename Request>
-void EtcdClient::Receive(grpc::internal::RpcMethod EtcdMember::*method, const Request& request,
-                         etcdwire::Reply* reply) {
-  grpc::ByteBuffer received;
-  const grpc::Status status =
-      Invoke("read", true, [&](EtcdMember& member, grpc::ClientContext* context) {
-        return grpc::internal::BlockingUnaryCall<Request, grpc::ByteBuffer,
-                                                 grpc::protobuf::MessageLite, grpc::ByteBuffer>(
-            member.channel.get(), member.*method, context, request, &received);
-      });
-  if (!status.ok()) Fail(status, "read");
-  // A large reply arrives in several slices; the views need one.
-  if (!received.TrySingleSlice(&reply->bytes).ok() &&
-      !received.DumpToSingleSlice(&reply->bytes).ok()) {
-    Fail(grpc::Status(grpc::StatusCode::INTERNAL, "empty reply"), "read");
-  }
-}
-
-void EtcdClient::Read(const etcdserverpb::RangeRequest& request, etcdwire::Reply* reply) {
-  Receive(&EtcdMember::range, request, reply);
+void EtcdClient::Range(const etcdserverpb::RangeRequest& request, etcdwire::Reply* reply) {
+  reply->bytes = Unary("read", "/etcdserverpb.KV/Range", request);
   if (!etcdwire::ParseRangeResponse(reply)) {
     Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unreadable reply"), "read");
   }
 }
 
-void EtcdClient::Read(const etcdserverpb::TxnRequest& request, etcdwire::Reply* reply) {
-  Receive(&EtcdMember::txn, request, reply);
-  if (!etcdwire::ParseTxnResponse(reply)) {
-    Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unreadable reply"), "read");
+void EtcdClient::Txn(const etcdserverpb::TxnRequest& request, etcdwire::Reply* reply) {
+  const bool writes = std::any_of(request.success().begin(), request.success().end(),
+                                  [](const auto& op) { return !op.has_request_range(); });
+  const char* what = writes ? "write" : "read";
+  reply->bytes = Unary(what, "/etcdserverpb.KV/Txn", request);
+  if (!etcdwire::ParseTxnResponse(reply) ||
+      reply->ranges.size() != static_cast<std::size_t>(reply->succeeded ? request.success_size()
+                                                                        : request.failure_size())) {
+    Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unreadable reply"), what);
   }
+}
+
+bool EtcdClient::Txn(const etcdserverpb::TxnRequest& request) {
+  etcdwire::Reply reply;
+  Txn(request, &reply);
+  return reply.succeeded;
 }
 
 std::int64_t EtcdClient::LeaseGrant(std::int64_t ttlSeconds) {
   etcdserverpb::LeaseGrantRequest request;
   request.set_ttl(ttlSeconds);
+  const grpc::Slice reply = Unary("lease grant", "/etcdserverpb.Lease/LeaseGrant", request);
   etcdserverpb::LeaseGrantResponse response;
-  const grpc::Status status =
-      Invoke("lease grant", true, [&](EtcdMember& member, grpc::ClientContext* context) {
-        return member.lease->LeaseGrant(context, request, &response);
-      });
-  if (!status.ok()) Fail(status, "lease grant");
+  if (!response.ParseFromArray(reply.begin(), static_cast<int>(reply.size()))) {
+    Fail(grpc::Status(grpc::StatusCode::INTERNAL, "unreadable reply"), "lease grant");
+  }
   return response.id();
 }
 
 void EtcdClient::LeaseKeepAlive(std::int64_t lease) {
   const grpc::Status status =
-      Invoke("lease keep-alive", true, [&](EtcdMember& member, grpc::ClientContext* context) {
+      Invoke("lease keep-alive", [&](EtcdMember& member, grpc::ClientContext* context) {
         auto stream = member.lease->LeaseKeepAlive(context);
         etcdserverpb::LeaseKeepAliveRequest request;
         request.set_id(lease);
@@ -359,39 +392,37 @@ void EtcdClient::LeaseKeepAlive(std::int64_t lease) {
 void EtcdClient::LeaseRevoke(std::int64_t lease) {
   etcdserverpb::LeaseRevokeRequest request;
   request.set_id(lease);
-  etcdserverpb::LeaseRevokeResponse response;
-  const grpc::Status status =
-      Invoke("lease revoke", true, [&](EtcdMember& member, grpc::ClientContext* context) {
-        return member.lease->LeaseRevoke(context, request, &response);
-      });
-  // A lease that is gone already (run out, or revoked by an earlier attempt
-  // whose answer was lost) is what was asked for.
-  if (!status.ok() && status.error_code() != grpc::StatusCode::NOT_FOUND) {
-    Fail(status, "lease revoke");
+  try {
+    Unary("lease revoke", "/etcdserverpb.Lease/LeaseRevoke", request);
+  } catch (const ConfigStoreException& e) {
+    // A lease that is gone already (run out, or revoked by an earlier attempt
+    // whose answer was lost) is what was asked for.
+    if (e.Code() != EtcdCode(grpc::StatusCode::NOT_FOUND)) throw;
   }
 }
 
-etcdserverpb::Watch::Stub& EtcdClient::WatchStub(const std::string& key,
-                                                 grpc::ClientContext* context,
-                                                 std::size_t* member) {
+std::unique_ptr<EtcdClient::WatchStream> EtcdClient::Watch(const std::string& key,
+                                                           grpc::ClientContext* context,
+                                                           std::size_t* member) {
   etcdserverpb::RangeRequest request;
   request.set_key(key);
   request.set_limit(1);
   request.set_keys_only(true);
   // Any answer will do, a refusal too: the watch then reports it.
+  const grpc::ByteBuffer sent = Serialized(request);
   Invoke(
-      "watch", true,
+      "watch",
       [&](EtcdMember& m, grpc::ClientContext* c) {
-        grpc::ByteBuffer received;
-        return grpc::internal::BlockingUnaryCall<etcdserverpb::RangeRequest, grpc::ByteBuffer,
-                                                 grpc::protobuf::MessageLite, grpc::ByteBuffer>(
-            m.channel.get(), m.range, c, request, &received);
+        grpc::Slice ignored;
+        return CallByName(m, c, "/etcdserverpb.KV/Range", sent, &ignored);
       },
       member, false);
   context->set_wait_for_ready(false);
-  std::lock_guard<std::mutex> lock(tokenMu_);
-  if (!token_.empty()) context->AddMetadata("token", token_);
-  return *members_[*member].watch;
+  {
+    std::lock_guard<std::mutex> lock(tokenMu_);
+    if (!token_.empty()) context->AddMetadata("token", token_);
+  }
+  return members_[*member].watch->Watch(context);
 }
 
 }  // namespace TavoConfigStore

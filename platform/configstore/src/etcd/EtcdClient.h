@@ -9,6 +9,14 @@
 // is electing a leader) makes way for the next, in rounds that give each
 // member longer, until the request's one deadline. When every member
 // refuses, the request fails at once and says why for each.
+//
+// That is the one retry policy, and it holds for every call: each request
+// the store sends is safe to send twice. Reads are; puts write the same
+// bytes again; deletes delete nothing more; every transaction that writes
+// is guarded by compares a second copy would fail (a commit then reads its
+// pointer back to learn whether its first copy took effect); a lease
+// granted twice leaves one unused that runs out; revoking or renewing a
+// lease twice does what once did.
 
 #ifndef TAVOCONFIGSTORE_SRC_ETCD_ETCD_CLIENT_H_
 #define TAVOCONFIGSTORE_SRC_ETCD_ETCD_CLIENT_H_
@@ -18,6 +26,7 @@
 #include <chrono>
 #include <cstdint>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <string>
 #include <utility>
@@ -25,88 +34,97 @@
 #include "EtcdMembers.h"
 #include "EtcdTlsFiles.h"
 #include "EtcdTlsProbe.h"
-#include "EtcdWaitBudget.h"
 #include "EtcdWire.h"
 #include "TavoConfigStore/EtcdStore.h"
 #include "etcd/etcdserver/etcdserverpb/rpc.grpc.pb.h"
 
 namespace TavoConfigStore {
 
+// The code of a failure etcd or gRPC reported with "status".
+constexpr std::int32_t EtcdCode(grpc::StatusCode status) {
+  return kErrorEtcdBase + static_cast<std::int32_t>(status);
+}
+
 class EtcdClient {
  public:
+  using WatchStream =
+      grpc::ClientReaderWriter<etcdserverpb::WatchRequest, etcdserverpb::WatchResponse>;
+
   // Checks the TLS files before anything connects (EtcdTlsFiles.h).
   explicit EtcdClient(const EtcdStoreOptions& options);
 
   // "etcd HOST:PORT[,...]", for messages.
   const std::string& Where() const { return where_; }
 
-  // "retry": the request may be sent twice (puts of the same bytes, or a
-  // transaction guarded by compares that a second attempt would fail), so a
-  // member that does not answer in time makes way for the next. Otherwise
-  // only a member that could not be connected to is passed over.
-  etcdserverpb::TxnResponse Txn(const etcdserverpb::TxnRequest& request, bool retry);
-  // Reads, with the reply kept as received (EtcdWire.h); a transaction sent
-  // this way must only read.
-  void Read(const etcdserverpb::RangeRequest& request, etcdwire::Reply* reply);
-  void Read(const etcdserverpb::TxnRequest& request, etcdwire::Reply* reply);
+  // The reply is kept as received and read in place (EtcdWire.h); it holds
+  // one range for each operation of the branch a transaction took.
+  void Range(const etcdserverpb::RangeRequest& request, etcdwire::Reply* reply);
+  void Txn(const etcdserverpb::TxnRequest& request, etcdwire::Reply* reply);
+  // Whether the transaction's compares held.
+  bool Txn(const etcdserverpb::TxnRequest& request);
 
   std::int64_t LeaseGrant(std::int64_t ttlSeconds);
+  // Throws with kErrorEtcdBase + NOT_FOUND when the lease is gone.
   void LeaseKeepAlive(std::int64_t lease);
   // Throws unless etcd confirms the lease is gone.
   void LeaseRevoke(std::int64_t lease);
 
-  // One call of the store, for as long as the object lives: the time its
-  // requests wait for members that do not answer counts once against the
-  // timeout (EtcdWaitBudget.h).
+  // One call of the store (or one transaction), for as long as the object
+  // lives: the time its requests wait for members that do not answer counts
+  // once against the timeout, so a member found hung by one request cannot
+  // cost every later request the same wait; answers do not count. Calls
+  // nest; the outermost one counts. Outside a call each request has the
+  // whole timeout.
   class Call {
    public:
-    explicit Call(EtcdClient& client) : budget_(client.budget_) { budget_.Open(); }
-    ~Call() { budget_.Close(); }
+    explicit Call(EtcdClient& client);
+    ~Call();
     Call(const Call&) = delete;
     Call& operator=(const Call&) = delete;
 
    private:
-    EtcdWaitBudget& budget_;
+    EtcdClient& client_;
   };
   // Lets the open call wait up to a second more (a fifth of the timeout when
   // that is less), to learn the outcome of a write whose request failed.
   void AllowSettling();
 
-  // For a stream of one's own (a watch, which has no deadline): the member
-  // to hold it on, one that has just answered a read of "key", and
-  // "context" readied with the auth token. Throws when no member answers
-  // within the timeout.
-  etcdserverpb::Watch::Stub& WatchStub(const std::string& key, grpc::ClientContext* context,
-                                       std::size_t* member);
+  // A watch stream (which has no deadline) on a member that has just
+  // answered a read of "key", with the auth token; "*member" is that member.
+  // Throws when no member answers within the timeout.
+  std::unique_ptr<WatchStream> Watch(const std::string& key, grpc::ClientContext* context,
+                                     std::size_t* member);
   // The stream held on "member" broke: the next goes to another member.
   void StreamLost(std::size_t member) { members_.Stalled(member); }
-
-  // Throws the store's exception for a failed call.
-  [[noreturn]] void Fail(const grpc::Status& status, const char* what) const;
 
  private:
   using Clock = std::chrono::steady_clock;
   enum class Outcome { kAnswer, kUnreachable, kNoAnswer, kBusy };
 
+  // Sends a unary request by name and returns its reply's bytes.
+  grpc::Slice Unary(const char* what, const char* method,
+                    const grpc::protobuf::MessageLite& request);
   // Sends a request, member after member, until one answers or its time is
   // up. "counted": the request belongs to the open call (a watch's does not).
   template <typename Send>
-  grpc::Status Invoke(const char* what, bool retry, const Send& send,
-                      std::size_t* answeredBy = nullptr, bool counted = true);
+  grpc::Status Invoke(const char* what, const Send& send, std::size_t* answeredBy = nullptr,
+                      bool counted = true);
   grpc::Status Token(EtcdMember& member, Clock::time_point deadline, std::string* token);
-  void ForgetToken();
   Outcome Classify(std::size_t member, const grpc::Status& status, Clock::time_point deadline,
                    TlsFinding* why);
   TlsFinding Diagnose(std::size_t member, const std::string& lastError, Clock::time_point deadline);
-  template <typename Request>
-  void Receive(grpc::internal::RpcMethod EtcdMember::*method, const Request& request,
-               etcdwire::Reply* reply);
+  [[noreturn]] void Fail(const grpc::Status& status, const char* what) const;
+
+  // The deadline of a request that starts now, and the time an attempt of
+  // the open call spent without an answer; attempts that overlap in time
+  // count once.
+  Clock::time_point Deadline();
+  void Charge(Clock::time_point start, Clock::time_point end);
 
   EtcdStoreOptions options_;
   std::string where_;
   TlsMaterial material_;
   EtcdMembers members_;
-  EtcdWaitBudget budget_;
   std::mutex tokenMu_;
   std::string token_;
   bool authenticated_ = false;
@@ -114,10 +132,13 @@ class EtcdClient {
   // error, by member and gRPC's text: asked once, not at every request.
   std::mutex findingsMu_;
   std::map<std::pair<std::size_t, std::string>, TlsFinding> findings_;
+  // The open call's wait (Call).
+  std::mutex budgetMu_;
+  int callDepth_ = 0;
+  Clock::duration allowed_{};
+  Clock::duration spent_{};
+  Clock::time_point chargedUntil_{};
 };
-
-// The first key after every key that starts with "prefix" (etcd's range end).
-std::string PrefixEnd(std::string prefix);
 
 }  // namespace TavoConfigStore
 

@@ -2,30 +2,10 @@
 
 #include <cstdio>
 
+#include "../object/Coding.h"
+
 namespace TavoConfigStore {
 namespace etcdlayout {
-namespace {
-
-void AppendVarint(std::uint64_t v, std::string* out) {
-  while (v >= 0x80) {
-    out->push_back(static_cast<char>((v & 0x7f) | 0x80));
-    v >>= 7;
-  }
-  out->push_back(static_cast<char>(v));
-}
-
-bool ReadVarint(std::string_view* in, std::uint64_t* v) {
-  *v = 0;
-  for (int shift = 0; shift < 64 && !in->empty(); shift += 7) {
-    const auto byte = static_cast<unsigned char>(in->front());
-    in->remove_prefix(1);
-    *v |= static_cast<std::uint64_t>(byte & 0x7f) << shift;
-    if ((byte & 0x80) == 0) return true;
-  }
-  return false;
-}
-
-}  // namespace
 
 std::string Escape(std::string_view part) {
   std::string out;
@@ -42,6 +22,11 @@ std::string Escape(std::string_view part) {
 }
 
 bool Unescape(std::string_view text, std::string* out) {
+  // Most parts have nothing escaped: a listing unescapes every key.
+  if (text.find_first_of(std::string_view("\0\1", 2)) == std::string_view::npos) {
+    out->assign(text);
+    return true;
+  }
   out->clear();
   for (std::size_t i = 0; i < text.size(); ++i) {
     if (text[i] == '\0') return false;
@@ -75,12 +60,29 @@ bool ParseCollection(std::string_view name, ConfigStoreObjectId* id) {
   return true;
 }
 
-void AppendHeader(const Header& header, std::string* out) {
-  out->push_back(1);
-  AppendVarint(static_cast<std::uint64_t>(header.kind), out);
-  AppendVarint(static_cast<std::uint64_t>(header.revision), out);
-  AppendVarint(header.index, out);
-  AppendVarint(header.parts, out);
+std::string PointerValue(const std::string& gen, const std::string& token) {
+  return gen + '\0' + token;
+}
+
+std::pair<std::string, std::string> ParsePointer(std::string_view value) {
+  const std::size_t zero = value.find('\0');
+  if (zero == std::string_view::npos) return {std::string(value), std::string()};
+  return {std::string(value.substr(0, zero)), std::string(value.substr(zero + 1))};
+}
+
+bool IsGenerationId(std::string_view text) {
+  return text.size() == 16 && text.find_first_not_of("0123456789abcdef") == std::string_view::npos;
+}
+
+std::string FirstPart(const Header& header, std::string_view body) {
+  std::string value(1, '\1');
+  value.reserve(body.size() + 4 * coding::kMaxVarintLength + 1);
+  coding::PutVarint(&value, static_cast<std::uint64_t>(header.kind));
+  coding::PutVarint(&value, static_cast<std::uint64_t>(header.revision));
+  coding::PutVarint(&value, header.index);
+  coding::PutVarint(&value, header.parts);
+  value.append(body);
+  return value;
 }
 
 bool ReadHeader(std::string_view* value, Header* header) {
@@ -88,8 +90,8 @@ bool ReadHeader(std::string_view* value, Header* header) {
   value->remove_prefix(1);
   std::uint64_t kind = 0;
   std::uint64_t revision = 0;
-  if (!ReadVarint(value, &kind) || kind > 2 || !ReadVarint(value, &revision) ||
-      !ReadVarint(value, &header->index) || !ReadVarint(value, &header->parts) ||
+  if (!coding::GetVarint(value, &kind) || kind > 2 || !coding::GetVarint(value, &revision) ||
+      !coding::GetVarint(value, &header->index) || !coding::GetVarint(value, &header->parts) ||
       header->parts == 0 || revision > static_cast<std::uint64_t>(INT64_MAX)) {
     return false;
   }
@@ -98,14 +100,35 @@ bool ReadHeader(std::string_view* value, Header* header) {
   return true;
 }
 
-bool IsGenerationId(std::string_view text) {
-  return text.size() == 16 && text.find_first_not_of("0123456789abcdef") == std::string_view::npos;
+bool ParseObjectKey(std::string_view rest, std::string_view* stem, std::size_t* part) {
+  const std::size_t zero = rest.find('\0');
+  if (zero == std::string_view::npos) return false;
+  *stem = rest.substr(0, zero + 1);
+  const std::string_view digits = rest.substr(zero + 1);
+  *part = digits.size() == 4 ? 0 : kNoPart;
+  for (std::size_t i = 0; i < digits.size() && *part != kNoPart; ++i) {
+    const char c = digits[i];
+    const int digit = c >= '0' && c <= '9' ? c - '0' : c >= 'a' && c <= 'f' ? c - 'a' + 10 : -1;
+    *part = digit < 0 ? kNoPart : *part * 16 + static_cast<std::size_t>(digit);
+  }
+  return true;
 }
 
 std::string Keys::PartSuffix(std::size_t part) {
   char text[17];
   std::snprintf(text, sizeof text, "%04zx", part);
   return text;
+}
+
+std::string PrefixEnd(std::string prefix) {
+  while (!prefix.empty()) {
+    if (static_cast<unsigned char>(prefix.back()) != 0xff) {
+      prefix.back() = static_cast<char>(static_cast<unsigned char>(prefix.back()) + 1);
+      return prefix;
+    }
+    prefix.pop_back();
+  }
+  return std::string(1, '\0');  // every key
 }
 
 }  // namespace etcdlayout

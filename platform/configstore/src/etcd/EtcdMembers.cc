@@ -52,12 +52,9 @@ EtcdMember::EtcdMember(const std::string& endpoint, const EtcdStoreOptions& opti
                        const TlsMaterial& material)
     : endpoint(endpoint),
       channel(ChannelTo(endpoint, options, material)),
-      range("/etcdserverpb.KV/Range", grpc::internal::RpcMethod::NORMAL_RPC, channel),
-      txn("/etcdserverpb.KV/Txn", grpc::internal::RpcMethod::NORMAL_RPC, channel),
-      kv(etcdserverpb::KV::NewStub(channel)),
+      calls(channel),
       lease(etcdserverpb::Lease::NewStub(channel)),
-      watch(etcdserverpb::Watch::NewStub(channel)),
-      auth(etcdserverpb::Auth::NewStub(channel)) {}
+      watch(etcdserverpb::Watch::NewStub(channel)) {}
 
 EtcdMembers::EtcdMembers(const EtcdStoreOptions& options, const TlsMaterial& material)
     : stalled_(options.endpoints.size(), false) {

@@ -5,8 +5,8 @@
 #ifndef TAVOCONFIGSTORE_SRC_ETCD_ETCD_MEMBERS_H_
 #define TAVOCONFIGSTORE_SRC_ETCD_ETCD_MEMBERS_H_
 
+#include <grpcpp/generic/generic_stub.h>
 #include <grpcpp/grpcpp.h>
-#include <grpcpp/impl/rpc_method.h>
 
 #include <cstddef>
 #include <memory>
@@ -26,12 +26,11 @@ struct EtcdMember {
 
   std::string endpoint;  // HOST:PORT
   std::shared_ptr<grpc::Channel> channel;
-  grpc::internal::RpcMethod range;
-  grpc::internal::RpcMethod txn;
-  std::unique_ptr<etcdserverpb::KV::Stub> kv;
+  // Unary calls by name, their replies kept as received; the generated
+  // stubs for the streams.
+  grpc::GenericStub calls;
   std::unique_ptr<etcdserverpb::Lease::Stub> lease;
   std::unique_ptr<etcdserverpb::Watch::Stub> watch;
-  std::unique_ptr<etcdserverpb::Auth::Stub> auth;
 };
 
 class EtcdMembers {

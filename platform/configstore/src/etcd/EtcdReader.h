@@ -1,0 +1,137 @@
+// Reading a store's collections: their pointers, and the objects of the
+// generations they point at, at one revision, so that one read is one
+// snapshot even when a commit switches generations in between.
+//
+// A read of one collection asks for its pointer and for the generation it
+// named last time in one request, and needs a second only when a commit has
+// moved the pointer since. A whole generation listed before is asked for in
+// two halves at once, split at an object's key remembered from then: etcd
+// reads and sends the two side by side. Replies are read where they arrived
+// (EtcdWire.h): an object's body is a view into its reply.
+//
+// Until the store's first write, the catalogue may still lie where an
+// earlier version wrote it (EtcdLayout.h); readers read it there.
+
+#ifndef TAVOCONFIGSTORE_SRC_ETCD_ETCD_READER_H_
+#define TAVOCONFIGSTORE_SRC_ETCD_ETCD_READER_H_
+
+#include <cstdint>
+#include <map>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "EtcdClient.h"
+#include "EtcdLayout.h"
+#include "EtcdWire.h"
+
+namespace TavoConfigStore {
+
+// A collection as the cluster has it at one revision.
+struct Current {
+  std::string gen;
+  std::int64_t version = 0;  // the pointer's mod revision; 0: no such collection
+  std::string token;         // of the commit that wrote the pointer
+};
+
+struct Pointers {
+  std::int64_t revision = 0;
+  std::map<std::string, Current> byCollection;
+  // The layout they were read in: the store's own, or that of an earlier
+  // version whose catalogue the store's first write has not moved yet.
+  const etcdlayout::Keys* keys = nullptr;
+  // When asked for: generations under the store's own root whose writer
+  // died before making them current (registered, no live writer, no
+  // pointer). Nothing can make such a generation current any more.
+  std::vector<std::string> orphans;
+
+  const Current* Find(const std::string& collection) const {
+    auto it = byCollection.find(collection);
+    return it == byCollection.end() ? nullptr : &it->second;
+  }
+};
+
+// An object's place in write order.
+struct Order {
+  std::int64_t revision = 0;
+  std::uint64_t index = 0;
+  bool operator<(const Order& other) const {
+    return revision != other.revision ? revision < other.revision : index < other.index;
+  }
+};
+
+// One stored object of a generation, its bytes still in the reply.
+struct Entry {
+  std::string instance;
+  Order order;
+  std::string_view body;
+  std::string joined;  // a body stored in several parts, put together
+  std::string damage;  // why the object cannot be read, if it cannot
+};
+
+// The replies a read of one collection keeps; entries point into them.
+struct Replies {
+  etcdwire::Reply first;
+  etcdwire::Reply second;  // the second half of a split listing
+};
+
+class EtcdReader {
+ public:
+  EtcdReader(EtcdClient& client, std::string_view prefix);
+
+  // The layout of the store's own root.
+  const etcdlayout::Keys& OwnKeys() const { return keys_; }
+
+  // The pointer of "collection", or of every collection when it is "", as
+  // readers see them; with "orphans", also the generations a dead writer
+  // left under the store's own root.
+  Pointers ReadPointers(const std::string& collection, bool orphans = false);
+  // The pointer of one collection and, when it has one, the objects of its
+  // generation (or its one object "instance"), at one revision.
+  Pointers ReadCollection(const std::string& collection, const std::string* instance,
+                          Replies* replies, std::vector<Entry>* entries);
+  // The objects of a generation (or its one object "instance") at
+  // "revision", in the order the cluster keeps the keys. Their bytes stay
+  // in "*reply".
+  void ReadGeneration(const etcdlayout::Keys& keys, const std::string& gen,
+                      const std::string* instance, std::int64_t revision, etcdwire::Reply* reply,
+                      std::vector<Entry>* entries);
+  // A commit has moved the catalogue under the store's own root.
+  void Moved() { layout_ = Layout::kCurrent; }
+
+  // Runs "read" again when etcd compacted away the revision it was reading
+  // at between its requests, up to three times in all.
+  template <typename Read>
+  static auto Snapshot(const Read& read) -> decltype(read()) {
+    for (int attempt = 1;; ++attempt) {
+      try {
+        return read();
+      } catch (const ConfigStoreException& e) {
+        if (e.Code() != EtcdCode(grpc::StatusCode::OUT_OF_RANGE) || attempt == 3) throw;
+      }
+    }
+  }
+
+ private:
+  // Where to ask for a generation read before: its id, and the key at which
+  // a listing of it is split in two (empty: not split).
+  struct LastRead {
+    std::string gen;
+    std::string split;
+  };
+  void Remember(const std::string& collection, const std::string& gen,
+                const std::vector<Entry>* listed);
+
+  EtcdClient& client_;
+  const etcdlayout::Keys keys_;
+  const etcdlayout::Keys legacyKeys_;
+  // Whether the old root may still hold this store's catalogue: asked once
+  // a store while it does not; while it does, at every read, as any write
+  // moves it.
+  enum class Layout { kUnknown, kLegacy, kCurrent } layout_ = Layout::kUnknown;
+  std::map<std::string, LastRead> lastRead_;
+};
+
+}  // namespace TavoConfigStore
+
+#endif  // TAVOCONFIGSTORE_SRC_ETCD_ETCD_READER_H_
