@@ -1,4 +1,5 @@
-// Telling a store locator's kind, and showing one without its password.
+// The registry of backends: which backend a store locator names, and how to
+// open it. The table below is the one place that knows the backends.
 
 #include <cctype>
 #include <string>
@@ -44,20 +45,42 @@ bool StartsLikeEtcd(std::string_view text) {
   return false;
 }
 
+// Taken as a path, a mistyped etcd locator would become a store file under a
+// folder named after the cluster, its password included, and the catalogue
+// would never reach the cluster: whatever looks like a URL is no path.
+bool IsPath(const std::string& locator) {
+  return !StartsWithScheme(locator) && !StartsLikeEtcd(locator);
+}
+
+struct LocatorEntry {
+  LocatorKind kind;
+  bool (*names)(const std::string& locator);
+  std::shared_ptr<ConfigStore> (*open)(const std::string& locator);
+};
+
+const LocatorEntry kLocators[] = {
+    {LocatorKind::kEtcd, IsEtcdLocator,
+     [](const std::string& locator) { return NewEtcdStore(ParseEtcdLocator(locator)); }},
+    {LocatorKind::kPath, IsPath,
+     [](const std::string& locator) { return NewSqliteStore(locator); }},
+};
+
+const LocatorEntry& EntryOf(const std::string& locator) {
+  for (const LocatorEntry& entry : kLocators) {
+    if (entry.names(locator)) return entry;
+  }
+  throw ConfigStoreException("store locator \"" + RedactLocator(locator) +
+                                 "\" looks like a URL but is no etcd:// or etcds:// locator; "
+                                 "put ./ in front to make it a file path",
+                             kErrorBadLocator);
+}
+
 }  // namespace
 
-LocatorKind KindOfLocator(const std::string& locator) {
-  if (IsEtcdLocator(locator)) return LocatorKind::kEtcd;
-  // Taken as a path, a mistyped etcd locator would become a store file
-  // under a folder named after the cluster, its password included, and the
-  // catalogue would never reach the cluster.
-  if (StartsWithScheme(locator) || StartsLikeEtcd(locator)) {
-    throw ConfigStoreException("store locator \"" + RedactLocator(locator) +
-                                   "\" looks like a URL but is no etcd:// or etcds:// locator; "
-                                   "put ./ in front to make it a file path",
-                               kErrorBadLocator);
-  }
-  return LocatorKind::kPath;
+LocatorKind KindOfLocator(const std::string& locator) { return EntryOf(locator).kind; }
+
+std::shared_ptr<ConfigStore> OpenStore(const std::string& locator) {
+  return EntryOf(locator).open(locator);
 }
 
 // The password runs from the colon after the user name to the last '@': a

@@ -25,12 +25,12 @@
 #ifndef TAVOCONFIGSTORE_SRC_SQLITE_SCHEMA_H_
 #define TAVOCONFIGSTORE_SRC_SQLITE_SCHEMA_H_
 
-#include <sqlite3.h>
-
 #include <string>
 
+#include "Connection.h"
+
 namespace TavoConfigStore {
-namespace schema {
+namespace sqlite {
 
 constexpr int kApplicationId = 0x5441564f;  // "TAVO"
 constexpr int kFormat = 2;
@@ -39,18 +39,18 @@ enum class Found { kEmpty, kFormat1, kCurrent };
 
 // What the file holds; throws ConfigStoreException (kErrorNotAStore, or the
 // SQLite error) for anything not a store of a known format. Call inside a
-// transaction, so that the reads agree. "where" starts every message.
-Found Inspect(sqlite3* db, const std::string& where);
+// transaction, so that the reads agree.
+Found Inspect(Connection& conn);
 
 // Call inside a write transaction.
-void Create(sqlite3* db, const std::string& where);
-void UpgradeFormat1(sqlite3* db, const std::string& where);
+void CreateSchema(Connection& conn);
+void UpgradeFormat1(Connection& conn);
 
 // The table of a collection, and the statement that creates it.
 std::string TableOf(sqlite3_int64 collection);
 std::string CreateTableSql(sqlite3_int64 collection);
 
-}  // namespace schema
+}  // namespace sqlite
 }  // namespace TavoConfigStore
 
 #endif  // TAVOCONFIGSTORE_SRC_SQLITE_SCHEMA_H_
