@@ -12,7 +12,6 @@
 #ifndef TAVOCONFIGSTORE_SRC_TRANSACTION_LEVELS_H_
 #define TAVOCONFIGSTORE_SRC_TRANSACTION_LEVELS_H_
 
-#include <cstddef>
 #include <utility>
 #include <vector>
 
@@ -24,8 +23,6 @@ struct KeptByTheStorage {};
 template <typename State = KeptByTheStorage>
 class TransactionLevels {
  public:
-  // 0 outside a transaction, 1 in the outermost one.
-  std::size_t Depth() const { return saved_.size(); }
   bool Open() const { return !saved_.empty(); }
   bool Nested() const { return saved_.size() > 1; }
 
@@ -36,7 +33,8 @@ class TransactionLevels {
     saved_.pop_back();
     return before;
   }
-  // Every level ends at once: the storage ended the transaction by itself.
+  // Every level ends at once: the outermost was rolled back, by the backend
+  // or by the storage on its own.
   void Clear() { saved_.clear(); }
 
  private:

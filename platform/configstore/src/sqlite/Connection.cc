@@ -37,21 +37,18 @@ void Connection::Fail(const std::string& what) const {
                              sqlite3_extended_errcode(db_));
 }
 
-sqlite3_stmt* Connection::Prepare(const std::string& sql) {
+sqlite3_stmt* Connection::Prepare(std::string_view sql, const char* what) {
   sqlite3_stmt* s = nullptr;
-  if (sqlite3_prepare_v3(db_, sql.c_str(), static_cast<int>(sql.size()) + 1,
-                         SQLITE_PREPARE_PERSISTENT, &s, nullptr) != SQLITE_OK) {
-    Fail("preparing \"" + sql + "\"");
+  if (sqlite3_prepare_v3(db_, sql.data(), static_cast<int>(sql.size()), SQLITE_PREPARE_PERSISTENT,
+                         &s, nullptr) != SQLITE_OK) {
+    Fail(what != nullptr ? what : "preparing \"" + std::string(sql) + "\"");
   }
   return s;
 }
 
 sqlite3_stmt* Connection::Cached(std::string_view sql, const char* what) {
   sqlite3_stmt*& s = cached_[sql];
-  if (s == nullptr && sqlite3_prepare_v3(db_, sql.data(), static_cast<int>(sql.size()),
-                                         SQLITE_PREPARE_PERSISTENT, &s, nullptr) != SQLITE_OK) {
-    Fail(what);
-  }
+  if (s == nullptr) s = Prepare(sql, what);
   return s;
 }
 

@@ -47,8 +47,9 @@ class Connection {
   [[noreturn]] void Fail(const std::string& what) const;
 
   // A statement prepared for many runs and kept until the caller finalizes
-  // it or Close does.
-  sqlite3_stmt* Prepare(const std::string& sql);
+  // it or Close does; a failure to prepare it is a failure of "what", else
+  // of preparing "sql".
+  sqlite3_stmt* Prepare(std::string_view sql, const char* what = nullptr);
   // The statement of "sql", a string literal, prepared on first use and kept
   // until Close; a failure to prepare it is a failure of "what".
   sqlite3_stmt* Cached(std::string_view sql, const char* what);

@@ -206,12 +206,12 @@ class SqliteStore final : public Backend {
       return;
     }
     FlushSequence();
-    sqlite3_stmt* commit = conn_.Cached("COMMIT", "committing");
-    Resetter reset(commit);
-    // A failed COMMIT may leave the transaction open (then Abort ends it).
-    if (sqlite3_step(commit) != SQLITE_DONE) {
+    try {
+      conn_.Run("COMMIT", "committing");
+    } catch (...) {
+      // A failed COMMIT may leave the transaction open (then Abort ends it).
       if (conn_.Idle()) EndAll();
-      conn_.Fail("committing");
+      throw;
     }
     levels_.Commit();
     seqLoaded_ = false;  // others may write before our next transaction
@@ -231,11 +231,13 @@ class SqliteStore final : public Backend {
       return;
     }
     Forget();
-    sqlite3_stmt* rollback = conn_.Cached("ROLLBACK", "rolling back");
-    Resetter reset(rollback);
-    const int rc = sqlite3_step(rollback);
-    if (conn_.Idle()) levels_.Clear();
-    if (rc != SQLITE_DONE) conn_.Fail("rolling back");
+    try {
+      conn_.Run("ROLLBACK", "rolling back");
+    } catch (...) {
+      if (conn_.Idle()) levels_.Clear();
+      throw;
+    }
+    levels_.Clear();
   }
 
   // Any commit by another connection since this one connected or last
@@ -356,6 +358,7 @@ class SqliteStore final : public Backend {
   void InTransaction(std::string_view begin, const char* starting, const char* ending,
                      Body&& body) {
     if (!conn_.Idle()) return body();
+    seqLoaded_ = seqDirty_ = false;  // counted in a transaction that is over
     conn_.Run(begin, starting);
     try {
       body();
