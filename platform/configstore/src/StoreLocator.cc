@@ -1,7 +1,8 @@
 // The registry of backends: which backend a store locator names, and how to
 // open it. The table below is the one place that knows the backends.
 
-#include <cctype>
+#include <strings.h>
+
 #include <string>
 #include <string_view>
 
@@ -26,21 +27,14 @@ bool StartsWithScheme(std::string_view text) {
   return text.substr(end, 2) == ":/";
 }
 
-bool StartsWithIgnoringCase(std::string_view text, std::string_view prefix) {
-  if (text.size() < prefix.size()) return false;
-  for (std::size_t i = 0; i < prefix.size(); ++i) {
-    if (std::tolower(static_cast<unsigned char>(text[i])) != prefix[i]) return false;
-  }
-  return true;
-}
-
 // "etcd" or "etcds" in any case, then ':' or "//": an etcd locator with a
 // slash or the colon missing ("etcd:host:2379/p", "etcd//host:2379/p").
-bool StartsLikeEtcd(std::string_view text) {
-  for (std::string_view scheme : {"etcds", "etcd"}) {
-    if (!StartsWithIgnoringCase(text, scheme)) continue;
-    const std::string_view rest = text.substr(scheme.size());
-    if (rest.substr(0, 1) == ":" || rest.substr(0, 2) == "//") return true;
+bool StartsLikeEtcd(const std::string& text) {
+  for (const std::string_view scheme : {"etcds", "etcd"}) {
+    if (strncasecmp(text.c_str(), scheme.data(), scheme.size()) != 0) continue;
+    if (text.compare(scheme.size(), 1, ":") == 0 || text.compare(scheme.size(), 2, "//") == 0) {
+      return true;
+    }
   }
   return false;
 }

@@ -21,14 +21,14 @@ void CreateFormat2Tables(Connection& conn, const char* what) {
   conn.Exec("CREATE TABLE sequence(next INTEGER NOT NULL)", what);
 }
 
-}  // namespace
-
 std::string TableOf(sqlite3_int64 collection) { return "c" + std::to_string(collection); }
 
 std::string CreateTableSql(sqlite3_int64 collection) {
   return "CREATE TABLE " + TableOf(collection) +
          "(seq INTEGER NOT NULL, instance BLOB NOT NULL UNIQUE, body BLOB NOT NULL)";
 }
+
+}  // namespace
 
 Found Inspect(Connection& conn) {
   // The first read of the file: a non-database fails here (SQLITE_NOTADB).
@@ -98,6 +98,105 @@ void UpgradeFormat1(Connection& conn) {
   }
   conn.Exec("DROP TABLE objects", what);
   conn.Exec("PRAGMA user_version = " + std::to_string(kFormat), what);
+}
+
+sqlite3_stmt* Collections::Statement(Collection* c, Op op) {
+  sqlite3_stmt*& s = c->statements[op];
+  if (s == nullptr) {
+    static const char* const kSql[kOps] = {
+        "INSERT OR REPLACE INTO %(seq, instance, body) VALUES(?1, ?2, ?3)",
+        "SELECT seq, instance, body FROM % ORDER BY rowid",
+        "SELECT seq, instance, body FROM % WHERE instance = ?1", "DELETE FROM %",
+        "DELETE FROM % WHERE instance = ?1"};
+    std::string sql = kSql[op];
+    sql.replace(sql.find('%'), 1, TableOf(c->id));
+    s = conn_.Prepare(sql);
+  }
+  return s;
+}
+
+Collections::Collection* Collections::Remember(Key&& key, sqlite3_int64 id) {
+  Collection c;
+  c.id = id;
+  std::tie(c.key, c.group, c.component) = key;
+  return &known_.emplace(std::move(key), std::move(c)).first->second;
+}
+
+Collections::Collection* Collections::Find(const ConfigStoreObjectId& id, bool create) {
+  if (last_ != nullptr && last_->key == id.Key() && last_->group == id.Group() &&
+      last_->component == id.Component()) {
+    return last_;
+  }
+  Key key(id.Key(), id.Group(), id.Component());
+  auto it = known_.find(key);
+  if (it != known_.end()) return last_ = &it->second;
+  sqlite3_stmt* find =
+      conn_.Cached("SELECT id FROM collections WHERE key = ?1 AND grp = ?2 AND component = ?3",
+                   "finding a collection");
+  sqlite3_int64 table = 0;
+  {
+    Resetter reset(find);
+    conn_.Bind(find, 1, id.Key());
+    conn_.Bind(find, 2, id.Group());
+    conn_.Bind(find, 3, id.Component());
+    const int rc = sqlite3_step(find);
+    if (rc == SQLITE_ROW) {
+      table = sqlite3_column_int64(find, 0);
+    } else if (rc != SQLITE_DONE) {
+      conn_.Fail("finding a collection");
+    }
+  }
+  if (table == 0) {
+    if (!create) return nullptr;
+    sqlite3_stmt* add = conn_.Cached(
+        "INSERT INTO collections(key, grp, component) VALUES(?1, ?2, ?3)", "adding a collection");
+    Resetter reset(add);
+    conn_.Bind(add, 1, id.Key());
+    conn_.Bind(add, 2, id.Group());
+    conn_.Bind(add, 3, id.Component());
+    if (sqlite3_step(add) != SQLITE_DONE) conn_.Fail("adding a collection");
+    table = sqlite3_last_insert_rowid(conn_.Db());
+    conn_.Exec(CreateTableSql(table), "adding a collection");
+  }
+  return last_ = Remember(std::move(key), table);
+}
+
+std::vector<Collections::Collection*> Collections::Matching(const ConfigStoreObjectId& filter) {
+  std::vector<Collection*> out;
+  if (!filter.Key().empty() && !filter.Group().empty() && !filter.Component().empty()) {
+    if (Collection* c = Find(filter, false)) out.push_back(c);
+    return out;
+  }
+  sqlite3_stmt* q = conn_.Cached(
+      "SELECT id, key, grp, component FROM collections WHERE (?1 IS NULL OR key = ?1) AND "
+      "(?2 IS NULL OR grp = ?2) AND (?3 IS NULL OR component = ?3) ORDER BY id",
+      "finding collections");
+  Resetter reset(q);
+  const std::string* parts[] = {&filter.Key(), &filter.Group(), &filter.Component()};
+  for (int i = 0; i < 3; ++i) {
+    if (parts[i]->empty()) {
+      sqlite3_bind_null(q, i + 1);
+    } else {
+      conn_.Bind(q, i + 1, *parts[i]);
+    }
+  }
+  int rc;
+  while ((rc = sqlite3_step(q)) == SQLITE_ROW) {
+    Key key(Connection::Column(q, 1), Connection::Column(q, 2), Connection::Column(q, 3));
+    auto it = known_.find(key);
+    out.push_back(it != known_.end() ? &it->second
+                                     : Remember(std::move(key), sqlite3_column_int64(q, 0)));
+  }
+  if (rc != SQLITE_DONE) conn_.Fail("finding collections");
+  return out;
+}
+
+void Collections::Forget() {
+  for (auto& entry : known_) {
+    for (sqlite3_stmt* s : entry.second.statements) sqlite3_finalize(s);
+  }
+  known_.clear();
+  last_ = nullptr;
 }
 
 }  // namespace sqlite

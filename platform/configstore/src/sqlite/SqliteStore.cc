@@ -1,7 +1,7 @@
 // The SQLite backend: a table per collection, each object a row of its
 // instance id and its body (object/Format.h) in one BLOB. Schema.h has the
-// tables and the upgrade from format 1, Collections.h which table holds
-// which collection, StoreFile.h how the file is made and watched.
+// tables, which of them holds which collection, and the upgrade from format 1;
+// StoreFile.h how the file is made and watched.
 //
 // Write order: every object written gets the next "seq" of the whole store,
 // so a rewritten object moves to the end and objects of several collections
@@ -35,7 +35,6 @@
 #include "../Backend.h"
 #include "../TransactionLevels.h"
 #include "../object/Objects.h"
-#include "Collections.h"
 #include "Connection.h"
 #include "Schema.h"
 #include "StoreFile.h"
