@@ -122,6 +122,27 @@ Collections::Collection* Collections::Remember(Key&& key, sqlite3_int64 id) {
   return &known_.emplace(std::move(key), std::move(c)).first->second;
 }
 
+void Collections::BindParts(sqlite3_stmt* s, const ConfigStoreObjectId& id, bool emptyIsNull) {
+  const std::string* parts[] = {&id.Key(), &id.Group(), &id.Component()};
+  for (int i = 0; i < 3; ++i) {
+    if (emptyIsNull && parts[i]->empty()) {
+      sqlite3_bind_null(s, i + 1);
+    } else {
+      conn_.Bind(s, i + 1, *parts[i]);
+    }
+  }
+}
+
+sqlite3_int64 Collections::RunOnParts(std::string_view sql, const ConfigStoreObjectId& id,
+                                      const char* what) {
+  sqlite3_stmt* s = conn_.Cached(sql, what);
+  Resetter reset(s);
+  BindParts(s, id, false);
+  const int rc = sqlite3_step(s);
+  if (rc != SQLITE_ROW && rc != SQLITE_DONE) conn_.Fail(what);
+  return rc == SQLITE_ROW ? sqlite3_column_int64(s, 0) : 0;
+}
+
 Collections::Collection* Collections::Find(const ConfigStoreObjectId& id, bool create) {
   if (last_ != nullptr && last_->key == id.Key() && last_->group == id.Group() &&
       last_->component == id.Component()) {
@@ -130,31 +151,13 @@ Collections::Collection* Collections::Find(const ConfigStoreObjectId& id, bool c
   Key key(id.Key(), id.Group(), id.Component());
   auto it = known_.find(key);
   if (it != known_.end()) return last_ = &it->second;
-  sqlite3_stmt* find =
-      conn_.Cached("SELECT id FROM collections WHERE key = ?1 AND grp = ?2 AND component = ?3",
-                   "finding a collection");
-  sqlite3_int64 table = 0;
-  {
-    Resetter reset(find);
-    conn_.Bind(find, 1, id.Key());
-    conn_.Bind(find, 2, id.Group());
-    conn_.Bind(find, 3, id.Component());
-    const int rc = sqlite3_step(find);
-    if (rc == SQLITE_ROW) {
-      table = sqlite3_column_int64(find, 0);
-    } else if (rc != SQLITE_DONE) {
-      conn_.Fail("finding a collection");
-    }
-  }
+  sqlite3_int64 table =
+      RunOnParts("SELECT id FROM collections WHERE key = ?1 AND grp = ?2 AND component = ?3", id,
+                 "finding a collection");
   if (table == 0) {
     if (!create) return nullptr;
-    sqlite3_stmt* add = conn_.Cached(
-        "INSERT INTO collections(key, grp, component) VALUES(?1, ?2, ?3)", "adding a collection");
-    Resetter reset(add);
-    conn_.Bind(add, 1, id.Key());
-    conn_.Bind(add, 2, id.Group());
-    conn_.Bind(add, 3, id.Component());
-    if (sqlite3_step(add) != SQLITE_DONE) conn_.Fail("adding a collection");
+    RunOnParts("INSERT INTO collections(key, grp, component) VALUES(?1, ?2, ?3)", id,
+               "adding a collection");
     table = sqlite3_last_insert_rowid(conn_.Db());
     conn_.Exec(CreateTableSql(table), "adding a collection");
   }
@@ -172,14 +175,7 @@ std::vector<Collections::Collection*> Collections::Matching(const ConfigStoreObj
       "(?2 IS NULL OR grp = ?2) AND (?3 IS NULL OR component = ?3) ORDER BY id",
       "finding collections");
   Resetter reset(q);
-  const std::string* parts[] = {&filter.Key(), &filter.Group(), &filter.Component()};
-  for (int i = 0; i < 3; ++i) {
-    if (parts[i]->empty()) {
-      sqlite3_bind_null(q, i + 1);
-    } else {
-      conn_.Bind(q, i + 1, *parts[i]);
-    }
-  }
+  BindParts(q, filter, true);
   int rc;
   while ((rc = sqlite3_step(q)) == SQLITE_ROW) {
     Key key(Connection::Column(q, 1), Connection::Column(q, 2), Connection::Column(q, 3));

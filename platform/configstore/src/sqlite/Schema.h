@@ -85,6 +85,11 @@ class Collections {
  private:
   using Key = std::tuple<std::string, std::string, std::string>;
   Collection* Remember(Key&& key, sqlite3_int64 id);
+  // Binds the key, group and component of "id" to ?1, ?2 and ?3; with
+  // "emptyIsNull" an empty part as NULL, which the filter query takes as any.
+  void BindParts(sqlite3_stmt* s, const ConfigStoreObjectId& id, bool emptyIsNull);
+  // Runs "sql" on the parts of "id": the first column of its row, or 0.
+  sqlite3_int64 RunOnParts(std::string_view sql, const ConfigStoreObjectId& id, const char* what);
 
   Connection& conn_;
   std::map<Key, Collection> known_;
