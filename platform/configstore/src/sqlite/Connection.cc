@@ -11,16 +11,15 @@ void Connection::Open(const std::string& name, int busyTimeoutMs) {
   // meanwhile, SQLite must not make one with its own default mode.
   const int rc =
       sqlite3_open_v2(name.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
-  if (db_ == nullptr) {
-    throw ConfigStoreException(where_ + ": cannot open: " + sqlite3_errstr(rc), rc);
-  }
-  sqlite3_extended_result_codes(db_, 1);
   if (rc != SQLITE_OK) {
-    const ConfigStoreException error(where_ + ": cannot open: " + sqlite3_errmsg(db_),
-                                     sqlite3_extended_errcode(db_));
+    // Without memory for a handle, SQLite gives none to ask for the message.
+    const ConfigStoreException error(
+        where_ + ": cannot open: " + (db_ != nullptr ? sqlite3_errmsg(db_) : sqlite3_errstr(rc)),
+        db_ != nullptr ? sqlite3_extended_errcode(db_) : rc);
     Close();
     throw error;
   }
+  sqlite3_extended_result_codes(db_, 1);
   sqlite3_busy_timeout(db_, busyTimeoutMs);
 }
 

@@ -116,10 +116,12 @@ sqlite3_stmt* Collections::Statement(Collection* c, Op op) {
 }
 
 Collections::Collection* Collections::Remember(Key&& key, sqlite3_int64 id) {
-  Collection c;
-  c.id = id;
-  std::tie(c.key, c.group, c.component) = key;
-  return &known_.emplace(std::move(key), std::move(c)).first->second;
+  auto [it, added] = known_.try_emplace(std::move(key));
+  if (added) {
+    it->second.id = id;
+    std::tie(it->second.key, it->second.group, it->second.component) = it->first;
+  }
+  return &it->second;
 }
 
 void Collections::BindParts(sqlite3_stmt* s, const ConfigStoreObjectId& id, bool emptyIsNull) {
@@ -179,9 +181,7 @@ std::vector<Collections::Collection*> Collections::Matching(const ConfigStoreObj
   int rc;
   while ((rc = sqlite3_step(q)) == SQLITE_ROW) {
     Key key(Connection::Column(q, 1), Connection::Column(q, 2), Connection::Column(q, 3));
-    auto it = known_.find(key);
-    out.push_back(it != known_.end() ? &it->second
-                                     : Remember(std::move(key), sqlite3_column_int64(q, 0)));
+    out.push_back(Remember(std::move(key), sqlite3_column_int64(q, 0)));
   }
   if (rc != SQLITE_DONE) conn_.Fail("finding collections");
   return out;

@@ -84,6 +84,7 @@ class Collections {
 
  private:
   using Key = std::tuple<std::string, std::string, std::string>;
+  // The collection of "key", known from now on as table "id" if it was not.
   Collection* Remember(Key&& key, sqlite3_int64 id);
   // Binds the key, group and component of "id" to ?1, ?2 and ?3; with
   // "emptyIsNull" an empty part as NULL, which the filter query takes as any.
