@@ -43,6 +43,10 @@ class Backend : public ConfigStore {
   virtual void Delete(const FilterSpecObject& filter) = 0;
   virtual std::vector<std::shared_ptr<ConfigStoreObject>> List(const FilterSpecObject& filter) = 0;
 
+  [[noreturn]] void NoTransactionToCommit() const {
+    throw ConfigStoreException(Where() + ": no transaction to commit", kErrorNoTransaction);
+  }
+
  private:
   [[noreturn]] void Refuse(const char* operation) const {
     throw ConfigStoreException(Where() + ": " + operation + " of null", kErrorNullArgument);

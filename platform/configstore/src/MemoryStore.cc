@@ -7,6 +7,7 @@
 
 #include "Backend.h"
 #include "TavoConfigStore/ConfigStore.h"
+#include "TransactionLevels.h"
 #include "object/Objects.h"
 
 namespace TavoConfigStore {
@@ -50,15 +51,13 @@ class MemoryStore final : public Backend {
     auto copy = std::make_shared<Stored>(Stored{object.Id(), std::string()});
     objectmodel::EncodeObject(object, &copy->body);
     std::lock_guard<std::mutex> lock(mu_);
-    IdKey key = KeyOf(object.Id());
-    auto it = state_.index.find(key);
-    if (it != state_.index.end()) {
-      state_.bySeq.erase(it->second);
-      state_.index.erase(it);
-    }
     const std::uint64_t seq = state_.nextSeq++;
+    auto [it, added] = state_.index.try_emplace(KeyOf(object.Id()), seq);
+    if (!added) {
+      state_.bySeq.erase(it->second);  // a rewritten object moves to the end
+      it->second = seq;
+    }
     state_.bySeq.emplace(seq, std::move(copy));
-    state_.index.emplace(std::move(key), seq);
   }
 
   void Delete(const FilterSpecObject& filter) override {
@@ -82,31 +81,28 @@ class MemoryStore final : public Backend {
     return out;
   }
 
+  // Every level saves the whole state, which the writes never touch in
+  // place; the outermost commit has nothing more to make durable.
   void BeginTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    saved_.push_back(state_);
+    levels_.Begin(state_);
   }
 
-  // An inner commit keeps its writes in the enclosing transaction.
   void CommitTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    if (saved_.empty()) {
-      throw ConfigStoreException(Where() + ": no transaction to commit", kErrorNoTransaction);
-    }
-    saved_.pop_back();
+    if (!levels_.Open()) NoTransactionToCommit();
+    levels_.Commit();
   }
 
   void AbortTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    if (saved_.empty()) return;
-    state_ = std::move(saved_.back());
-    saved_.pop_back();
+    if (levels_.Open()) state_ = levels_.Abort();
   }
 
  private:
   std::mutex mu_;
   State state_;
-  std::vector<State> saved_;  // the state at each open BeginTransaction, outermost first
+  TransactionLevels<State> levels_;
 };
 
 }  // namespace

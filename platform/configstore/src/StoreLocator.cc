@@ -1,6 +1,8 @@
-// Telling a store locator's kind, and showing one without its password.
+// The registry of backends: which backend a store locator names, and how to
+// open it. The table below is the one place that knows the backends.
 
-#include <cctype>
+#include <strings.h>
+
 #include <string>
 #include <string_view>
 
@@ -25,39 +27,54 @@ bool StartsWithScheme(std::string_view text) {
   return text.substr(end, 2) == ":/";
 }
 
-bool StartsWithIgnoringCase(std::string_view text, std::string_view prefix) {
-  if (text.size() < prefix.size()) return false;
-  for (std::size_t i = 0; i < prefix.size(); ++i) {
-    if (std::tolower(static_cast<unsigned char>(text[i])) != prefix[i]) return false;
-  }
-  return true;
-}
-
 // "etcd" or "etcds" in any case, then ':' or "//": an etcd locator with a
 // slash or the colon missing ("etcd:host:2379/p", "etcd//host:2379/p").
-bool StartsLikeEtcd(std::string_view text) {
-  for (std::string_view scheme : {"etcds", "etcd"}) {
-    if (!StartsWithIgnoringCase(text, scheme)) continue;
-    const std::string_view rest = text.substr(scheme.size());
-    if (rest.substr(0, 1) == ":" || rest.substr(0, 2) == "//") return true;
+bool StartsLikeEtcd(const std::string& text) {
+  for (const std::string_view scheme : {"etcds", "etcd"}) {
+    if (strncasecmp(text.c_str(), scheme.data(), scheme.size()) != 0) continue;
+    if (text.compare(scheme.size(), 1, ":") == 0 || text.compare(scheme.size(), 2, "//") == 0) {
+      return true;
+    }
   }
   return false;
 }
 
+// Taken as a path, a mistyped etcd locator would become a store file under a
+// folder named after the cluster, its password included, and the catalogue
+// would never reach the cluster: whatever looks like a URL is no path.
+bool IsPath(const std::string& locator) {
+  return !StartsWithScheme(locator) && !StartsLikeEtcd(locator);
+}
+
+struct LocatorEntry {
+  LocatorKind kind;
+  bool (*names)(const std::string& locator);
+  std::shared_ptr<ConfigStore> (*open)(const std::string& locator);
+};
+
+const LocatorEntry kLocators[] = {
+    {LocatorKind::kEtcd, IsEtcdLocator,
+     [](const std::string& locator) { return NewEtcdStore(ParseEtcdLocator(locator)); }},
+    {LocatorKind::kPath, IsPath,
+     [](const std::string& locator) { return NewSqliteStore(locator); }},
+};
+
+const LocatorEntry& EntryOf(const std::string& locator) {
+  for (const LocatorEntry& entry : kLocators) {
+    if (entry.names(locator)) return entry;
+  }
+  throw ConfigStoreException("store locator \"" + RedactLocator(locator) +
+                                 "\" looks like a URL but is no etcd:// or etcds:// locator; "
+                                 "put ./ in front to make it a file path",
+                             kErrorBadLocator);
+}
+
 }  // namespace
 
-LocatorKind KindOfLocator(const std::string& locator) {
-  if (IsEtcdLocator(locator)) return LocatorKind::kEtcd;
-  // Taken as a path, a mistyped etcd locator would become a store file
-  // under a folder named after the cluster, its password included, and the
-  // catalogue would never reach the cluster.
-  if (StartsWithScheme(locator) || StartsLikeEtcd(locator)) {
-    throw ConfigStoreException("store locator \"" + RedactLocator(locator) +
-                                   "\" looks like a URL but is no etcd:// or etcds:// locator; "
-                                   "put ./ in front to make it a file path",
-                               kErrorBadLocator);
-  }
-  return LocatorKind::kPath;
+LocatorKind KindOfLocator(const std::string& locator) { return EntryOf(locator).kind; }
+
+std::shared_ptr<ConfigStore> OpenStore(const std::string& locator) {
+  return EntryOf(locator).open(locator);
 }
 
 // The password runs from the colon after the user name to the last '@': a
