@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "../Backend.h"
+#include "../TransactionLevels.h"
 #include "../object/Objects.h"
 #include "EtcdClient.h"
 #include "EtcdCommit.h"
@@ -125,28 +126,17 @@ class EtcdStore final : public Backend {
 
   void BeginTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    if (depth_ == 0) {
-      // A transaction's requests share one wait for members that do not
-      // answer: a caller that goes on after a failure (a reset clearing one
-      // collection after another) still ends within about one timeout.
-      txnCall_.emplace(client_);
-    } else {
-      saved_.push_back(txn_);
-    }
-    ++depth_;
+    // A transaction's requests share one wait for members that do not
+    // answer: a caller that goes on after a failure (a reset clearing one
+    // collection after another) still ends within about one timeout.
+    if (!levels_.Open()) txnCall_.emplace(client_);
+    levels_.Begin(txn_);
   }
 
   void CommitTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    if (depth_ == 0) {
-      throw ConfigStoreException(client_.Where() + ": no transaction to commit",
-                                 kErrorNoTransaction);
-    }
-    if (depth_ > 1) {
-      saved_.pop_back();
-      --depth_;
-      return;
-    }
+    if (!levels_.Open()) NoTransactionToCommit();
+    if (levels_.Nested()) return levels_.Commit();
     // A failed commit leaves the transaction open, for the caller to abort.
     commit_.Apply(txn_.collections, observed_);
     Reset();
@@ -154,14 +144,11 @@ class EtcdStore final : public Backend {
 
   void AbortTransaction() override {
     std::lock_guard<std::mutex> lock(mu_);
-    if (depth_ == 0) return;
-    if (depth_ > 1) {
-      txn_ = std::move(saved_.back());
-      saved_.pop_back();
-      --depth_;
-      return;
+    if (levels_.Nested()) {
+      txn_ = levels_.Abort();
+    } else if (levels_.Open()) {
+      Reset();
     }
-    Reset();
   }
 
   bool WaitForChange(int timeoutMs) override {
@@ -215,7 +202,7 @@ class EtcdStore final : public Backend {
   // A transaction that read a collection commits only if nobody changed it.
   void Observe(const std::string& collection, const Pointers& pointers) {
     const Current* current = pointers.Find(collection);
-    if (depth_ > 0) observed_.emplace(collection, current ? current->version : 0);
+    if (levels_.Open()) observed_.emplace(collection, current ? current->version : 0);
   }
 
   std::vector<std::shared_ptr<ConfigStoreObject>> Listing(const FilterSpecObject& filter) {
@@ -271,11 +258,11 @@ class EtcdStore final : public Backend {
   // Runs "change" in the open transaction, or in one of its own.
   template <typename Change>
   void InTransaction(const Change& change) {
-    if (depth_ > 0) {
+    if (levels_.Open()) {
       change();
       return;
     }
-    depth_ = 1;
+    levels_.Begin();
     const EtcdClient::Call call(client_);
     try {
       change();
@@ -288,9 +275,8 @@ class EtcdStore final : public Backend {
   }
 
   void Reset() {
-    depth_ = 0;
+    levels_.Clear();
     txn_ = TxnState();
-    saved_.clear();
     observed_.clear();
     txnCall_.reset();
   }
@@ -299,9 +285,8 @@ class EtcdStore final : public Backend {
   EtcdClient client_;
   EtcdReader reader_;
   EtcdCommit commit_;
-  int depth_ = 0;
+  TransactionLevels<TxnState> levels_;
   TxnState txn_;
-  std::vector<TxnState> saved_;  // the state at each inner Begin
   ObservedVersions observed_;
   std::optional<EtcdClient::Call> txnCall_;  // the open transaction's wait
   std::unique_ptr<ChangeFeed> feed_;
