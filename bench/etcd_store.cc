@@ -183,7 +183,7 @@ void BM_RawReplace(benchmark::State& state) {
     const Catalogue& c = FilledCatalogue(N(state));
     const std::string root = Root("kb-write", N(state));
     const Records records = Rerooted(c.policies.records, c.rawRoot, root);
-    GrpcTransport raw(EtcdEndpoint());
+    RawEtcd raw(EtcdEndpoint());
     WriteBatches(raw, records);
     {
       EtcdCpu etcd(state);
@@ -210,7 +210,7 @@ void BM_StoreList(benchmark::State& state) {
 void BM_RawList(benchmark::State& state) {
   Guarded(state, [&] {
     const RawCollection& policies = FilledCatalogue(N(state)).policies;
-    GrpcTransport raw(EtcdEndpoint());
+    RawEtcd raw(EtcdEndpoint());
     Expect(ListOne(raw, policies.prefix) == policies.records, "listing differs");
     EtcdCpu etcd(state);
     for (auto _ : state) benchmark::DoNotOptimize(ListOne(raw, policies.prefix));
@@ -231,7 +231,7 @@ void BM_StoreGetDbHash(benchmark::State& state) {
 void BM_RawListBoth(benchmark::State& state) {
   Guarded(state, [&] {
     const Catalogue& c = FilledCatalogue(N(state));
-    GrpcTransport raw(EtcdEndpoint());
+    RawEtcd raw(EtcdEndpoint());
     Expect(ListOne(raw, c.datastores.prefix) == c.datastores.records, "listing differs");
     EtcdCpu etcd(state);
     for (auto _ : state) {
@@ -263,15 +263,15 @@ void BM_RawBlobByName(benchmark::State& state) {
     const RawCollection& policies = FilledCatalogue(N(state)).policies;
     std::vector<std::string> keys;
     for (const std::string& name : SomeNames(N(state))) keys.push_back(policies.key.at(name));
-    GrpcTransport raw(EtcdEndpoint());
+    RawEtcd raw(EtcdEndpoint());
     Records one;
-    raw.Range(keys[0], std::string(), 0, 0, &one);
+    raw.Range(keys[0], std::string(), &one);
     Expect(one.size() == 1, "no such key");
     EtcdCpu etcd(state);
     std::size_t i = 0;
     for (auto _ : state) {
       Records out;
-      raw.Range(keys[i++ % keys.size()], std::string(), 0, 0, &out);
+      raw.Range(keys[i++ % keys.size()], std::string(), &out);
       benchmark::DoNotOptimize(out);
     }
   });
@@ -307,11 +307,11 @@ void BM_RawDefaultBlob(benchmark::State& state) {
   Guarded(state, [&] {
     const Catalogue& c = FilledCatalogue(N(state));
     const std::string& key = c.datastores.key.at(Datastores(N(state)).back().url);
-    GrpcTransport raw(EtcdEndpoint());
+    RawEtcd raw(EtcdEndpoint());
     EtcdCpu etcd(state);
     for (auto _ : state) {
       Records out;
-      raw.Range(key, std::string(), 0, 0, &out);
+      raw.Range(key, std::string(), &out);
       benchmark::DoNotOptimize(out);
       benchmark::DoNotOptimize(ListOne(raw, c.policies.prefix));
     }
