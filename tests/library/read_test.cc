@@ -8,6 +8,7 @@
 
 #include "FaultStore.h"
 #include "Records.h"
+#include "StoreObjects.h"
 
 namespace karst_test {
 namespace {
@@ -53,9 +54,8 @@ TEST_F(ReadTest, FieldsComeFromStoredValuesAndMissingOnesReadEmpty) {
   auto datastore = std::make_shared<ConfigStoreObject>(
       ConfigStoreObjectId("karst_datastores", "storage", "tavo", "ds://instance"));
   datastore->SetValue("datastore_namespace", std::string("ns"));
-  std::int32_t flags = 0;
-  memory_->SetObject(policy, flags);
-  memory_->SetObject(datastore, flags);
+  Set(*memory_, policy);
+  Set(*memory_, datastore);
   EXPECT_EQ(KarstLib::ListPolicyInfo(),
             (std::vector<KarstPolicyInfo>{Policy("value-name", "", {{"b", ""}}, "", 0)}));
   EXPECT_EQ(KarstLib::ListDatastoreInfo(),
