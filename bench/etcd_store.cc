@@ -35,15 +35,16 @@ constexpr std::size_t kLookups = 1024;
 
 std::size_t N(const benchmark::State& state) { return static_cast<std::size_t>(state.range(0)); }
 
-// "/<kind>-<n>/": the store's prefixes and the raw copies' roots have the
-// same length for the same n, so their keys do too.
+// "/<kind>-<n>/" and a zero byte, the root under which the store of prefix
+// "<kind>-<n>" keeps its keys: the store's roots and the raw copies' have
+// the same length for the same n, so their keys do too.
 std::string Root(const char* kind, std::size_t n) {
-  return "/" + std::string(kind) + "-" + std::to_string(n) + "/";
+  return "/" + std::string(kind) + "-" + std::to_string(n) + "/" + std::string(1, '\0');
 }
 
-// Makes the library's default store the etcd store under the root's prefix.
+// Makes the library's default store the etcd store with the root's prefix.
 void UseEtcdStore(const std::string& root) {
-  const std::string locator = "etcd://" + EtcdEndpoint() + root.substr(0, root.size() - 1);
+  const std::string locator = "etcd://" + EtcdEndpoint() + root.substr(0, root.size() - 2);
   setenv("TAVO_CONFIGSTORE_PATH", locator.c_str(), 1);
 }
 
