@@ -103,7 +103,7 @@ TEST_P(StoreConformance, ValuesAndSubObjectsRoundTripByteExact) {
   o->SetValue("max", static_cast<long long>(LLONG_MAX));
   o->SetValue("kind", std::string("was a string"));
   o->SetValue("kind", -1LL);  // changes kind, keeps its place
-  // More sub-objects than are built when an object is read.
+  // Many sub-objects in two arrays.
   for (int i = 0; i < 20; ++i) {
     auto sub = o->CreateSubObject(SubObjectId(i % 3 ? "blobs" : "other", "s" + std::to_string(i)));
     sub->SetValue("blob", std::string(i, static_cast<char>(i)));
@@ -111,7 +111,7 @@ TEST_P(StoreConformance, ValuesAndSubObjectsRoundTripByteExact) {
   }
   o->CreateSubObject(SubObjectId(std::string("a\0", 2), "\xff"))->SetValue("v", big);
   o->CreateSubObject(SubObjectId("blobs", "s2"))->SetValue("replaced", 1LL);  // in s2's place
-  // More values than a new object appends to its own encoding.
+  // Many values in one sub-object, one set again.
   auto many = o->CreateSubObject(SubObjectId("many", ""));
   for (long long v = 0; v < 200; ++v) many->SetValue(("v" + std::to_string(v)).c_str(), v);
   many->SetValue("v3", std::string("set again"));
