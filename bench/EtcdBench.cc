@@ -53,7 +53,7 @@ std::string PrefixEnd(std::string prefix) {
   return prefix;
 }
 
-GrpcTransport::GrpcTransport(const std::string& endpoint) {
+RawEtcd::RawEtcd(const std::string& endpoint) {
   grpc::ChannelArguments args;
   // A listing of 10,000 policies in one reply is over gRPC's default 4 MB.
   args.SetMaxReceiveMessageSize(-1);
@@ -64,12 +64,11 @@ GrpcTransport::GrpcTransport(const std::string& endpoint) {
   kv_ = etcdserverpb::KV::NewStub(channel_);
 }
 
-Page GrpcTransport::Range(const std::string& key, const std::string& end, std::int64_t revision,
-                          std::int64_t limit, Records* out) {
+std::int64_t RawEtcd::Range(const std::string& key, const std::string& end, Records* out,
+                            std::int64_t limit) {
   etcdserverpb::RangeRequest request;
   request.set_key(key);
   request.set_range_end(end);
-  request.set_revision(revision);
   request.set_limit(limit);
   etcdserverpb::RangeResponse response;
   grpc::ClientContext context;
@@ -78,10 +77,10 @@ Page GrpcTransport::Range(const std::string& key, const std::string& end, std::i
   for (mvccpb::KeyValue& kv : *response.mutable_kvs()) {
     out->emplace_back(std::move(*kv.mutable_key()), std::move(*kv.mutable_value()));
   }
-  return {response.header().revision(), response.more()};
+  return response.header().revision();
 }
 
-void GrpcTransport::Put(const Records& records, std::size_t begin, std::size_t end) {
+void RawEtcd::Put(const Records& records, std::size_t begin, std::size_t end) {
   etcdserverpb::TxnRequest request;
   for (std::size_t i = begin; i < end; ++i) {
     etcdserverpb::PutRequest* put = request.add_success()->mutable_request_put();
@@ -93,18 +92,17 @@ void GrpcTransport::Put(const Records& records, std::size_t begin, std::size_t e
   Check(kv_->Txn(&context, request, &response), "Txn");
 }
 
-void GrpcTransport::CompactAll() {
+void RawEtcd::CompactAll() {
   Records none;
-  const Page page = Range(std::string(1, '\0'), std::string(1, '\0'), 0, 1, &none);
   etcdserverpb::CompactionRequest request;
-  request.set_revision(page.revision);
+  request.set_revision(Range(std::string(1, '\0'), std::string(1, '\0'), &none, 1));
   request.set_physical(true);
   etcdserverpb::CompactionResponse response;
   grpc::ClientContext context;
   Check(kv_->Compact(&context, request, &response), "Compact");
 }
 
-void GrpcTransport::DeletePrefix(const std::string& prefix) {
+void RawEtcd::DeletePrefix(const std::string& prefix) {
   etcdserverpb::DeleteRangeRequest request;
   request.set_key(prefix);
   request.set_range_end(PrefixEnd(prefix));
@@ -113,20 +111,20 @@ void GrpcTransport::DeletePrefix(const std::string& prefix) {
   Check(kv_->DeleteRange(&context, request, &response), "DeleteRange");
 }
 
-Records ListOne(Transport& t, const std::string& prefix) {
+Records ListOne(RawEtcd& etcd, const std::string& prefix) {
   Records out;
-  t.Range(prefix, PrefixEnd(prefix), 0, 0, &out);
+  etcd.Range(prefix, PrefixEnd(prefix), &out);
   return out;
 }
 
-void WriteBatches(Transport& t, const Records& records) {
+void WriteBatches(RawEtcd& etcd, const Records& records) {
   for (std::size_t i = 0; i < records.size(); i += kEtcdBatch) {
-    t.Put(records, i, std::min(i + kEtcdBatch, records.size()));
+    etcd.Put(records, i, std::min(i + kEtcdBatch, records.size()));
   }
 }
 
-GrpcTransport& EtcdAdmin() {
-  static GrpcTransport admin(EtcdEndpoint());
+RawEtcd& EtcdAdmin() {
+  static RawEtcd admin(EtcdEndpoint());
   return admin;
 }
 

@@ -29,35 +29,19 @@ std::string EtcdEndpoint();
 // The end of the range that holds every key starting with prefix.
 std::string PrefixEnd(std::string prefix);
 
-struct Page {
-  std::int64_t revision = 0;
-  bool more = false;
-};
-
-// A way to reach etcd's KV calls.
-class Transport {
- public:
-  virtual ~Transport() = default;
-  // The keys in [key, end) at revision (0: the latest), at most limit of
-  // them (0: all), appended to out. An empty end reads the one key.
-  virtual Page Range(const std::string& key, const std::string& end, std::int64_t revision,
-                     std::int64_t limit, Records* out) = 0;
-  // One transaction putting records[begin, end).
-  virtual void Put(const Records& records, std::size_t begin, std::size_t end) = 0;
-  // Connections opened so far, where the transport can tell: keep-alive
-  // should hold this at 1.
-  virtual long Connections() const { return -1; }
-};
-
-// The generated v3 stubs on a channel of their own, as the store's client
+// etcd's generated v3 stubs on a channel of their own, as the store's client
 // sets one up, with nothing of the store on top.
-class GrpcTransport : public Transport {
+class RawEtcd {
  public:
-  explicit GrpcTransport(const std::string& endpoint);
+  explicit RawEtcd(const std::string& endpoint);
 
-  Page Range(const std::string& key, const std::string& end, std::int64_t revision,
-             std::int64_t limit, Records* out) override;
-  void Put(const Records& records, std::size_t begin, std::size_t end) override;
+  // The keys in [key, end) at the latest revision, at most limit of them (0:
+  // all), appended to out; an empty end reads the one key. Returns the
+  // revision read.
+  std::int64_t Range(const std::string& key, const std::string& end, Records* out,
+                     std::int64_t limit = 0);
+  // One transaction putting records[begin, end).
+  void Put(const Records& records, std::size_t begin, std::size_t end);
 
   // Drops the history older than the latest revision, so that repeated
   // writes do not grow the database from one repetition to the next.
@@ -70,13 +54,13 @@ class GrpcTransport : public Transport {
 };
 
 // Every key under prefix, in one reply.
-Records ListOne(Transport& t, const std::string& prefix);
+Records ListOne(RawEtcd& etcd, const std::string& prefix);
 
 // The records in transactions of kEtcdBatch puts, one after the other.
-void WriteBatches(Transport& t, const Records& records);
+void WriteBatches(RawEtcd& etcd, const Records& records);
 
 // A client for setting up and tidying, apart from the ones timed.
-GrpcTransport& EtcdAdmin();
+RawEtcd& EtcdAdmin();
 
 // The server's version, for the report.
 std::string EtcdVersion();

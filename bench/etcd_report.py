@@ -1,7 +1,6 @@
 #!/usr/bin/env python3
-"""Turns the etcd benchmarks' JSON output into tables: etcd_store_bench's
-into the library on the etcd store against raw etcd, each row a ratio with
-its target, and etcd_transport_bench's into gRPC against libcurl.
+"""Turns etcd_store_bench's JSON output into a table of the library on the
+etcd store against raw etcd, each row a ratio with its target.
 
 Each figure is the median over all repetitions found, pooled over the files
 given (several runs of bench/run --etcd), with the lowest and highest
@@ -18,8 +17,6 @@ from collections import defaultdict
 from report import print_table
 
 SCALE = {"ns": 1e-6, "us": 1e-3, "ms": 1.0, "s": 1e3}
-OPERATIONS = (("list, one reply", "BM_ListOne"), ("list, pages of 1,000", "BM_ListPaged"),
-              ("write, 100 txns of 100 puts", "BM_Write"))
 # The store's operations, each against what the same bytes cost through
 # etcd's own calls: (operation, store benchmark, raw benchmark, raw work).
 STORE_TARGET = 1.5
@@ -103,77 +100,14 @@ def store_table(runs):
     return headers, rows, notes
 
 
-def transport_table(runs):
-    """Rows of gRPC against libcurl, with the notes below them."""
-    headers = ("operation, 10,000 x 1,400 B", "transport", "elapsed ms: median (min-max)",
-               "client CPU ms", "etcd CPU ms", "reps", "curl / gRPC")
-    rows = []
-    for what, base in OPERATIONS:
-        grpc = None
-        for kind, transport in (("grpc", "gRPC"), ("curl", "libcurl + JSON gateway")):
-            name = f"{base}_{kind}"
-            real = values(runs, name, "real_time")
-            if not real:
-                rows.append((what, transport, "NOT RUN", "", "", "0", ""))
-                continue
-            m, text = spread(real)
-            cpu = values(runs, name, "cpu_time")
-            etcd = values(runs, name, "etcd_cpu_ms")
-            ratio = ""
-            if kind == "grpc":
-                grpc = m
-            elif grpc:
-                ratio = f"{m / grpc:.1f}x"
-            rows.append((what, transport, text,
-                         spread(cpu)[1] if cpu else "", spread(etcd)[1] if etcd else "",
-                         str(len(real)), ratio))
-    transfer = values(runs, "BM_CurlListTransferOnly", "real_time")
-    if transfer:
-        rows.append(("list, one reply: HTTP only, not parsed", "libcurl + JSON gateway",
-                     spread(transfer)[1],
-                     spread(values(runs, "BM_CurlListTransferOnly", "cpu_time"))[1],
-                     spread(values(runs, "BM_CurlListTransferOnly", "etcd_cpu_ms"))[1],
-                     str(len(transfer)), ""))
-
-    notes = []
-    for mode, label in (("one", "one reply"), ("paged", "pages of 1,000")):
-        for kind, transport in (("grpc", "gRPC"), ("curl", "libcurl")):
-            name = f"BM_PeakRss_{mode}_{kind}"
-            peak = values(runs, name, "peak_rss_kib")
-            rise = values(runs, name, "listing_rss_kib")
-            if peak:
-                notes.append(f"peak RSS, listing in {label}, {transport}: "
-                              f"{statistics.median(peak) / 1024:.1f} MiB, of which the listing "
-                              f"{statistics.median(rise) / 1024:.1f} MiB "
-                              f"(median of {len(peak)})")
-    connections = [c for base in ("BM_ListOne_curl", "BM_ListPaged_curl", "BM_Write_curl")
-                   for c in values(runs, base, "connections")]
-    if connections:
-        notes.append(f"connections libcurl opened in one repetition: at most {max(connections):.0f}")
-    reply = values(runs, "BM_CurlListTransferOnly", "reply_bytes")
-    if reply:
-        notes.append(f"JSON reply of the one-reply listing: {reply[0] / 1e6:.1f} MB")
-
-    return headers, rows, notes
-
-
 def main():
     args = sys.argv[1:]
     markdown = bool(args) and args[-1] == "markdown"
     if markdown:
         args = args[:-1]
     context, runs = load(args)
-    tables = []
-    if any(name.startswith("BM_Store") for name in runs):
-        tables.append(store_table(runs))
-    if any(name.startswith(("BM_ListOne", "BM_Write", "BM_PeakRss")) for name in runs):
-        tables.append(transport_table(runs))
-    for i, (headers, rows, notes) in enumerate(tables):
-        if i:
-            print()
-        last = i == len(tables) - 1
-        print_table(headers, rows, notes, context if last else {},
-                    ("etcd", "grpc", "libcurl", "num_cpus", "load_avg"), markdown)
+    headers, rows, notes = store_table(runs)
+    print_table(headers, rows, notes, context, ("etcd", "grpc", "num_cpus", "load_avg"), markdown)
 
 
 if __name__ == "__main__":

@@ -35,14 +35,14 @@ constexpr std::size_t kLookups = 1024;
 
 std::size_t N(const benchmark::State& state) { return static_cast<std::size_t>(state.range(0)); }
 
-// "/<kind>-<n>/\0", the root of the store at prefix "<kind>-<n>"
-// (EtcdLayout.h): the stores' roots and the raw copies' have the same length
-// for the same n, so their keys do too.
+// "/<kind>-<n>/" and a zero byte, the root under which the store of prefix
+// "<kind>-<n>" keeps its keys: the store's roots and the raw copies' have
+// the same length for the same n, so their keys do too.
 std::string Root(const char* kind, std::size_t n) {
-  return "/" + std::string(kind) + "-" + std::to_string(n) + "/" + '\0';
+  return "/" + std::string(kind) + "-" + std::to_string(n) + "/" + std::string(1, '\0');
 }
 
-// Makes the library's default store the etcd store under the root's prefix.
+// Makes the library's default store the etcd store with the root's prefix.
 void UseEtcdStore(const std::string& root) {
   const std::string locator = "etcd://" + EtcdEndpoint() + root.substr(0, root.size() - 2);
   setenv("TAVO_CONFIGSTORE_PATH", locator.c_str(), 1);
@@ -184,7 +184,7 @@ void BM_RawReplace(benchmark::State& state) {
     const Catalogue& c = FilledCatalogue(N(state));
     const std::string root = Root("kb-write", N(state));
     const Records records = Rerooted(c.policies.records, c.rawRoot, root);
-    GrpcTransport raw(EtcdEndpoint());
+    RawEtcd raw(EtcdEndpoint());
     WriteBatches(raw, records);
     {
       EtcdCpu etcd(state);
@@ -211,7 +211,7 @@ void BM_StoreList(benchmark::State& state) {
 void BM_RawList(benchmark::State& state) {
   Guarded(state, [&] {
     const RawCollection& policies = FilledCatalogue(N(state)).policies;
-    GrpcTransport raw(EtcdEndpoint());
+    RawEtcd raw(EtcdEndpoint());
     Expect(ListOne(raw, policies.prefix) == policies.records, "listing differs");
     EtcdCpu etcd(state);
     for (auto _ : state) benchmark::DoNotOptimize(ListOne(raw, policies.prefix));
@@ -232,7 +232,7 @@ void BM_StoreGetDbHash(benchmark::State& state) {
 void BM_RawListBoth(benchmark::State& state) {
   Guarded(state, [&] {
     const Catalogue& c = FilledCatalogue(N(state));
-    GrpcTransport raw(EtcdEndpoint());
+    RawEtcd raw(EtcdEndpoint());
     Expect(ListOne(raw, c.datastores.prefix) == c.datastores.records, "listing differs");
     EtcdCpu etcd(state);
     for (auto _ : state) {
@@ -264,15 +264,15 @@ void BM_RawBlobByName(benchmark::State& state) {
     const RawCollection& policies = FilledCatalogue(N(state)).policies;
     std::vector<std::string> keys;
     for (const std::string& name : SomeNames(N(state))) keys.push_back(policies.key.at(name));
-    GrpcTransport raw(EtcdEndpoint());
+    RawEtcd raw(EtcdEndpoint());
     Records one;
-    raw.Range(keys[0], std::string(), 0, 0, &one);
+    raw.Range(keys[0], std::string(), &one);
     Expect(one.size() == 1, "no such key");
     EtcdCpu etcd(state);
     std::size_t i = 0;
     for (auto _ : state) {
       Records out;
-      raw.Range(keys[i++ % keys.size()], std::string(), 0, 0, &out);
+      raw.Range(keys[i++ % keys.size()], std::string(), &out);
       benchmark::DoNotOptimize(out);
     }
   });
@@ -308,11 +308,11 @@ void BM_RawDefaultBlob(benchmark::State& state) {
   Guarded(state, [&] {
     const Catalogue& c = FilledCatalogue(N(state));
     const std::string& key = c.datastores.key.at(Datastores(N(state)).back().url);
-    GrpcTransport raw(EtcdEndpoint());
+    RawEtcd raw(EtcdEndpoint());
     EtcdCpu etcd(state);
     for (auto _ : state) {
       Records out;
-      raw.Range(key, std::string(), 0, 0, &out);
+      raw.Range(key, std::string(), &out);
       benchmark::DoNotOptimize(out);
       benchmark::DoNotOptimize(ListOne(raw, c.policies.prefix));
     }

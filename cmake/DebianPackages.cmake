@@ -1,5 +1,10 @@
-# `cpack -G DEB` makes one package per install component, each with its
-# -dbgsym.ddeb: libkarst1 (runtime), libkarst-dev (development) and karstctl.
+# `cpack -G DEB` makes one package per install component, each binary one
+# with its -dbgsym.ddeb: a runtime package per shared library, named after
+# its SONAME (libkarst1, libconfigstore2, libvelkcore1), libkarst-dev
+# (development) and karstctl. One package per library because their SONAMEs
+# change apart: libconfigstore's went to 2 when its object representation,
+# which its headers carried, changed, while libkarst's and libvelkcore's
+# interfaces stayed those of 1.0.0.
 
 set(KARST_MAINTAINER "libkarst developers <libkarst@lists.example.org>")
 set(CPACK_DEBIAN_PACKAGE_RELEASE 1)
@@ -29,23 +34,40 @@ string(REPLACE "\n\n" "\n.\n" KARST_LICENSE_TEXT " ${CMAKE_MATCH_2}")
 string(REPLACE "\n" "\n " KARST_LICENSE_TEXT "${KARST_LICENSE_TEXT}")
 configure_file(${debian}/copyright.in ${KARST_DEB_DOCS}/copyright @ONLY)
 
-# Any program built against this version runs with any later 1.x. The
-# shlibs file also sits in a package-like tree over the built libraries, so
-# dpkg-shlibdeps derives karstctl's dependency on libkarst1 from it.
+# A program built against this version runs with any later version of the
+# same SONAME. Each runtime package carries the shlibs line of its library;
+# all of them also sit in a package-like tree over the built libraries, so
+# dpkg-shlibdeps derives the packages' dependencies on one another from it.
+set(shlibs_root ${KARST_DEB_DOCS}/shlibs)
 set(shlibs "")
-foreach(lib IN ITEMS karst configstore velkcore)
-  string(APPEND shlibs "lib${lib} ${PROJECT_VERSION_MAJOR} libkarst${PROJECT_VERSION_MAJOR} (>= ${PROJECT_VERSION})\n")
+set(components "")
+set(packages "")
+foreach(lib IN LISTS KARST_SHARED_LIBRARIES)
+  set(package lib${lib}${KARST_SOVERSION_${lib}})
+  set(line "lib${lib} ${KARST_SOVERSION_${lib}} ${package} (>= ${PROJECT_VERSION})\n")
+  string(APPEND shlibs "${line}")
+  file(WRITE ${KARST_DEB_DOCS}/${package}/shlibs "${line}")
+  string(TOUPPER lib${lib} upper)
+  set(CPACK_DEBIAN_${upper}_PACKAGE_SECTION libs)
+  set(CPACK_DEBIAN_${upper}_PACKAGE_CONTROL_EXTRA ${KARST_DEB_DOCS}/${package}/shlibs
+    ${debian}/triggers)
+  list(APPEND components lib${lib})
+  list(APPEND packages ${package})
 endforeach()
-set(shlibs_root ${KARST_DEB_DOCS}/libkarst${PROJECT_VERSION_MAJOR})
 file(WRITE ${shlibs_root}/DEBIAN/shlibs "${shlibs}")
 get_filename_component(libdir_parent ${shlibs_root}/${CMAKE_INSTALL_LIBDIR} DIRECTORY)
 file(MAKE_DIRECTORY ${libdir_parent})
 file(CREATE_LINK ${PROJECT_BINARY_DIR}/${CMAKE_INSTALL_LIBDIR} ${shlibs_root}/${CMAKE_INSTALL_LIBDIR}
   SYMBOLIC)
 set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS_PRIVATE_DIRS ${shlibs_root}/${CMAKE_INSTALL_LIBDIR})
+# Release 1.0.0 shipped all three libraries in one package, libkarst1:
+# libvelkcore1 takes libvelkcore.so.1 over from it, and libkarst1 itself
+# no longer holds libconfigstore.so.1.
+set(CPACK_DEBIAN_LIBVELKCORE_PACKAGE_BREAKS "libkarst1 (<< 1.1.0)")
+set(CPACK_DEBIAN_LIBVELKCORE_PACKAGE_REPLACES "libkarst1 (<< 1.1.0)")
 
-set(components runtime development)
-set(packages libkarst${PROJECT_VERSION_MAJOR} libkarst-dev)
+list(APPEND components development)
+list(APPEND packages libkarst-dev)
 if(KARST_BUILD_TOOLS)
   list(APPEND components karstctl)
   list(APPEND packages karstctl)
@@ -73,25 +95,27 @@ set(CPACK_PACKAGING_INSTALL_PREFIX /usr)
 set(CPACK_DEBIAN_PACKAGE_CONTROL_STRICT_PERMISSION ON)
 # Stripped binaries; their debug symbols go into -dbgsym.ddeb packages.
 set(CPACK_DEBIAN_DEBUGINFO_PACKAGE ON)
-# dpkg-shlibdeps derives the SQLite and C++ runtime dependencies, and
-# karstctl's on libkarst1, from the binaries and our shlibs file.
+# dpkg-shlibdeps derives the SQLite, gRPC and C++ runtime dependencies, and
+# those on our own libraries, from the binaries and our shlibs files.
 set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
 
-set(CPACK_DEBIAN_RUNTIME_PACKAGE_SECTION libs)
-set(CPACK_DEBIAN_RUNTIME_PACKAGE_CONTROL_EXTRA ${shlibs_root}/DEBIAN/shlibs ${debian}/triggers)
-set(CPACK_DEBIAN_RUNTIME_DESCRIPTION "storage policy and datastore catalogue library
+set(CPACK_DEBIAN_LIBKARST_DESCRIPTION "storage policy and datastore catalogue library
 libkarst keeps a host's catalogue of storage policies and of the datastores
 that use them in the host's configuration store: it replaces either catalogue
 as a whole, lists it, fetches the blob a policy holds for a namespace, and
-gives short digests that tell whether a copy of a catalogue is stale.
-
-This package holds the shared libraries libkarst, libconfigstore (a
-transactional object store backed by SQLite) and libvelkcore (exceptions and
-string helpers).")
+gives short digests that tell whether a copy of a catalogue is stale.")
+set(CPACK_DEBIAN_LIBCONFIGSTORE_DESCRIPTION "transactional configuration object store
+libconfigstore keeps a host's configuration as objects of named values and
+sub-objects, in collections, with nested transactions: in a SQLite file
+(safe across processes, the default), in an etcd cluster shared by hosts,
+or in memory. libkarst keeps its catalogues in it.")
+set(CPACK_DEBIAN_LIBVELKCORE_DESCRIPTION "core exception and string helpers of the catalogue libraries
+libvelkcore holds the exception type that libconfigstore's and libkarst's
+errors derive from, and the string formatting helpers they share.")
 
 set(CPACK_DEBIAN_DEVELOPMENT_PACKAGE_SECTION libdevel)
 set(CPACK_DEBIAN_ENABLE_COMPONENT_DEPENDS ON)
-set(CPACK_COMPONENT_DEVELOPMENT_DEPENDS runtime)
+set(CPACK_COMPONENT_DEVELOPMENT_DEPENDS libvelkcore libconfigstore libkarst)
 set(CPACK_DEBIAN_DEVELOPMENT_DESCRIPTION "storage policy and datastore catalogue library - development files
 libkarst keeps a host's catalogue of storage policies and of the datastores
 that use them in the host's configuration store.

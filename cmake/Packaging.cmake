@@ -3,10 +3,15 @@
 
 include(CMakePackageConfigHelpers)
 
-install(TARGETS velkcore configstore karst
-  EXPORT karstTargets
-  LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT runtime NAMELINK_COMPONENT development
-  INCLUDES DESTINATION ${CMAKE_INSTALL_INCLUDEDIR})
+# Each shared library is a component of its own, so that each goes into a
+# runtime package named after its SONAME.
+foreach(lib IN LISTS KARST_SHARED_LIBRARIES)
+  install(TARGETS ${lib}
+    EXPORT karstTargets
+    LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT lib${lib}
+      NAMELINK_COMPONENT development
+    INCLUDES DESTINATION ${CMAKE_INSTALL_INCLUDEDIR})
+endforeach()
 install(DIRECTORY include/TavoKarst DESTINATION ${CMAKE_INSTALL_INCLUDEDIR}
   COMPONENT development)
 install(DIRECTORY platform/configstore/include/TavoConfigStore

@@ -6,8 +6,7 @@
 #include <vector>
 
 #include "Errors.h"
-#include "JsonCodec.h"
-#include "JsonText.h"
+#include "Json.h"
 
 namespace karst_fuzz {
 

@@ -5,8 +5,7 @@
 
 #include <gtest/gtest.h>
 
-#include "Base64.h"
-#include "Utf8.h"
+#include "Json.h"
 
 namespace karstctl {
 namespace {

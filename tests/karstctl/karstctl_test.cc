@@ -564,7 +564,7 @@ TEST_F(Karstctl, HelpAndVersionNeedNoStore) {
   }
   EXPECT_EQ(columns.size(), 1u) << help.out;
   EXPECT_EQ(columns.count(std::string::npos), 0u) << help.out;
-  EXPECT_EQ(RunTool({"--store", dir_.Path(), "--version"}).out, "karstctl 1.0.0\n");
+  EXPECT_EQ(RunTool({"--store", dir_.Path(), "--version"}).out, "karstctl 1.1.0\n");
 
   // The help, the manual page and the completion know every command and option.
   std::string man = ReadFile(KARSTCTL_SOURCE_DIR "/karstctl.1");

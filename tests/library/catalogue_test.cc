@@ -18,13 +18,11 @@ class CatalogueTest : public ::testing::TestWithParam<std::string> {
  protected:
   // Where the store is, for the default store and for a second connection.
   std::string Locator() {
-    if (GetParam() == "sqlite") return dir_.File("store.db");
-    if (!etcd_) etcd_ = std::make_unique<EtcdCluster>();
-    return etcd_->Locator("catalogue");
+    return GetParam() == "sqlite" ? dir_.File("store.db")
+                                  : SharedEtcdCluster().Locator("catalogue");
   }
 
   ScratchDir dir_;
-  std::unique_ptr<EtcdCluster> etcd_;
 };
 
 TEST_P(CatalogueTest, RoundTripsEveryByteAndASecondConnectionSeesIt) {

@@ -77,17 +77,14 @@ TEST(DbHashTest, TextOfOneRecord) {
       {Policy("a", "i", {{std::string("b\0", 2), std::string("n\0", 2)}}, "", 0),
        std::string("ai0n\0b\0", 7)},
   };
-  // A policy's blobs are put in order on the stack up to eight, past that on
-  // the heap; here they come in reverse.
-  for (int count : {8, 9}) {
-    std::vector<TavoKarst::KarstPolicyBlob> blobs;
-    std::string text = "mi0";
-    for (int i = 0; i < count; ++i) {
-      blobs.insert(blobs.begin(), {"b" + std::to_string(i), "n" + std::to_string(i)});
-      text += "n" + std::to_string(i) + "b" + std::to_string(i);
-    }
-    policies.push_back({Policy("m", "i", blobs, "", 0), text});
+  // Many blobs, given in reverse.
+  std::vector<TavoKarst::KarstPolicyBlob> blobs;
+  std::string text = "mi0";
+  for (int i = 10; i < 30; ++i) {
+    blobs.insert(blobs.begin(), {"b" + std::to_string(i), "n" + std::to_string(i)});
+    text += "n" + std::to_string(i) + "b" + std::to_string(i);
   }
+  policies.push_back({Policy("m", "i", blobs, "", 0), text});
   for (const auto& [policy, text] : policies) {
     KarstLib::AddPolicyInfo({policy});
     EXPECT_EQ(KarstLib::GetDbHash().first, Crc32Hex(Crc32Hex(text)))

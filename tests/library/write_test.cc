@@ -1,5 +1,5 @@
-// Replacing and resetting the catalogue on the in-memory store: the store
-// calls made, the stored layout, and what reaches the caller when a call fails.
+// Replacing and resetting the catalogue on the in-memory store: the stored
+// layout, and what reaches the caller when a call fails.
 
 #include <gtest/gtest.h>
 
@@ -15,7 +15,6 @@ namespace {
 
 using TavoConfigStore::ConfigStoreException;
 using TavoKarst::KarstLib;
-using Calls = std::vector<std::string>;
 
 const Catalogue kOld = {{Policy("old-a", "p-a", {{"A", "CORRA"}}), Policy("old-b", "p-b")},
                         {Datastore("ds://old", "CORRA", "p-b")}};
@@ -35,13 +34,9 @@ class WriteTest : public ::testing::Test {
   ScopedFaultStore store_{memory_};
 };
 
-// What each collection holds afterwards, and that the other one is left
-// alone, the fault sweep below checks; an empty list must clear too.
-TEST_F(WriteTest, ReplaceIsOneTransactionOverItsOwnCollection) {
-  KarstLib::AddPolicyInfo(kNew.policies);
-  EXPECT_EQ(store_->Calls(StoreOperations()),
-            (Calls{"BeginTransaction", "DeleteObjects", "SetObject", "SetObject", "SetObject",
-                   "CommitTransaction"}));
+// What each collection holds after a replace, and that the other one is
+// left alone, the fault sweep below checks; an empty list must clear too.
+TEST_F(WriteTest, AnEmptyListClearsTheCollection) {
   KarstLib::AddDatastoreInfo({});
   EXPECT_TRUE(KarstLib::ListDatastoreInfo().empty());
 }
@@ -101,15 +96,13 @@ TEST_F(WriteTest, AStoreErrorReachesTheCallerAsACopyAndOthersUnchanged) {
   } catch (const Velk::Lib::VelkException& e) {
     EXPECT_EQ(dynamic_cast<const ConfigStoreException*>(&e), nullptr) << "made a store error";
   }
-  EXPECT_EQ(store_->Calls(StoreOperations()), (Calls{"BeginTransaction", "DeleteObjects"}));
 }
 
 TEST_F(WriteTest, ResetIgnoresFailedDeletionsButNotAFailedBegin) {
-  // Both deletions fail: the second is still tried, and the rest committed.
-  store_->Fail("DeleteObjects", 1, FaultKind::kStoreErrorFromThenOn);
+  // The first deletion fails: the other is still made, and committed.
+  store_->Fail("DeleteObjects", 1, FaultKind::kStoreErrorOnce);
   EXPECT_NO_THROW(KarstLib::Reset());
-  EXPECT_EQ(store_->Calls(StoreOperations()),
-            (Calls{"BeginTransaction", "DeleteObjects", "DeleteObjects", "CommitTransaction"}));
+  EXPECT_NE(KarstLib::ListPolicyInfo().empty(), KarstLib::ListDatastoreInfo().empty());
   // The sweep lets a returning Reset pass, so it misses a swallowed failed begin.
   store_->ClearFaults();
   store_->Fail("BeginTransaction", 1, FaultKind::kStoreErrorFromThenOn);

@@ -5,7 +5,6 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <malloc.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -27,82 +26,33 @@
 #include "FaultVfs.h"
 #include "Files.h"
 #include "RawSqlite.h"
+#include "StoreObjects.h"
 #include "TavoConfigStore/ConfigStore.h"
 
 namespace TavoConfigStore {
 namespace {
 
+using karst_test::CodeOf;
+using karst_test::Describe;
+using karst_test::Dump;
+using karst_test::Filter;
+using karst_test::List;
+using karst_test::Obj;
 using karst_test::RawDb;
 using karst_test::ReadFile;
+using karst_test::Set;
 using karst_test::WriteFile;
 using ::testing::ElementsAre;
 using ::testing::ElementsAreArray;
-
-// An object, or a filter, with that identifier.
-template <typename T = ConfigStoreObject>
-std::shared_ptr<T> Obj(const std::string& key = "", const std::string& group = "",
-                       const std::string& component = "", const std::string& instance = "") {
-  return std::make_shared<T>(ConfigStoreObjectId(key, group, component, instance));
-}
-const auto Filter = [](const auto&... parts) { return Obj<FilterSpecObject>(parts...); };
-
-void Set(ConfigStore& store, const std::shared_ptr<ConfigStoreObject>& object) {
-  std::int32_t flags = 0;
-  store.SetObject(object, flags);
-}
-
-// The whole of an object, every byte in order, for exact comparisons.
-std::string Describe(const ConfigStoreObject& o) {
-  const ConfigStoreObjectId& id = o.Id();
-  std::string out = id.Key() + "|" + id.Group() + "|" + id.Component() + "|" + id.InstanceId();
-  auto values = [&out](const StoreObject& s) {
-    for (const StoreValue& v : s.Values()) {
-      const auto* str = std::get_if<std::string>(&v.value);
-      out += " " + v.name + (str ? "=s" + *str : "=i" + std::to_string(std::get<1>(v.value)));
-    }
-  };
-  values(o);
-  for (const SubObjectEntry& e : o.SubObjects()) {
-    out += " [" + e.id.Array() + "/" + e.id.Key();
-    values(*e.object);
-  }
-  return out;
-}
-
-// The store's whole state, in order.
-std::vector<std::string> Dump(ConfigStore& store) {
-  std::vector<std::string> out;
-  for (const auto& o : store.GetObjects(Filter())) out.push_back(Describe(*o));
-  return out;
-}
-
-// The instance ids the filter lists, in order.
-std::vector<std::string> List(ConfigStore& store,
-                              const std::shared_ptr<FilterSpecObject>& f = Filter()) {
-  std::vector<std::string> out;
-  for (const auto& o : store.GetObjects(f)) out.push_back(o->Id().InstanceId());
-  return out;
-}
-
-// The code of the ConfigStoreException "f" throws, or 0 when it returns.
-template <typename F>
-std::int32_t CodeOf(F&& f) {
-  try {
-    f();
-  } catch (const ConfigStoreException& e) {
-    return e.Code();
-  }
-  return 0;
-}
 
 class StoreConformance : public ::testing::TestWithParam<std::string> {
  protected:
   void SetUp() override {
     if (GetParam() == "etcd") {
-      // One cluster for the suite, a catalogue of its own for each test.
-      static karst_test::EtcdCluster etcd;
+      // A catalogue of its own for each test.
       static int tests = 0;
-      store_ = OpenStore(etcd.Locator("conformance" + std::to_string(++tests)));
+      store_ = OpenStore(
+          karst_test::SharedEtcdCluster().Locator("conformance" + std::to_string(++tests)));
     } else {
       store_ = GetParam() == "memory" ? NewMemoryStore() : NewSqliteStore(dir_.File("store.db"));
     }
@@ -153,7 +103,7 @@ TEST_P(StoreConformance, ValuesAndSubObjectsRoundTripByteExact) {
   o->SetValue("max", static_cast<long long>(LLONG_MAX));
   o->SetValue("kind", std::string("was a string"));
   o->SetValue("kind", -1LL);  // changes kind, keeps its place
-  // More sub-objects than are built when an object is read.
+  // Many sub-objects in two arrays.
   for (int i = 0; i < 20; ++i) {
     auto sub = o->CreateSubObject(SubObjectId(i % 3 ? "blobs" : "other", "s" + std::to_string(i)));
     sub->SetValue("blob", std::string(i, static_cast<char>(i)));
@@ -161,7 +111,7 @@ TEST_P(StoreConformance, ValuesAndSubObjectsRoundTripByteExact) {
   }
   o->CreateSubObject(SubObjectId(std::string("a\0", 2), "\xff"))->SetValue("v", big);
   o->CreateSubObject(SubObjectId("blobs", "s2"))->SetValue("replaced", 1LL);  // in s2's place
-  // More values than a new object appends to its own encoding.
+  // Many values in one sub-object, one set again.
   auto many = o->CreateSubObject(SubObjectId("many", ""));
   for (long long v = 0; v < 200; ++v) many->SetValue(("v" + std::to_string(v)).c_str(), v);
   many->SetValue("v3", std::string("set again"));
@@ -737,20 +687,6 @@ TEST_F(SqliteStoreTest, ThreadsMayReadObjectsTogether) {
   }
   for (auto& thread : threads) thread.join();
   EXPECT_EQ(wrong, 0);
-}
-
-// An object read alone may be kept for long: it holds its own bytes, not a
-// block sized for the objects of a listing.
-TEST_F(SqliteStoreTest, ObjectsReadAloneHoldOnlyTheirOwnBytes) {
-  auto store = NewSqliteStore(Path());
-  const auto written = Sample("kept");
-  Set(*store, written);
-  const std::size_t before = mallinfo2().uordblks;
-  std::vector<std::shared_ptr<ConfigStoreObject>> kept;
-  for (int i = 0; i < 200; ++i) kept.push_back(store->GetObject(written->Id()));
-  // About 0.5 KiB each; a 64 KiB block each would be 12.5 MiB.
-  EXPECT_LT(mallinfo2().uordblks - before, std::size_t{1} << 20);
-  EXPECT_EQ(Describe(*kept.back()), Describe(*written));
 }
 
 // GetStore's per-thread connection follows TAVO_CONFIGSTORE_PATH. A

@@ -18,6 +18,7 @@
 #include "EtcdCluster.h"
 #include "EtcdKeys.h"
 #include "Records.h"
+#include "StoreObjects.h"
 #include "TavoConfigStore/ConfigStore.h"
 #include "TavoConfigStore/EtcdStore.h"
 #include "TavoKarst/KarstLib.h"
@@ -27,37 +28,21 @@ namespace {
 
 using karst_test::EtcdCluster;
 using karst_test::EtcdKeys;
+using karst_test::Filter;
+using karst_test::SharedEtcdCluster;
 using karst_test::StoreRoot;
-
-EtcdCluster& SharedCluster() {
-  static EtcdCluster cluster;
-  return cluster;
-}
+using karst_test::Valued;
+using karst_test::ValuesOf;
 
 std::shared_ptr<ConfigStore> StoreAt(const std::string& prefix) {
   EtcdStoreOptions options;
-  options.endpoints = {SharedCluster().Endpoint(0)};
+  options.endpoints = {SharedEtcdCluster().Endpoint(0)};
   options.prefix = prefix;
   return NewEtcdStore(options);
 }
 
 void Set(ConfigStore& store, const std::string& instance, const std::string& value) {
-  auto object = std::make_shared<ConfigStoreObject>(ConfigStoreObjectId("k", "g", "c", instance));
-  object->SetValue("v", value);
-  std::int32_t flags = 0;
-  store.SetObject(object, flags);
-}
-
-// "instance=value" of each object of the store, in order.
-std::vector<std::string> Dump(ConfigStore& store) {
-  std::vector<std::string> out;
-  auto all = std::make_shared<FilterSpecObject>(ConfigStoreObjectId("", "", ""));
-  for (const auto& o : store.GetObjects(all)) {
-    std::string v;
-    o->GetValue("v", &v);
-    out.push_back(o->Id().InstanceId() + "=" + v);
-  }
-  return out;
+  karst_test::Set(store, Valued(instance, value));
 }
 
 std::string Printable(const std::string& bytes) {
@@ -84,7 +69,7 @@ TEST(EtcdLayoutTest, NeighbouringStoresKeepToTheirOwnKeys) {
                                              std::string("m/\0p/", 5),
                                              "m/\1",
                                              "m/\1\1"};
-  const EtcdKeys raw(SharedCluster().Endpoint(0));
+  const EtcdKeys raw(SharedEtcdCluster().Endpoint(0));
   const std::string dead = "0123456789abcdef";
   for (const std::string& prefix : prefixes) {
     const std::string root = StoreRoot(prefix);
@@ -98,8 +83,7 @@ TEST(EtcdLayoutTest, NeighbouringStoresKeepToTheirOwnKeys) {
       auto store = StoreAt(prefix);
       for (int round = 0; round < 4; ++round) {
         store->BeginTransaction();
-        store->DeleteObjects(
-            std::make_shared<FilterSpecObject>(ConfigStoreObjectId("k", "g", "c")));
+        store->DeleteObjects(Filter("k", "g", "c"));
         for (int i = 0; i <= round; ++i) Set(*store, "o" + std::to_string(i), prefix);
         store->CommitTransaction();
         Set(*store, "last", prefix + std::to_string(round));  // in place
@@ -110,7 +94,7 @@ TEST(EtcdLayoutTest, NeighbouringStoresKeepToTheirOwnKeys) {
 
   for (const std::string& prefix : prefixes) {
     SCOPED_TRACE(Printable(prefix));
-    EXPECT_EQ(Dump(*StoreAt(prefix)),
+    EXPECT_EQ(ValuesOf(*StoreAt(prefix)),
               (std::vector<std::string>{"o0=" + prefix, "o1=" + prefix, "o2=" + prefix,
                                         "o3=" + prefix, "last=" + prefix + "3"}));
     EXPECT_THAT(raw.List(StoreRoot(prefix) + "g/" + dead), ::testing::IsEmpty());
@@ -124,9 +108,9 @@ TEST(EtcdLayoutTest, NeighbouringStoresKeepToTheirOwnKeys) {
 
   // A store cleared leaves its neighbours as they were.
   auto m = StoreAt("m");
-  m->DeleteObjects(std::make_shared<FilterSpecObject>(ConfigStoreObjectId("k", "g", "c")));
-  EXPECT_THAT(Dump(*m), ::testing::IsEmpty());
-  EXPECT_EQ(Dump(*StoreAt("m/r")).size(), 5u);
+  m->DeleteObjects(Filter("k", "g", "c"));
+  EXPECT_THAT(ValuesOf(*m), ::testing::IsEmpty());
+  EXPECT_EQ(ValuesOf(*StoreAt("m/r")).size(), 5u);
 }
 
 // The keys and values of the fixture, in the order they were written.
@@ -170,7 +154,7 @@ std::vector<std::string> OldKeys(const EtcdKeys& raw) {
 }
 
 TEST(EtcdLayoutTest, AnEarlierLayoutIsReadInPlaceAndMovedByTheFirstWrite) {
-  const EtcdKeys raw(SharedCluster().Endpoint(0));
+  const EtcdKeys raw(SharedEtcdCluster().Endpoint(0));
   std::vector<std::string> nestedKeys;
   for (const auto& [key, value] : LegacyFixture()) {
     raw.Put(key, value);

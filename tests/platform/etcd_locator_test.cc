@@ -12,6 +12,7 @@
 #include <string>
 
 #include "Files.h"
+#include "StoreObjects.h"
 #include "TavoConfigStore/ConfigStore.h"
 #include "TavoConfigStore/EtcdStore.h"
 
@@ -86,10 +87,7 @@ TEST(StoreLocatorTest, PathsAndEtcdLocatorsOnlyAndNoMessageShowsThePassword) {
   // A path is a path, and the store's own messages hide its password too.
   karst_test::WriteFile("file", "");
   try {
-    std::int32_t flags = 0;
-    OpenStore("file/u:cret@h/store.db")
-        ->SetObject(std::make_shared<ConfigStoreObject>(ConfigStoreObjectId("k", "g", "c", "i")),
-                    flags);
+    karst_test::Set(*OpenStore("file/u:cret@h/store.db"), karst_test::Obj("k", "g", "c", "i"));
     ADD_FAILURE() << "a store under a file was written";
   } catch (const ConfigStoreException& e) {
     EXPECT_EQ(e.Message(),

@@ -24,6 +24,7 @@
 #include "EtcdKeys.h"
 #include "Files.h"
 #include "Records.h"
+#include "StoreObjects.h"
 #include "TavoConfigStore/ConfigStore.h"
 #include "TavoConfigStore/EtcdStore.h"
 #include "TavoKarst/KarstLib.h"
@@ -31,40 +32,20 @@
 namespace TavoConfigStore {
 namespace {
 
+using karst_test::ErrorOf;
 using karst_test::EtcdCluster;
 using karst_test::EtcdKeys;
 using karst_test::EtcdOptions;
+using karst_test::Filter;
+using karst_test::Set;
+using karst_test::SharedEtcdCluster;
 using karst_test::StoreRoot;
+using karst_test::Valued;
+using karst_test::ValuesOf;
 using Clock = std::chrono::steady_clock;
 
-std::shared_ptr<ConfigStoreObject> Obj(const std::string& instance, const std::string& value = "",
-                                       const std::string& key = "k") {
-  auto o = std::make_shared<ConfigStoreObject>(ConfigStoreObjectId(key, "g", "c", instance));
-  o->SetValue("v", value);
-  return o;
-}
-
-void Set(ConfigStore& store, const std::shared_ptr<ConfigStoreObject>& object) {
-  std::int32_t flags = 0;
-  store.SetObject(object, flags);
-}
-
-// "instance=value" of each object the filter lists, in order; with a key,
-// of the one collection that key, "g" and "c" name.
-std::vector<std::string> Dump(ConfigStore& store, const std::string& key = "") {
-  std::vector<std::string> out;
-  auto filter = std::make_shared<FilterSpecObject>(
-      key.empty() ? ConfigStoreObjectId("", "", "") : ConfigStoreObjectId(key, "g", "c"));
-  for (const auto& o : store.GetObjects(filter)) {
-    std::string v;
-    o->GetValue("v", &v);
-    out.push_back(o->Id().InstanceId() + "=" + v);
-  }
-  return out;
-}
-
 void Clear(ConfigStore& store, const std::string& key = "k") {
-  store.DeleteObjects(std::make_shared<FilterSpecObject>(ConfigStoreObjectId(key, "g", "c")));
+  store.DeleteObjects(Filter(key, "g", "c"));
 }
 
 // The keys etcd holds under "area" of the store at "prefix".
@@ -75,22 +56,6 @@ std::vector<std::string> RawKeys(const EtcdCluster& etcd, const std::string& pre
     keys.push_back(kv.first);
   }
   return keys;
-}
-
-template <typename F>
-ConfigStoreException ErrorOf(F&& f) {
-  try {
-    f();
-  } catch (const ConfigStoreException& e) {
-    return e;
-  }
-  ADD_FAILURE() << "no ConfigStoreException";
-  return ConfigStoreException("none", 0);
-}
-
-EtcdCluster& SharedCluster() {
-  static EtcdCluster cluster;
-  return cluster;
 }
 
 std::vector<TavoKarst::KarstPolicyInfo> Catalogue(int count, long long generation) {
@@ -111,7 +76,7 @@ std::vector<TavoKarst::KarstPolicyInfo> Catalogue(int count, long long generatio
 // them: every listing is one whole catalogue, and nothing of the writes but
 // the current generation stays behind.
 TEST(EtcdStoreTest, LargeReplacesAreAllOrNothingForReaders) {
-  EtcdCluster& etcd = SharedCluster();
+  EtcdCluster& etcd = SharedEtcdCluster();
   SetGlobalStore(OpenStore(etcd.Locator("large")));
   TavoKarst::KarstLib::AddPolicyInfo(Catalogue(10000, 1));
 
@@ -120,7 +85,7 @@ TEST(EtcdStoreTest, LargeReplacesAreAllOrNothingForReaders) {
   std::atomic<int> torn{0};
   std::thread reader([&] {
     auto store = OpenStore(etcd.Locator("large"));
-    auto filter = std::make_shared<FilterSpecObject>(ConfigStoreObjectId("karst_policies", "", ""));
+    auto filter = Filter("karst_policies");
     while (!done) {
       const auto objects = store->GetObjects(filter);
       long long first = -1;
@@ -151,17 +116,17 @@ TEST(EtcdStoreTest, LargeReplacesAreAllOrNothingForReaders) {
 // commit that changes the first and the last object together, in place,
 // while listings run must never be seen half applied.
 TEST(EtcdStoreTest, ListingsInHalvesAreOneSnapshot) {
-  const std::string locator = SharedCluster().Locator("halves");
+  const std::string locator = SharedEtcdCluster().Locator("halves");
   auto writer = OpenStore(locator);
   const int objects = 600;
   writer->BeginTransaction();
-  for (int i = 0; i < objects; ++i) Set(*writer, Obj("o" + std::to_string(1000 + i), "0"));
+  for (int i = 0; i < objects; ++i) Set(*writer, Valued("o" + std::to_string(1000 + i), "0"));
   writer->CommitTransaction();
 
   auto change = [&](int n) {
     writer->BeginTransaction();
-    Set(*writer, Obj("o1000", std::to_string(n)));
-    Set(*writer, Obj("o" + std::to_string(1000 + objects - 1), std::to_string(n)));
+    Set(*writer, Valued("o1000", std::to_string(n)));
+    Set(*writer, Valued("o" + std::to_string(1000 + objects - 1), std::to_string(n)));
     writer->CommitTransaction();
   };
   change(1);
@@ -173,7 +138,7 @@ TEST(EtcdStoreTest, ListingsInHalvesAreOneSnapshot) {
   int torn = 0;
   int misordered = 0;
   for (int listing = 0; listing < 150; ++listing) {
-    const std::vector<std::string> seen = Dump(*reader, "k");
+    const std::vector<std::string> seen = ValuesOf(*reader, Filter("k", "g", "c"));
     if (seen.size() != static_cast<std::size_t>(objects)) {
       ++torn;
       continue;
@@ -194,41 +159,41 @@ TEST(EtcdStoreTest, ListingsInHalvesAreOneSnapshot) {
 // A 10 MiB value is stored in parts, each under etcd's request limit, and
 // comes back byte for byte, in place of a smaller object and replaced again.
 TEST(EtcdStoreTest, ValuesLargerThanARequestRoundTrip) {
-  auto store = OpenStore(SharedCluster().Locator("parts"));
+  auto store = OpenStore(SharedEtcdCluster().Locator("parts"));
   std::string big(10 << 20, '\0');
   for (std::size_t i = 0; i < big.size(); ++i) big[i] = static_cast<char>(i * 7919 >> 5);
-  Set(*store, Obj("small", "x"));
+  Set(*store, Valued("small", "x"));
   for (const std::string& value : {big, std::string("short again"), big + "tail"}) {
-    Set(*store, Obj("big", value));
+    Set(*store, Valued("big", value));
     std::string read;
     store->GetObject(ConfigStoreObjectId("k", "g", "c", "big"))->GetValue("v", &read);
     EXPECT_TRUE(read == value) << "size " << read.size() << " of " << value.size();
-    EXPECT_EQ(Dump(*store).size(), 2u);
+    EXPECT_EQ(ValuesOf(*store).size(), 2u);
   }
 }
 
 // A transaction that read a collection fails if another writer changed it
 // before the commit; one that only replaced it is applied to the new state.
 TEST(EtcdStoreTest, RacingWritersConflictOnlyWhenWhatTheyReadChanged) {
-  const std::string locator = SharedCluster().Locator("race");
+  const std::string locator = SharedEtcdCluster().Locator("race");
   auto mine = OpenStore(locator);
   auto other = OpenStore(locator);
-  Set(*mine, Obj("a", "0"));
+  Set(*mine, Valued("a", "0"));
 
   mine->BeginTransaction();
-  EXPECT_EQ(Dump(*mine), std::vector<std::string>{"a=0"});
-  Set(*other, Obj("a", "other"));
-  Set(*mine, Obj("a", "mine"));
+  EXPECT_EQ(ValuesOf(*mine), std::vector<std::string>{"a=0"});
+  Set(*other, Valued("a", "other"));
+  Set(*mine, Valued("a", "mine"));
   EXPECT_EQ(ErrorOf([&] { mine->CommitTransaction(); }).Code(), kErrorConflict);
   mine->AbortTransaction();
-  EXPECT_EQ(Dump(*other), std::vector<std::string>{"a=other"});
+  EXPECT_EQ(ValuesOf(*other), std::vector<std::string>{"a=other"});
 
   mine->BeginTransaction();
   Clear(*mine);
-  Set(*mine, Obj("b", "mine"));
-  Set(*other, Obj("c", "other"));  // lands between, and is replaced
+  Set(*mine, Valued("b", "mine"));
+  Set(*other, Valued("c", "other"));  // lands between, and is replaced
   mine->CommitTransaction();
-  EXPECT_EQ(Dump(*other), std::vector<std::string>{"b=mine"});
+  EXPECT_EQ(ValuesOf(*other), std::vector<std::string>{"b=mine"});
 }
 
 // A reader asks for the generation it read last together with the pointer.
@@ -236,7 +201,7 @@ TEST(EtcdStoreTest, RacingWritersConflictOnlyWhenWhatTheyReadChanged) {
 // removed it, the reader's look-ups and listings show that, not what it read
 // before.
 TEST(EtcdStoreTest, ReadersFollowAnotherWritersNewGeneration) {
-  const std::string locator = SharedCluster().Locator("follow");
+  const std::string locator = SharedEtcdCluster().Locator("follow");
   auto reader = OpenStore(locator);
   auto writer = OpenStore(locator);
   auto value = [&](const std::string& instance) {
@@ -245,23 +210,14 @@ TEST(EtcdStoreTest, ReadersFollowAnotherWritersNewGeneration) {
     if (o) o->GetValue("v", &v);
     return v;
   };
-  auto listing = [&] {
-    std::vector<std::string> out;
-    auto filter = std::make_shared<FilterSpecObject>(ConfigStoreObjectId("k", "g", "c"));
-    for (const auto& o : reader->GetObjects(filter)) {
-      std::string v;
-      o->GetValue("v", &v);
-      out.push_back(o->Id().InstanceId() + "=" + v);
-    }
-    return out;
-  };
-  Set(*writer, Obj("a", "1"));
+  auto listing = [&] { return ValuesOf(*reader, Filter("k", "g", "c")); };
+  Set(*writer, Valued("a", "1"));
   EXPECT_EQ(value("a"), "1");
   EXPECT_EQ(listing(), std::vector<std::string>{"a=1"});
 
   writer->BeginTransaction();
   Clear(*writer);
-  Set(*writer, Obj("b", "2"));
+  Set(*writer, Valued("b", "2"));
   writer->CommitTransaction();
   EXPECT_EQ(value("a"), "absent");
   EXPECT_EQ(value("b"), "2");
@@ -270,7 +226,7 @@ TEST(EtcdStoreTest, ReadersFollowAnotherWritersNewGeneration) {
   Clear(*writer);
   EXPECT_EQ(value("b"), "absent");
   EXPECT_THAT(listing(), ::testing::IsEmpty());
-  Set(*writer, Obj("c", "3"));
+  Set(*writer, Valued("c", "3"));
   EXPECT_EQ(listing(), std::vector<std::string>{"c=3"});
   EXPECT_EQ(value("c"), "3");
 }
@@ -278,9 +234,9 @@ TEST(EtcdStoreTest, ReadersFollowAnotherWritersNewGeneration) {
 // A writer that dies mid-replace leaves a generation nobody points at; once
 // its lease is gone the next writer removes it, and readers never saw it.
 TEST(EtcdStoreTest, ADeadWritersGenerationIsRemovedByTheNextWriter) {
-  EtcdCluster& etcd = SharedCluster();
+  EtcdCluster& etcd = SharedEtcdCluster();
   auto store = OpenStore(etcd.Locator("dead"));
-  Set(*store, Obj("kept", "old"));
+  Set(*store, Valued("kept", "old"));
   // What a writer leaves when it dies after its first batch.
   const EtcdKeys raw(etcd.Endpoint(0));
   const std::int64_t lease = raw.GrantLease(60);
@@ -290,22 +246,22 @@ TEST(EtcdStoreTest, ADeadWritersGenerationIsRemovedByTheNextWriter) {
   raw.Put(root + "g/0123456789abcdef/x" + '\0' + "0000", "junk");
   raw.Put(root + "g/0123456789abcdef/y", "junk");
 
-  EXPECT_EQ(Dump(*store), std::vector<std::string>{"kept=old"});
+  EXPECT_EQ(ValuesOf(*store), std::vector<std::string>{"kept=old"});
   Clear(*store);
-  Set(*store, Obj("new", "1"));  // the writer's lease still runs: left alone
+  Set(*store, Valued("new", "1"));  // the writer's lease still runs: left alone
   EXPECT_EQ(RawKeys(etcd, "dead", "g/0123456789abcdef/").size(), 2u);
   raw.RevokeLease(lease);
   Clear(*store);
-  Set(*store, Obj("newer", "2"));
+  Set(*store, Valued("newer", "2"));
   EXPECT_THAT(RawKeys(etcd, "dead", "g/0123456789abcdef/"), ::testing::IsEmpty());
   EXPECT_EQ(RawKeys(etcd, "dead", "r/").size(), 1u);
-  EXPECT_EQ(Dump(*store), std::vector<std::string>{"newer=2"});
+  EXPECT_EQ(ValuesOf(*store), std::vector<std::string>{"newer=2"});
 }
 
 // A writer renews its one lease from replace to replace rather than granting
 // one each time, and gets a new one when it has gone.
 TEST(EtcdStoreTest, AWriterKeepsOneLeaseAcrossReplaces) {
-  EtcdCluster& etcd = SharedCluster();
+  EtcdCluster& etcd = SharedEtcdCluster();
   auto leases = [&] {
     std::istringstream out(etcd.Etcdctl({"lease", "list"}));
     std::string line;
@@ -318,14 +274,14 @@ TEST(EtcdStoreTest, AWriterKeepsOneLeaseAcrossReplaces) {
   auto store = OpenStore(etcd.Locator("leases"));
   for (int i = 0; i < 3; ++i) {
     Clear(*store);
-    Set(*store, Obj("a", std::to_string(i)));
+    Set(*store, Valued("a", std::to_string(i)));
   }
   const std::vector<std::string> kept = leases();
   ASSERT_EQ(kept.size(), 1u);
   etcd.Etcdctl({"lease", "revoke", kept[0]});
   Clear(*store);
-  Set(*store, Obj("a", "after"));
-  EXPECT_EQ(Dump(*store), std::vector<std::string>{"a=after"});
+  Set(*store, Valued("a", "after"));
+  EXPECT_EQ(ValuesOf(*store), std::vector<std::string>{"a=after"});
   EXPECT_EQ(leases().size(), 1u);
   EXPECT_THAT(RawKeys(etcd, "leases", "w/"), ::testing::IsEmpty());
 }
@@ -337,20 +293,19 @@ TEST(EtcdStoreTest, AClusterThatRefusesFailsEveryOperationAtOnce) {
   auto etcd = std::make_unique<EtcdCluster>();
   const std::string endpoint = etcd->Endpoint(0);
   auto store = OpenStore(etcd->Locator("down"));
-  Set(*store, Obj("a"));
+  Set(*store, Valued("a"));
   etcd.reset();
   SetGlobalStore(store);
-  std::int32_t flags = 0;
-  auto filter = std::make_shared<FilterSpecObject>(ConfigStoreObjectId("k", "g", "c"));
+  auto filter = Filter("k", "g", "c");
   const std::vector<std::function<void()>> operations = {
       [&] { store->GetObject(ConfigStoreObjectId("k", "g", "c", "a")); },
       [&] { store->GetObjects(filter); },
-      [&] { store->SetObject(Obj("b"), flags); },
+      [&] { Set(*store, Valued("b")); },
       [&] { store->DeleteObjects(filter); },
       [&] { TavoKarst::KarstLib::Reset(); },
       [&] {
         store->BeginTransaction();
-        store->SetObject(Obj("c"), flags);
+        Set(*store, Valued("c"));
         store->CommitTransaction();
       },
   };
@@ -399,7 +354,7 @@ std::string RefusingEndpoint() {
 // refusing, at once.
 TEST(EtcdStoreTest, ARequestGoesToAMemberThatAnswers) {
   const SilentMember silent;
-  const std::string good = SharedCluster().Endpoint(0);
+  const std::string good = SharedEtcdCluster().Endpoint(0);
   const std::string refusing = RefusingEndpoint();
   const struct {
     const char* name;
@@ -420,21 +375,14 @@ TEST(EtcdStoreTest, ARequestGoesToAMemberThatAnswers) {
     auto store =
         OpenStore("etcd://" + c.endpoints + "/failover?timeout=" + std::to_string(c.timeoutMs));
     const auto start = Clock::now();
-    const ConfigStoreException e = [&] {
-      try {
-        Set(*store, Obj("a", c.name));
-      } catch (const ConfigStoreException& e) {
-        return e;
-      }
-      return ConfigStoreException("", 0);
-    }();
+    const ConfigStoreException e = ErrorOf([&] { Set(*store, Valued("a", c.name)); });
     const auto took = Clock::now() - start;
     EXPECT_EQ(e.Code(), c.code) << e.what();
     EXPECT_GE(took, std::chrono::milliseconds(c.atLeastMs));
     EXPECT_LT(took, std::chrono::milliseconds(c.withinMs));
     if (c.code != 0) continue;
     const auto again = Clock::now();
-    EXPECT_EQ(Dump(*store), std::vector<std::string>{std::string("a=") + c.name});
+    EXPECT_EQ(ValuesOf(*store), std::vector<std::string>{std::string("a=") + c.name});
     EXPECT_LT(Clock::now() - again, std::chrono::milliseconds(500));
   }
 }
@@ -448,8 +396,8 @@ TEST(EtcdStoreTest, CertificatesAndUsersAreChecked) {
   options.tls = true;
   options.auth = true;
   EtcdCluster etcd(options);
-  Set(*OpenStore(etcd.Locator("secure")), Obj("a", "1"));
-  EXPECT_EQ(Dump(*OpenStore(etcd.Locator("secure"))), std::vector<std::string>{"a=1"});
+  Set(*OpenStore(etcd.Locator("secure")), Valued("a", "1"));
+  EXPECT_EQ(ValuesOf(*OpenStore(etcd.Locator("secure"))), std::vector<std::string>{"a=1"});
 
   karst_test::ScratchDir dir;
   const karst_test::CertificateFiles otherCa = karst_test::MakeCa(dir.Path(), "other-ca");
@@ -495,13 +443,13 @@ TEST(EtcdStoreTest, CertificatesAndUsersAreChecked) {
       {tls(ca, foreign.cert, foreign.key), kErrorTlsClientCertificate,
        "refused the client certificate in " + foreign.cert},
       {"etcd://" + etcd.Endpoints() + "/secure", kErrorTlsProtocol, "speaks TLS, not plain text"},
-      {"etcds://" + SharedCluster().Endpoint(0) + "/secure?cacert=" + ca, kErrorTlsProtocol,
+      {"etcds://" + SharedEtcdCluster().Endpoint(0) + "/secure?cacert=" + ca, kErrorTlsProtocol,
        "speaks plain text, not TLS"},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.locator);
     const auto start = Clock::now();
-    const ConfigStoreException e = ErrorOf([&] { Dump(*OpenStore(c.locator)); });
+    const ConfigStoreException e = ErrorOf([&] { ValuesOf(*OpenStore(c.locator)); });
     EXPECT_LT(Clock::now() - start, std::chrono::milliseconds(2500));
     EXPECT_EQ(e.Code(), c.code) << e.what();
     EXPECT_THAT(e.what(), ::testing::HasSubstr(c.says));
@@ -512,13 +460,13 @@ TEST(EtcdStoreTest, CertificatesAndUsersAreChecked) {
 
 // WaitForChange wakes when another connection commits, not otherwise.
 TEST(EtcdStoreTest, WaitForChangeWakesOnAnotherWritersCommit) {
-  const std::string locator = SharedCluster().Locator("watch");
+  const std::string locator = SharedEtcdCluster().Locator("watch");
   auto watcher = OpenStore(locator);
   auto writer = OpenStore(locator);
   EXPECT_FALSE(watcher->WaitForChange(300));
   std::thread later([&] {
     std::this_thread::sleep_for(std::chrono::milliseconds(200));
-    Set(*writer, Obj("a"));
+    Set(*writer, Valued("a"));
   });
   const auto start = Clock::now();
   EXPECT_TRUE(watcher->WaitForChange(5000));

@@ -349,4 +349,9 @@ void EtcdCluster::Stop() {
   }
 }
 
+EtcdCluster& SharedEtcdCluster() {
+  static EtcdCluster cluster;
+  return cluster;
+}
+
 }  // namespace karst_test

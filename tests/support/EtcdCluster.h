@@ -88,6 +88,10 @@ class EtcdCluster {
   std::string endpoints_;
 };
 
+// One plain cluster for the whole test program, started at its first use;
+// tests keep apart by the prefixes of their locators.
+EtcdCluster& SharedEtcdCluster();
+
 }  // namespace karst_test
 
 #endif  // KARST_TESTS_SUPPORT_ETCD_CLUSTER_H_

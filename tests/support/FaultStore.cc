@@ -2,7 +2,6 @@
 
 #include <unistd.h>
 
-#include <algorithm>
 #include <new>
 #include <utility>
 
@@ -93,13 +92,6 @@ const char* Describe(FaultKind kind) {
   return "?";
 }
 
-const std::vector<std::string>& StoreOperations() {
-  static const std::vector<std::string> kOperations = {
-      "GetObject",        "SetObject",         "DeleteObjects",   "GetObjects",
-      "BeginTransaction", "CommitTransaction", "AbortTransaction"};
-  return kOperations;
-}
-
 FaultStore::FaultStore(std::shared_ptr<ConfigStore> target) : ForwardingStore(std::move(target)) {}
 
 void FaultStore::Fail(const std::string& operation, int nth, FaultKind kind) {
@@ -122,17 +114,6 @@ void FaultStore::ClearFaults() {
 std::vector<std::string> FaultStore::Calls() const {
   std::lock_guard<std::mutex> lock(mu_);
   return log_;
-}
-
-std::vector<std::string> FaultStore::Calls(const std::vector<std::string>& operations) const {
-  std::lock_guard<std::mutex> lock(mu_);
-  std::vector<std::string> out;
-  for (const std::string& call : log_) {
-    if (std::find(operations.begin(), operations.end(), call) != operations.end()) {
-      out.push_back(call);
-    }
-  }
-  return out;
 }
 
 void FaultStore::ClearLog() {

@@ -38,9 +38,6 @@ enum class FaultKind {
 inline constexpr int kDeathStatus = 77;
 const char* Describe(FaultKind kind);
 
-// The seven store operations, in the store interface's order.
-const std::vector<std::string>& StoreOperations();
-
 class FaultStore : public TavoConfigStore::ForwardingStore {
  public:
   explicit FaultStore(std::shared_ptr<TavoConfigStore::ConfigStore> target);
@@ -59,8 +56,6 @@ class FaultStore : public TavoConfigStore::ForwardingStore {
 
   // Every call since the last ClearLog, in order, failed ones included.
   std::vector<std::string> Calls() const;
-  // Those among "operations" only, e.g. StoreOperations().
-  std::vector<std::string> Calls(const std::vector<std::string>& operations) const;
   void ClearLog();
 
   // True between a BeginTransaction that returned and the next Commit or

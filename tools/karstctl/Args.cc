@@ -110,11 +110,10 @@ Invocation ParseArgs(const std::vector<std::string>& args) {
     }
   }
   if (version && !help) {
-    invocation.command = Command::kVersion;
+    invocation.version = true;
     return invocation;
   }
   if (help) {
-    invocation.command = Command::kHelp;
     if (words.empty()) return invocation;
     // A group word alone asks about the whole group.
     invocation.helpTopics = EntriesStartingWith({words[0]});
@@ -132,7 +131,7 @@ Invocation ParseArgs(const std::vector<std::string>& args) {
   if (given > match.operands.size()) {
     throw UsageError("too many arguments for '" + name + "'" + kSeeHelp);
   }
-  invocation.command = match.command;
+  invocation.command = &match;
   invocation.operands.assign(words.begin() + static_cast<std::ptrdiff_t>(match.words.size()),
                              words.end());
   return invocation;

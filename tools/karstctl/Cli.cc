@@ -6,8 +6,8 @@
 #include "Errors.h"
 #include "Help.h"
 #include "Io.h"
-#include "Run.h"
 #include "StoreErrors.h"
+#include "StoreSession.h"
 
 namespace karstctl {
 
@@ -23,14 +23,15 @@ int Fail(int status, const std::string& message) {
 
 int RunKarstctl(const std::vector<std::string>& args) {
   try {
-    Invocation invocation = ParseArgs(args);
-    if (invocation.command == Command::kHelp) {
-      WriteOutput(invocation.helpTopics.empty() ? HelpText()
-                                                : CommandHelpText(invocation.helpTopics));
-    } else if (invocation.command == Command::kVersion) {
+    const Invocation invocation = ParseArgs(args);
+    if (invocation.command) {
+      StoreSession store(invocation);  // a bad locator fails here, before any input
+      invocation.command->run(invocation.operands, store);
+    } else if (invocation.version) {
       WriteOutput(VersionText());
     } else {
-      RunCommand(invocation);
+      WriteOutput(invocation.helpTopics.empty() ? HelpText()
+                                                : CommandHelpText(invocation.helpTopics));
     }
     return EXIT_SUCCESS;
   } catch (const UsageError& e) {

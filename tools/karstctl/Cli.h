@@ -6,9 +6,10 @@
 
 namespace karstctl {
 
-// The whole tool: parses "args" (without the program name), runs the
-// command, reports any failure as one line on standard error and returns
-// the exit status: 0 success, 1 store or other failure, 2 usage or input.
+// The whole tool, main's only call: parses "args" (without the program
+// name), answers --help and --version or runs the command the table names,
+// reports any failure as one line on standard error and returns the exit
+// status: 0 success, 1 store or other failure, 2 usage or input.
 int RunKarstctl(const std::vector<std::string>& args);
 
 }  // namespace karstctl

@@ -6,7 +6,7 @@
 #include <stdexcept>
 
 #include "Errors.h"
-#include "Utf8.h"
+#include "Json.h"
 
 namespace karstctl {
 

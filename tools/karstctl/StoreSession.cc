@@ -13,8 +13,9 @@
 namespace karstctl {
 
 StoreSession::StoreSession(const Invocation& invocation)
-    : locator_(invocation.store ? *invocation.store : TavoConfigStore::DefaultStorePath()),
-      waitMs_(invocation.waitMs) {
+    : use_(invocation.command->store), waitMs_(invocation.waitMs) {
+  if (use_ == StoreUse::kNone) return;
+  locator_ = invocation.store ? *invocation.store : TavoConfigStore::DefaultStorePath();
   try {
     if (TavoConfigStore::KindOfLocator(locator_) == TavoConfigStore::LocatorKind::kEtcd) {
       etcd_ = TavoConfigStore::ParseEtcdLocator(locator_);
@@ -29,13 +30,13 @@ StoreSession::StoreSession(const Invocation& invocation)
   }
 }
 
-void StoreSession::Open(StoreUse use) {
+void StoreSession::Open() {
   if (etcd_) {
     TavoConfigStore::SetGlobalStore(TavoConfigStore::NewEtcdStore(*etcd_));
     return;
   }
   struct stat info;
-  if (use == StoreUse::kRead && lstat(locator_.c_str(), &info) != 0 &&
+  if (use_ == StoreUse::kRead && lstat(locator_.c_str(), &info) != 0 &&
       (errno == ENOENT || errno == ENOTDIR)) {
     throw std::runtime_error("no store at " + TavoConfigStore::RedactLocator(locator_));
   }

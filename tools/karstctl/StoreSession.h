@@ -10,15 +10,16 @@
 namespace karstctl {
 
 // The store one command works on: the --store locator or else the default
-// one, a SQLite file or an etcd locator. Constructing it touches nothing but
-// reads the locator, so one that cannot be used (a bad etcd locator, or a
-// URL that is none) is reported as a UsageError before any input is read or
+// one, a SQLite file or an etcd locator, used as the command's StoreUse says.
+// Constructing it touches nothing but reads the locator (for a command that
+// uses a store), so one that cannot be used (a bad etcd locator, or a URL
+// that is none) is reported as a UsageError before any input is read or
 // anything created. Open installs the store as the library's for as long as
 // this object lives, with --wait as the lock timeout of a file or the
-// request timeout of etcd. For a read, a file path
-// with nothing there fails with "no store at PATH" (std::runtime_error)
-// instead of reading as an empty catalogue; on etcd an empty catalogue is
-// simply empty. Store failures throw ConfigStoreException.
+// request timeout of etcd. For a read, a file path with nothing there fails
+// with "no store at PATH" (std::runtime_error) instead of reading as an
+// empty catalogue; on etcd an empty catalogue is simply empty. Store
+// failures throw ConfigStoreException.
 class StoreSession {
  public:
   explicit StoreSession(const Invocation& invocation);
@@ -26,9 +27,10 @@ class StoreSession {
   StoreSession(const StoreSession&) = delete;
   StoreSession& operator=(const StoreSession&) = delete;
 
-  void Open(StoreUse use);
+  void Open();
 
  private:
+  StoreUse use_;
   std::string locator_;
   std::optional<TavoConfigStore::EtcdStoreOptions> etcd_;
   std::optional<int> waitMs_;

@@ -4,7 +4,7 @@
 #include <string>
 #include <vector>
 
-#include "JsonCodec.h"
+#include "Json.h"
 #include "TavoKarst/KarstLib.h"
 
 namespace karstctl {
