@@ -26,7 +26,8 @@ catalogue costs the cluster against the cheapest requests etcd answers: in
 --floor-rounds rounds, in random order, N GetDbHash back to back, N
 linearizable and N serializable Ranges of one key (through gRPC alone), each
 once through the leader and once through a follower, and an idle window
-(--floor-threads callers at once, each a store or channel of its own);
+(--floor-threads callers at once, each a store or channel of its own, each
+pausing --floor-pause-ms after each call);
 per call, the members' CPU net of the idle windows' rate and the requests
 etcd's gRPC counters saw, by method.
 
@@ -330,14 +331,17 @@ def run_floor(args, cluster, results):
                     measured.append({"kind": "idle", "before": before, "after": after})
                     continue
                 locator = f"etcd://{cluster.endpoints(first[via])}/{PREFIX}"
-                log = hosts.start("repeat", [kind, str(args.floor), str(args.floor_threads)],
+                log = hosts.start("repeat", [kind, str(args.floor), str(args.floor_threads),
+                                             str(args.floor_pause_ms)],
                                   locator, f"{kind}-{via}-{r}")
                 hosts.wait_ready(600)
                 before = cluster.metrics()
                 open(log + ".go", "w").close()
-                hosts.procs[-1][0].wait(timeout=3600)
+                code = hosts.procs[-1][0].wait(timeout=3600)
                 after = cluster.metrics()
                 hosts.procs.pop()
+                if code != 0:
+                    raise RuntimeError(f"{log}: {open(log + '.err').read()}")
                 with open(log) as f:
                     _, ms, cpu_ms, n = f.read().split()
                 measured.append({"kind": kind, "via": via, "before": before, "after": after,
@@ -351,6 +355,7 @@ def run_floor(args, cluster, results):
             for m in measured if m["kind"] == "idle"]
     idle_rate = sorted(idle)[len(idle) // 2]
     figures = {"floor": True, "calls": args.floor, "threads": args.floor_threads,
+               "pause_ms": args.floor_pause_ms,
                "idle_cpu_per_s": idle, "phases": []}
     for m in measured:
         if m["kind"] == "idle":
@@ -390,6 +395,8 @@ def main():
     parser.add_argument("--floor-rounds", type=int, default=3)
     parser.add_argument("--floor-threads", type=int, default=1,
                         help="callers at once, each with a store or channel of its own")
+    parser.add_argument("--floor-pause-ms", type=int, default=0,
+                        help="each caller's pause after each call")
     parser.add_argument("--floor-kinds", default="dbhash,range,serializable")
     parser.add_argument("--floor-via", default="leader,follower")
     parser.add_argument("--out", help="the figures as JSON")
@@ -474,7 +481,8 @@ def report(args, results):
 
 def report_floor(r):
     rates = ", ".join(f"{1e3 * x:.1f}" for x in r["idle_cpu_per_s"])
-    print(f"floor: {r['calls']} calls a phase from {r['threads']} thread(s); "
+    print(f"floor: {r['calls']} calls a phase from {r['threads']} thread(s), "
+          f"{r['pause_ms']} ms between a thread's calls; "
           f"idle cluster {rates} ms of CPU a second "
           "(the median is taken off)")
     print("| calls | via | etcd CPU ms / call: median (min-max) | idle share | requests / call "

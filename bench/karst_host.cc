@@ -6,9 +6,10 @@
 //   karst_host poll T OUT          GetDbHash every T seconds
 //   karst_host watch OUT           GetDbHash at each change WaitForChange reports
 //   karst_host replace N T OUT     replaces the N policies every T seconds
-//   karst_host repeat KIND N [THREADS] OUT
+//   karst_host repeat KIND N [THREADS [PAUSE_MS]] OUT
 //                                  N calls back to back (from THREADS
-//                                  threads, 1 unless given), KIND one of:
+//                                  threads, 1 unless given; each pausing
+//                                  PAUSE_MS after each call), KIND one of:
 //     dbhash        GetDbHash
 //     range         a linearizable Range of one key on the locator's first
 //                   member, through gRPC alone (EtcdFloor.h)
@@ -201,8 +202,10 @@ std::function<void()> Caller(const std::string& kind) {
 }
 
 // "n" calls in all, shared among "threads" threads, each a caller of its
-// own as another host would be, so that their requests reach etcd at once.
-void Repeat(const std::string& kind, std::size_t n, std::size_t threads, const std::string& out) {
+// own as another host would be, so that their requests reach etcd at once;
+// each thread pauses "pauseMs" after each call.
+void Repeat(const std::string& kind, std::size_t n, std::size_t threads, int pauseMs,
+            const std::string& out) {
   std::atomic<std::size_t> ready{0};
   std::atomic<bool> go{false};
   std::atomic<bool> failed{false};
@@ -216,7 +219,10 @@ void Repeat(const std::string& kind, std::size_t n, std::size_t threads, const s
         call();  // the cold read, or connecting
         ++ready;
         while (!go) std::this_thread::sleep_for(std::chrono::milliseconds(1));
-        for (std::size_t i = t; i < n && !failed; i += threads) call();
+        for (std::size_t i = t; i < n && !failed; i += threads) {
+          call();
+          std::this_thread::sleep_for(std::chrono::milliseconds(pauseMs));
+        }
       } catch (const std::exception& e) {
         std::lock_guard<std::mutex> lock(failureMu);
         failure = e.what();
@@ -241,7 +247,7 @@ void Repeat(const std::string& kind, std::size_t n, std::size_t threads, const s
 int Usage() {
   std::fprintf(stderr,
                "usage: karst_host fill N | poll SECONDS OUT | watch OUT | replace N SECONDS OUT"
-               " | repeat dbhash|range|serializable N [THREADS] OUT\n");
+               " | repeat dbhash|range|serializable N [THREADS [PAUSE_MS]] OUT\n");
   return 2;
 }
 
@@ -260,8 +266,9 @@ int main(int argc, char** argv) {
       Watch(argv[2]);
     } else if (mode == "replace" && argc == 5) {
       Replace(std::stoul(argv[2]), std::stod(argv[3]), argv[4]);
-    } else if (mode == "repeat" && (argc == 5 || argc == 6)) {
-      Repeat(argv[2], std::stoul(argv[3]), argc == 6 ? std::stoul(argv[4]) : 1, argv[argc - 1]);
+    } else if (mode == "repeat" && argc >= 5 && argc <= 7) {
+      Repeat(argv[2], std::stoul(argv[3]), argc >= 6 ? std::stoul(argv[4]) : 1,
+             argc == 7 ? std::stoi(argv[5]) : 0, argv[argc - 1]);
     } else {
       return Usage();
     }
