@@ -11,6 +11,9 @@
 //                                  threads, 1 unless given; each pausing
 //                                  PAUSE_MS after each call), KIND one of:
 //     dbhash        GetDbHash
+//     both          the two collections GetDbHash digests, listed in one
+//                   call of the store, as a GetDbHash that read them
+//                   together would
 //     range         a linearizable Range of one key on the locator's first
 //                   member, through gRPC alone (EtcdFloor.h)
 //     serializable  the same, serializable
@@ -191,6 +194,14 @@ std::pair<std::string, std::string> FirstMemberAndPrefix(const std::string& loca
 // Range through a channel of its own.
 std::function<void()> Caller(const std::string& kind) {
   if (kind == "dbhash") return [] { KarstLib::GetDbHash(); };
+  if (kind == "both") {
+    // The library's two collections: the key left open names both.
+    return [] {
+      TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace)
+          ->GetObjects(std::make_shared<TavoConfigStore::FilterSpecObject>(
+              TavoConfigStore::ConfigStoreObjectId("", "storage", "tavo")));
+    };
+  }
   if (kind != "range" && kind != "serializable") {
     throw std::runtime_error("unknown kind of call: " + kind);
   }
@@ -247,7 +258,7 @@ void Repeat(const std::string& kind, std::size_t n, std::size_t threads, int pau
 int Usage() {
   std::fprintf(stderr,
                "usage: karst_host fill N | poll SECONDS OUT | watch OUT | replace N SECONDS OUT"
-               " | repeat dbhash|range|serializable N [THREADS [PAUSE_MS]] OUT\n");
+               " | repeat dbhash|both|range|serializable N [THREADS [PAUSE_MS]] OUT\n");
   return 2;
 }
 
