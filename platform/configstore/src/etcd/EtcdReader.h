@@ -9,11 +9,11 @@
 // generation at the revision of the first reply. Any other read of one
 // collection asks for its pointer and for the generation it named last time
 // in one request, and needs a second only when a commit has moved the
-// collection to another generation. A whole
-// generation listed before and not kept is asked for in two halves at once,
-// split at an object's key remembered from then: etcd reads and sends the
-// two side by side. Replies are read where they arrived (EtcdWire.h): an
-// object's body is a view into its reply.
+// collection to another generation. A whole generation listed before and
+// not kept is asked for in two halves at once, split at an object's key
+// remembered from then: etcd reads and sends the two side by side. Replies
+// are read where they arrived (EtcdWire.h): an object's body is a view into
+// its reply.
 //
 // Until the store's first write, the catalogue may still lie where an
 // earlier version wrote it (EtcdLayout.h); readers read it there.
