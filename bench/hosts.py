@@ -21,6 +21,16 @@ the window; the hosts' latency percentiles and CPU per call come from their
 logs. A single host on the SQLite file, polling as fast as the single etcd
 host, gives the SQLite figure of the same run.
 
+With --floor N it measures instead what one host's GetDbHash of an unchanged
+catalogue costs the cluster against the cheapest requests etcd answers: in
+--floor-rounds rounds, in random order, N GetDbHash back to back, N
+linearizable and N serializable Ranges of one key (through gRPC alone), each
+once through the leader and once through a follower, and an idle window
+(--floor-threads callers at once, each a store or channel of its own, each
+pausing --floor-pause-ms after each call);
+per call, the members' CPU net of the idle windows' rate and the requests
+etcd's gRPC counters saw, by method.
+
   bash bench/run --hosts [--hosts 1,50,200 ...]   # or directly:
   python3 bench/hosts.py --host-binary build/bench/bench/karst_host --work build/bench/hosts
 """
@@ -29,6 +39,7 @@ import argparse
 import ctypes
 import json
 import os
+import random
 import shutil
 import signal
 import socket
@@ -94,16 +105,28 @@ class Cluster:
         return r.returncode == 0
 
     def metrics(self):
-        """Bytes sent to clients and CPU seconds, summed over the members."""
-        sent = cpu = 0.0
-        for port in self.clients:
+        """Bytes sent to clients and CPU seconds, summed over the members;
+        the requests handled by gRPC method and the bytes sent to peers,
+        summed too; and which member leads."""
+        sent = cpu = peer = 0.0
+        methods = {}
+        leader = None
+        for i, port in enumerate(self.clients):
             text = urllib.request.urlopen(f"http://127.0.0.1:{port}/metrics", timeout=10).read()
             for line in text.decode().splitlines():
                 if line.startswith("etcd_network_client_grpc_sent_bytes_total "):
                     sent += float(line.split()[1])
                 elif line.startswith("process_cpu_seconds_total "):
                     cpu += float(line.split()[1])
-        return {"sent": sent, "cpu": cpu, "time": time.time()}
+                elif line.startswith("etcd_network_peer_sent_bytes_total{"):
+                    peer += float(line.split()[1])
+                elif line.startswith("etcd_server_is_leader ") and float(line.split()[1]) == 1:
+                    leader = i
+                elif line.startswith("grpc_server_handled_total{"):
+                    method = line.split('grpc_method="')[1].split('"')[0]
+                    methods[method] = methods.get(method, 0) + float(line.split()[1])
+        return {"sent": sent, "cpu": cpu, "peer": peer, "methods": methods, "leader": leader,
+                "time": time.time()}
 
     def stop(self):
         for p in self.procs:
@@ -287,6 +310,74 @@ def run_sqlite(args, results):
         hosts.kill_all()
 
 
+def run_floor(args, cluster, results):
+    """N calls of each kind back to back, through the leader and through a
+    follower, and idle windows, in random order within each round."""
+    work = os.path.join(args.work, "floor")
+    os.makedirs(work)
+    leader = cluster.metrics()["leader"]
+    first = {"leader": leader, "follower": (leader + 1) % 3}
+    phases = [(kind, via) for kind in args.floor_kinds.split(",")
+              for via in args.floor_via.split(",")] + [("idle", None)]
+    hosts = Hosts(args.host_binary, work)
+    measured = []
+    try:
+        for r in range(args.floor_rounds):
+            for kind, via in random.sample(phases, len(phases)):
+                if kind == "idle":
+                    before = cluster.metrics()
+                    time.sleep(args.idle_window)
+                    after = cluster.metrics()
+                    measured.append({"kind": "idle", "before": before, "after": after})
+                    continue
+                locator = f"etcd://{cluster.endpoints(first[via])}/{PREFIX}"
+                log = hosts.start("repeat", [kind, str(args.floor), str(args.floor_threads),
+                                             str(args.floor_pause_ms)],
+                                  locator, f"{kind}-{via}-{r}")
+                hosts.wait_ready(600)
+                before = cluster.metrics()
+                open(log + ".go", "w").close()
+                code = hosts.procs[-1][0].wait(timeout=3600)
+                after = cluster.metrics()
+                hosts.procs.pop()
+                if code != 0:
+                    raise RuntimeError(f"{log}: {open(log + '.err').read()}")
+                with open(log) as f:
+                    _, ms, cpu_ms, n = f.read().split()
+                measured.append({"kind": kind, "via": via, "before": before, "after": after,
+                                 "client_ms": float(ms), "client_cpu_ms": float(cpu_ms),
+                                 "calls": int(n)})
+                if after["leader"] != leader:
+                    raise RuntimeError("the cluster elected another leader during the run")
+    finally:
+        hosts.kill_all()
+    idle = [(m["after"]["cpu"] - m["before"]["cpu"]) / (m["after"]["time"] - m["before"]["time"])
+            for m in measured if m["kind"] == "idle"]
+    idle_rate = sorted(idle)[len(idle) // 2]
+    figures = {"floor": True, "calls": args.floor, "threads": args.floor_threads,
+               "pause_ms": args.floor_pause_ms,
+               "idle_cpu_per_s": idle, "phases": []}
+    for m in measured:
+        if m["kind"] == "idle":
+            continue
+        b, a, n = m["before"], m["after"], m["calls"]
+        seconds = a["time"] - b["time"]
+        methods = {k: (a["methods"].get(k, 0) - b["methods"].get(k, 0)) / n
+                   for k in a["methods"] if a["methods"].get(k, 0) != b["methods"].get(k, 0)}
+        figures["phases"].append({
+            "kind": m["kind"], "via": m["via"], "calls": n, "seconds": seconds,
+            "etcd_cpu_ms_per_call": 1e3 * (a["cpu"] - b["cpu"]) / n,
+            "etcd_cpu_ms_per_call_net": 1e3 * (a["cpu"] - b["cpu"] - idle_rate * seconds) / n,
+            "idle_share": idle_rate * seconds / max(a["cpu"] - b["cpu"], 1e-9),
+            "sent_bytes_per_call": (a["sent"] - b["sent"]) / n,
+            "peer_bytes_per_call": (a["peer"] - b["peer"]) / n,
+            "requests_per_call": methods,
+            "client_ms_per_call": m["client_ms"] / n,
+            "client_cpu_ms_per_call": m["client_cpu_ms"] / n})
+        print(f"floor: {json.dumps(figures['phases'][-1])}", flush=True)
+    results.append(figures)
+
+
 def main():
     parser = argparse.ArgumentParser(description=__doc__.splitlines()[0])
     parser.add_argument("--host-binary", required=True)
@@ -299,6 +390,15 @@ def main():
     parser.add_argument("--replace-window", type=float, default=150)
     parser.add_argument("--replace-every", type=float, default=60)
     parser.add_argument("--idle-window", type=float, default=20)
+    parser.add_argument("--floor", type=int, default=0,
+                        help="measure N GetDbHash against the cheapest requests instead")
+    parser.add_argument("--floor-rounds", type=int, default=3)
+    parser.add_argument("--floor-threads", type=int, default=1,
+                        help="callers at once, each with a store or channel of its own")
+    parser.add_argument("--floor-pause-ms", type=int, default=0,
+                        help="each caller's pause after each call")
+    parser.add_argument("--floor-kinds", default="dbhash,range,serializable")
+    parser.add_argument("--floor-via", default="leader,follower")
     parser.add_argument("--out", help="the figures as JSON")
     args = parser.parse_args()
     args.host_binary = os.path.abspath(args.host_binary)
@@ -314,7 +414,8 @@ def main():
     results = []
     cluster = None
     try:
-        run_sqlite(args, results)
+        if not args.floor:
+            run_sqlite(args, results)
         cluster = Cluster(os.path.join(args.work, "etcd"))
         subprocess.run([args.host_binary, "fill", str(args.policies)], check=True,
                        env=dict(os.environ,
@@ -330,8 +431,11 @@ def main():
                         "sent_per_s": (after["sent"] - before["sent"]) /
                         (after["time"] - before["time"])})
         print(f"idle cluster: {results[-1]}", flush=True)
-        for n in [int(x) for x in args.hosts.split(",")]:
-            run_hosts(args, cluster, n, results)
+        if args.floor:
+            run_floor(args, cluster, results)
+        else:
+            for n in [int(x) for x in args.hosts.split(",")]:
+                run_hosts(args, cluster, n, results)
     finally:
         if cluster:
             cluster.stop()
@@ -347,6 +451,11 @@ def report(args, results):
         return "-" if x is None else f"{x:,.{digits}f}"
     print()
     print(f"{args.policies:,} policies and datastores; etcd figures summed over 3 members")
+    for r in results:
+        if r.get("floor"):
+            report_floor(r)
+    if args.floor:
+        return
     print("| hosts (watching) | T s | window | calls | changed | errors | etcd bytes sent / call "
           "| etcd CPU ms / call (net) | latency ms p50 / p90 / p99 (unchanged) "
           "| latency ms p50 / p99 (changed) | client CPU ms / call (unchanged) |")
@@ -368,6 +477,27 @@ def report(args, results):
                   f"| {'-' if r.get('sqlite') else f(w['etcd_cpu_ms_per_call_net'], 3)} "
                   f"| {f(lat.get('p50'))} / {f(lat.get('p90'))} / {f(lat.get('p99'))} "
                   f"| {f(chg.get('p50'))} / {f(chg.get('p99'))} | {f(cpu.get('mean'))} |")
+
+
+def report_floor(r):
+    rates = ", ".join(f"{1e3 * x:.1f}" for x in r["idle_cpu_per_s"])
+    print(f"floor: {r['calls']} calls a phase from {r['threads']} thread(s), "
+          f"{r['pause_ms']} ms between a thread's calls; "
+          f"idle cluster {rates} ms of CPU a second "
+          "(the median is taken off)")
+    print("| calls | via | etcd CPU ms / call: median (min-max) | idle share | requests / call "
+          "| bytes sent / call | peer bytes / call | client ms / call |")
+    print("|---|---|---|---|---|---|---|---|")
+    groups = {}
+    for p in r["phases"]:
+        groups.setdefault((p["kind"], p["via"]), []).append(p)
+    for (kind, via), ps in sorted(groups.items()):
+        cpu = sorted(p["etcd_cpu_ms_per_call_net"] for p in ps)
+        mid = ps[len(ps) // 2]
+        requests = ", ".join(f"{k} {v:.2f}" for k, v in sorted(mid["requests_per_call"].items()))
+        print(f"| {kind} | {via} | {cpu[len(cpu) // 2]:.3f} ({cpu[0]:.3f}-{cpu[-1]:.3f}) "
+              f"| {mid['idle_share']:.0%} | {requests} | {mid['sent_bytes_per_call']:.0f} "
+              f"| {mid['peer_bytes_per_call']:.0f} | {mid['client_ms_per_call']:.2f} |")
 
 
 if __name__ == "__main__":

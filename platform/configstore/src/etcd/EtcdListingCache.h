@@ -1,11 +1,11 @@
 // Listings of whole collections kept between reads, so that reading a
 // collection nobody changed costs the cluster one small request instead of
-// the collection: the reader asks whether the collection's pointer still has
-// the mod revision and value it had, and only when it has not, for the
-// objects (EtcdReader.h). A pointer's mod revision moves with every commit
-// that changes its collection, and a change committed before a read begins
-// has moved it by then, so a kept listing never shows a catalogue older
-// than a new read would.
+// the collection: the reader reads the collection's pointer, and only when
+// its mod revision or value has changed, the objects (EtcdReader.h). A
+// pointer's mod revision moves with every commit that changes its
+// collection, and a change committed before a read begins has moved it by
+// then, so a kept listing never shows a catalogue older than a new read
+// would.
 //
 // One cache serves every store of the process that names the same members
 // (in the same order), prefix, user, client certificate and size, on any

