@@ -6,11 +6,10 @@
 #include <cstdint>
 #include <cstdio>
 #include <filesystem>
-#include <fstream>
-#include <iterator>
 #include <string>
 #include <vector>
 
+#include "Files.h"
 #include "import_check.h"
 
 int main(int argc, char** argv) {
@@ -31,12 +30,7 @@ int main(int argc, char** argv) {
   }
   int counts[3] = {0, 0, 0};
   for (const auto& file : files) {
-    std::ifstream in(file, std::ios::binary);
-    if (!in) {
-      std::fprintf(stderr, "cannot read %s\n", file.c_str());
-      return 1;
-    }
-    const std::string bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    const std::string bytes = karst_test::ReadFile(file);  // throws when it cannot
     const karst_fuzz::ImportResult r =
         karst_fuzz::CheckImport(reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size());
     ++counts[static_cast<int>(r)];
