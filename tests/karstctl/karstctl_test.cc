@@ -45,11 +45,8 @@ struct ToolResult {
 };
 
 [[noreturn]] void ExecKarstctl(std::vector<std::string> args) {
-  std::vector<char*> argv = {const_cast<char*>(KARSTCTL_BINARY)};
-  for (std::string& arg : args) argv.push_back(arg.data());
-  argv.push_back(nullptr);
-  execv(argv[0], argv.data());
-  _exit(126);
+  args.insert(args.begin(), KARSTCTL_BINARY);
+  Exec(args);
 }
 
 // karstctl left running (watch), its standard output read line by line as
@@ -99,14 +96,13 @@ class Background {
   // when it is still running ten seconds later.
   int Stop(int signal) {
     kill(pid_, signal);
-    int status = 0;
-    bool hung = false;
-    for (int waited = 0; waitpid(pid_, &status, WNOHANG) == 0; waited += 10) {
-      if (waited == 10000) hung = kill(pid_, SIGKILL) == 0;
-      usleep(10000);
+    const int status = WaitFor(pid_, 10);
+    if (status == -1) {
+      kill(pid_, SIGKILL);
+      waitpid(pid_, nullptr, 0);
     }
     pid_ = -1;
-    if (hung) return -1;
+    if (status == -1) return -1;
     return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
   }
 

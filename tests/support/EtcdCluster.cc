@@ -76,16 +76,6 @@ std::vector<std::string> Words(const std::string& text) {
   return {std::istream_iterator<std::string>(in), std::istream_iterator<std::string>()};
 }
 
-[[noreturn]] void Exec(const std::vector<std::string>& argv) {
-  std::vector<char*> args;
-  args.reserve(argv.size() + 1);
-  for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
-  args.push_back(nullptr);
-  execvp(args[0], args.data());
-  std::perror(args[0]);
-  _exit(127);
-}
-
 // A process that dies with the calling thread, its output appended to "log".
 pid_t Spawn(const std::vector<std::string>& argv, const std::string& log) {
   const pid_t parent = getpid();
@@ -102,16 +92,6 @@ pid_t Spawn(const std::vector<std::string>& argv, const std::string& log) {
   }
   if (pid < 0) throw std::runtime_error(std::string("fork: ") + std::strerror(errno));
   return pid;
-}
-
-// True once "pid" has ended and been reaped, polling until "deadline".
-bool Reap(pid_t pid, Clock::time_point deadline) {
-  for (;;) {
-    const pid_t r = waitpid(pid, nullptr, WNOHANG);
-    if (r == pid || (r < 0 && errno != EINTR)) return true;
-    if (Clock::now() >= deadline) return false;
-    usleep(10000);
-  }
 }
 
 void KillAndReap(pid_t pid) {
@@ -223,7 +203,7 @@ bool EtcdCluster::WaitUp(const char* state) {
       Member& m = members_[i];
       if (m.pid < 0 || HttpGet(m.metricsPort, "/health").find(state) != std::string::npos) continue;
       up = false;
-      const bool died = Reap(m.pid, Clock::now());
+      const bool died = WaitFor(m.pid, 0) != -1;
       if (!died && Clock::now() <= deadline) continue;
       if (died) m.pid = -1;
       std::string log = ReadFile(m.dir + "/etcd.log");
@@ -338,7 +318,7 @@ void EtcdCluster::Stop() {
     if (m.pid < 0) continue;
     kill(m.pid, SIGTERM);
     kill(m.pid, SIGCONT);  // a paused member acts on it
-    if (!Reap(m.pid, Clock::now() + std::chrono::milliseconds(500))) KillAndReap(m.pid);
+    if (WaitFor(m.pid, 0.5) == -1) KillAndReap(m.pid);
     m.pid = -1;
   }
 }
