@@ -269,15 +269,6 @@ TEST_F(Karstctl, BlobCommandsWriteTheRawBytesOrNothing) {
   for (const auto& [args, bytes] : cases) EXPECT_EQ(Ok(args), bytes) << args[1];
 }
 
-TEST_F(Karstctl, StoreIsTheOptionElseTheEnvironment) {
-  Ok({"reset"});
-  const std::string other = dir_.File("other.db");
-  UseStoreAt(other);
-  EXPECT_EQ(RunTool({"import", "-"}, R"({"policies": [{"name": "env"}]})").status, 0);
-  EXPECT_THAT(RunTool({"--store=" + other, "policies", "list"}).out, HasSubstr("env"));
-  EXPECT_EQ(RunTool({"--store", store_, "policies", "list"}).out, "[]\n");
-}
-
 // Every rejected command line or input exits 2 naming what is wrong, and
 // leaves the store file as it was, byte for byte.
 TEST_F(Karstctl, BadCommandLinesAndInputsExitTwoAndLeaveTheStoreAlone) {
@@ -499,20 +490,18 @@ TEST_F(Karstctl, WatchReadsAgainUntilAReadSucceeds) {
   EXPECT_EQ(watch.Stop(SIGINT), 0);
 }
 
-TEST_F(Karstctl, UnwritableOutputExitsOne) {
+// Output that cannot be written exits 1. Started with standard input or
+// output closed, karstctl reads and writes nothing there, never a descriptor
+// some library opened in its place.
+TEST_F(Karstctl, UnwritableOrClosedStandardDescriptors) {
   Ok({"import", "-"},
-     R"({"policies": [{"name": "n", "policy_id": "p", "blobs": [{"datastore_namespace": "CORRA", "blob": "b"}]}]})");
-  const std::vector<std::string> commands[] = {
-      {"--store", store_, "export"}, {"--store", store_, "blob", "corra-by-id", "p"}, {"--help"}};
-  for (const auto& args : commands) {
+     R"({"policies": [{"name": "kept", "policy_id": "p", "blobs": [{"datastore_namespace": "CORRA", "blob": "b"}]}]})");
+  for (const std::vector<std::string>& args :
+       {std::vector<std::string>{"--store", store_, "export"},
+        {"--store", store_, "blob", "corra-by-id", "p"},
+        {"--help"}}) {
     ExpectFailure(RunTool(args, "", "/dev/full"), 1, "cannot write standard output");
   }
-}
-
-// Started with standard input or output closed, karstctl reads and writes
-// nothing there, never a descriptor some library opened in its place.
-TEST_F(Karstctl, ClosedStandardDescriptorsAreNobodyElses) {
-  Ok({"import", "-"}, R"({"policies": [{"name": "kept"}]})");
   const std::string before = ReadFile(store_);
   const struct {
     std::vector<int> closed;
@@ -613,6 +602,8 @@ TEST_F(Karstctl, WritesWarnAboutRecordsTheStoreCollapses) {
   EXPECT_EQ(KarstLib::ListDatastoreInfo().size(), 2u);
 }
 
+// Options go anywhere on the line, --store wins over the environment, and
+// each command has its help.
 TEST_F(Karstctl, OptionsGoAnywhereAndEachCommandHasItsHelp) {
   EXPECT_EQ(RunTool({"blob", "corra-by-name", "--help"}).out,
             "Usage: karstctl [OPTIONS] blob corra-by-name NAME\n"
@@ -621,6 +612,10 @@ TEST_F(Karstctl, OptionsGoAnywhereAndEachCommandHasItsHelp) {
   EXPECT_EQ(group.status, 0);
   EXPECT_EQ(std::count(group.out.begin(), group.out.end(), '\n'), 4 * 3 - 1) << group.out;
   Ok({"policies", "set", "-"}, R"([{"name": "-n", "policy_id": "p"}])");
+  const std::string other = dir_.File("other.db");
+  UseStoreAt(other);
+  EXPECT_EQ(RunTool({"import", "-"}, R"({"policies": [{"name": "env"}]})").status, 0);
+  EXPECT_THAT(RunTool({"--store=" + other, "policies", "list"}).out, HasSubstr("env"));
   EXPECT_THAT(RunTool({"policies", "list", "--store", store_}).out, HasSubstr("\"-n\""));
   EXPECT_EQ(RunTool({"export", "--store=" + store_, "--wait", "2.5"}).status, 0);
 }
