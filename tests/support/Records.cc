@@ -9,13 +9,7 @@ namespace karst_test {
 TavoKarst::KarstPolicyInfo Policy(const std::string& name, const std::string& id,
                                   std::vector<TavoKarst::KarstPolicyBlob> blobs,
                                   const std::string& description, std::int64_t generation) {
-  TavoKarst::KarstPolicyInfo p;
-  p.name = name;
-  p.policy_id = id;
-  p.description = description;
-  p.generation_number = generation;
-  p.blobs = std::move(blobs);
-  return p;
+  return {std::move(blobs), name, id, description, generation};
 }
 
 TavoKarst::KarstDatastoreInfo Datastore(const std::string& url, const std::string& ns,
