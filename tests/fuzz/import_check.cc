@@ -3,9 +3,9 @@
 #include <cstdio>
 #include <cstdlib>
 #include <string>
+#include <vector>
 
 #include "Errors.h"
-#include "FaultSweep.h"
 #include "Json.h"
 #include "Records.h"
 
@@ -13,7 +13,13 @@ namespace karst_fuzz {
 
 namespace {
 
-using Records = karst_test::Catalogue;
+using TavoKarst::KarstDatastoreInfo;
+using TavoKarst::KarstPolicyInfo;
+
+struct Records {
+  std::vector<KarstPolicyInfo> policies;
+  std::vector<KarstDatastoreInfo> datastores;
+};
 
 // An absent collection is imported as nothing and exported as empty.
 Records Import(const std::string& text) {

@@ -21,18 +21,6 @@ TavoKarst::KarstDatastoreInfo Datastore(const std::string& url, const std::strin
 
 namespace TavoKarst {
 
-bool operator==(const KarstPolicyBlob& a, const KarstPolicyBlob& b) {
-  return a.blob == b.blob && a.datastore_namespace == b.datastore_namespace;
-}
-bool operator==(const KarstPolicyInfo& a, const KarstPolicyInfo& b) {
-  return a.name == b.name && a.policy_id == b.policy_id && a.description == b.description &&
-         a.generation_number == b.generation_number && a.blobs == b.blobs;
-}
-bool operator==(const KarstDatastoreInfo& a, const KarstDatastoreInfo& b) {
-  return a.url == b.url && a.datastore_namespace == b.datastore_namespace &&
-         a.drp_policy_id == b.drp_policy_id;
-}
-
 // Long byte strings print by length and a prefix, so a failure over a
 // 10 MiB blob stays readable.
 namespace {
