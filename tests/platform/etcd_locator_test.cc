@@ -112,27 +112,30 @@ struct Case {
   const char* text;  // the options it gives (as Describe puts them), or part of why not
 };
 
-// "ENDPOINT... /PREFIX tls|plain USER:PASSWORD CA|CERT|KEY TIMEOUT"
+// "ENDPOINT... /PREFIX tls|plain USER:PASSWORD CA|CERT|KEY TIMEOUT CACHE"
 std::string Describe(const EtcdStoreOptions& o) {
   std::string out;
   for (const std::string& endpoint : o.endpoints) out += endpoint + " ";
   return out + "/" + o.prefix + (o.tls ? " tls " : " plain ") + o.user + ":" + o.password + " " +
-         o.caFile + "|" + o.certFile + "|" + o.keyFile + " " + std::to_string(o.timeoutMs);
+         o.caFile + "|" + o.certFile + "|" + o.keyFile + " " + std::to_string(o.timeoutMs) + " " +
+         std::to_string(o.cacheMiB);
 }
 
 TEST_F(EtcdLocatorTest, ReadsEveryPartAndTakesWhatItLeavesOutFromTheEnvironment) {
   const Case cases[] = {
-      {"etcd://h:2379/p", kNone, "h:2379 /p plain : || 5000"},
+      {"etcd://h:2379/p", kNone, "h:2379 /p plain : || 5000 64"},
       {"etcds://u:p%40ss%2F%3a@a:1,[::1]:2,b.example:65535/cat/one//"
        "?cacert=/ca.pem&cert=/c%26.pem&key=/k.pem&timeout=250",
-       kNone, "a:1 [::1]:2 b.example:65535 /cat/one tls u:p@ss/: /ca.pem|/c&.pem|/k.pem 250"},
-      {"etcd://us%3Aer@h:1/p%2Fq%40?timeout=9999999", kNone, "h:1 /p/q@ plain us:er: || 9999999"},
+       kNone, "a:1 [::1]:2 b.example:65535 /cat/one tls u:p@ss/: /ca.pem|/c&.pem|/k.pem 250 64"},
+      {"etcd://us%3Aer@h:1/p%2Fq%40?timeout=9999999&cache=0", kNone,
+       "h:1 /p/q@ plain us:er: || 9999999 0"},
+      {"etcd://h:1/p?cache=999999", kNone, "h:1 /p plain : || 5000 999999"},
       // The environment is taken literally; its files only for etcds.
-      {"etcd://h:1/p", kAll, "h:1 /p plain eu:e%pw || 5000"},
-      {"etcds://h:1/p?cacert=/mine", kAll, "h:1 /p tls eu:e%pw /mine|/e/c|/e/k 5000"},
-      {"etcd://me@h:1/p", {"eu", "epw"}, "h:1 /p plain me:epw || 5000"},
-      {"etcd://me:mine@h:1/p", {"eu", "epw"}, "h:1 /p plain me:mine || 5000"},
-      {"etcd://h:1/p", {"eu", "epw"}, "h:1 /p plain eu:epw || 5000"},
+      {"etcd://h:1/p", kAll, "h:1 /p plain eu:e%pw || 5000 64"},
+      {"etcds://h:1/p?cacert=/mine", kAll, "h:1 /p tls eu:e%pw /mine|/e/c|/e/k 5000 64"},
+      {"etcd://me@h:1/p", {"eu", "epw"}, "h:1 /p plain me:epw || 5000 64"},
+      {"etcd://me:mine@h:1/p", {"eu", "epw"}, "h:1 /p plain me:mine || 5000 64"},
+      {"etcd://h:1/p", {"eu", "epw"}, "h:1 /p plain eu:epw || 5000 64"},
   };
   for (const Case& c : cases) {
     Use(c.environment);
@@ -163,6 +166,8 @@ TEST_F(EtcdLocatorTest, RefusesWhatItCannotUseNamingItButNeverThePassword) {
       {"etcd://u:cret@h:1/p?timeout=0", kNone, "timeout must be a number of milliseconds"},
       {"etcd://u:cret@h:1/p?timeout=10000000", kNone, "timeout must be"},
       {"etcd://u:cret@h:1/p?timeout=-5", kNone, "timeout must be"},
+      {"etcd://u:cret@h:1/p?cache=1000000", kNone, "cache must be a number of MiB"},
+      {"etcd://u:cret@h:1/p?cache=-1", kNone, "cache must be"},
       {"etcd://u:cret@h:1/p?colour=red", kNone, "unknown option \"colour\""},
       {"etcd://u:cret@h:1/p?cacert=", kNone, "option \"cacert\" needs a value"},
       {"etcd://u:cret@h:1/p?key", kNone, "option \"key\" needs a value"},

@@ -231,6 +231,135 @@ TEST(EtcdStoreTest, ReadersFollowAnotherWritersNewGeneration) {
   EXPECT_EQ(value("c"), "3");
 }
 
+// "instance=value" of each object of collection "k", or "instance!why" for
+// one that cannot be read, in order.
+std::vector<std::string> Describe(ConfigStore& store) {
+  std::vector<std::string> out;
+  auto filter = std::make_shared<FilterSpecObject>(ConfigStoreObjectId("k", "g", "c"));
+  for (const auto& o : store.GetObjects(filter)) {
+    try {
+      std::string v;
+      o->GetValue("v", &v);
+      out.push_back(o->Id().InstanceId() + "=" + v);
+    } catch (const ConfigStoreException& e) {
+      out.push_back(o->Id().InstanceId() + "!" + e.Message());
+    }
+  }
+  return out;
+}
+
+// The cluster's current revision.
+std::string Revision(const EtcdCluster& etcd) {
+  const std::string status = etcd.Etcdctl({"get", "-w", "json", "none"});
+  const std::size_t at = status.find("\"revision\":") + 11;
+  return status.substr(at, status.find_first_not_of("0123456789", at) - at);
+}
+
+// Whatever changes a collection, a reader that keeps listings between reads
+// lists, read after read, exactly what a reader that keeps none lists:
+// order, values, damage and all; and what a caller does to the objects it
+// got does not reach the next listing.
+TEST(EtcdStoreTest, AKeptListingIsWhatAFreshReadFinds) {
+  EtcdCluster& etcd = SharedEtcdCluster();
+  const std::string locator = etcd.Locator("kept");
+  auto writer = OpenStore(locator);
+  auto another = OpenStore(locator + "?cache=0");
+  auto keeping = OpenStore(locator);
+  auto fresh = OpenStore(locator + "?cache=0");
+  const EtcdKeys raw(etcd.Endpoint(0));
+  const auto generation = [&] {
+    return raw.List(StoreRoot("kept") + "p/").begin()->second.substr(0, 16);
+  };
+  // A first part whose header is sound and whose body is not.
+  const std::string damaged("\x01\x01\x00\x00\x01\x01\x05", 7);
+  const std::pair<const char*, std::function<void()>> changes[] = {
+      {"first objects",
+       [&] {
+         writer->BeginTransaction();
+         for (const char* i : {"a", "b", "c"}) Set(*writer, Valued(i, i));
+         writer->CommitTransaction();
+       }},
+      {"nothing", [] {}},
+      {"an object changed in place", [&] { Set(*writer, Valued("a", "a2")); }},
+      {"an object deleted",
+       [&] {
+         writer->DeleteObjects(
+             std::make_shared<FilterSpecObject>(ConfigStoreObjectId("k", "g", "c", "b")));
+       }},
+      {"another writer's commit", [&] { Set(*another, Valued("d", "d")); }},
+      {"a replace",
+       [&] {
+         writer->BeginTransaction();
+         Clear(*writer);
+         for (const char* i : {"f", "e"}) Set(*writer, Valued(i, i));
+         writer->CommitTransaction();
+       }},
+      {"a compaction",
+       [&] {
+         etcd.Etcdctl({"compact", Revision(etcd)});
+       }},
+      {"a commit after the compaction", [&] { Set(*writer, Valued("g", "g")); }},
+      {"a damaged object",
+       [&] {
+         raw.Put(StoreRoot("kept") + "g/" + generation() + "/h" + '\0' + "0000", damaged);
+         Set(*writer, Valued("i", "i"));
+       }},
+      {"the collection cleared", [&] { Clear(*writer); }},
+      {"written again", [&] { Set(*another, Valued("j", "j")); }},
+  };
+  for (const auto& [what, change] : changes) {
+    change();
+    const std::vector<std::string> expected = Describe(*fresh);
+    EXPECT_EQ(Describe(*keeping), expected) << "after " << what;
+    for (const auto& o : keeping->GetObjects(
+             std::make_shared<FilterSpecObject>(ConfigStoreObjectId("k", "g", "c")))) {
+      o->SetValue("v", "changed by a caller");
+      o->CreateSubObject(SubObjectId("s", "x"))->SetValue("v", "y");
+    }
+    EXPECT_EQ(Describe(*keeping), expected) << "again after " << what;
+  }
+}
+
+// While nobody changes a collection, a reader that listed it lists it again
+// for a few hundred bytes of etcd's; any store of the process that names the
+// same cluster and prefix does. A changed collection is fetched again, once;
+// one larger than the cache every time; and the kept listings go with the
+// last store that used them.
+TEST(EtcdStoreTest, AnUnchangedCollectionCostsTheClusterASmallRead) {
+  EtcdCluster& etcd = SharedEtcdCluster();
+  const std::string locator = etcd.Locator("cost") + "?cache=2";
+  auto writer = OpenStore(locator);
+  writer->BeginTransaction();
+  for (int i = 0; i < 100; ++i)
+    Set(*writer, Valued("o" + std::to_string(i), std::string(4096, 'k')));
+  for (int i = 0; i < 600; ++i) {
+    Set(*writer, Valued("o" + std::to_string(i), std::string(4096, 'b'), "big"));
+  }
+  writer->CommitTransaction();
+  auto reader = OpenStore(locator);
+  const auto sent = [&](const std::shared_ptr<ConfigStore>& store, const char* key) {
+    const double before = etcd.ClientBytesSent();
+    ValuesOf(*store, Filter(key, "g", "c"));
+    return etcd.ClientBytesSent() - before;
+  };
+  constexpr double kSmall = 4096;
+  constexpr double kSmallCollection = 100 * 4096;
+  EXPECT_GT(sent(reader, "k"), kSmallCollection);
+  EXPECT_LT(sent(reader, "k"), kSmall);
+  EXPECT_LT(sent(OpenStore(locator), "k"), kSmall);
+  EXPECT_GT(sent(reader, "big"), 6 * kSmallCollection);
+  EXPECT_GT(sent(reader, "big"), 6 * kSmallCollection);
+  EXPECT_LT(sent(reader, "k"), kSmall);
+
+  Set(*writer, Valued("o1", "changed"));
+  EXPECT_GT(sent(reader, "k"), kSmallCollection);
+  EXPECT_LT(sent(reader, "k"), kSmall);
+
+  reader.reset();
+  writer.reset();
+  EXPECT_GT(sent(OpenStore(locator), "k"), kSmallCollection);
+}
+
 // A writer that dies mid-replace leaves a generation nobody points at; once
 // its lease is gone the next writer removes it, and readers never saw it.
 TEST(EtcdStoreTest, ADeadWritersGenerationIsRemovedByTheNextWriter) {

@@ -5,11 +5,12 @@
 // cluster goes down. Readers (one on each member, one on all) list
 // throughout. A listing must be one whole list, no older than the last
 // replace that returned before it began and no newer than the last one begun
-// by its end; a replace must go through once a leader is back; a dead
-// writer's generation must stay unseen and go once its lease has; a stopped
-// first member must not fail reads or writes; no store call may take longer
-// than its timeout and a small margin; and with no member up every
-// operation must fail in bounded time, naming the cluster.
+// by its end, however long the reader has kept a listing it read before; a
+// replace must go through once a leader is back; a dead writer's generation
+// must stay unseen and go once its lease has; a stopped first member must
+// not fail reads or writes; no store call may take longer than its timeout
+// and a small margin; and with no member up every operation must fail in
+// bounded time, naming the cluster.
 
 #include <fcntl.h>
 #include <sys/types.h>
@@ -284,13 +285,15 @@ TEST(EtcdFailover, LeaderKillsDeadWritersAndAClusterDown) {
   std::mt19937 rng(20261124);
 
   // Readers 0-2 on one member each, 3 on all; a second's timeout keeps the
-  // one whose member is down trying.
+  // one whose member is down trying. Each names the members its own way, and
+  // so keeps listings of its own between reads, as a reader on another host
+  // would: a listing kept from before a replace must not outlive it.
   std::atomic<long long> listings{0}, readErrors{0};
   Tally wrong;
   Threads readers;
   for (int r = 0; r < 4; ++r) {
     readers.Start([&, r] {
-      if (!tStore) tStore = Open(MemberLocator(etcd, r < 3 ? r : -1), 1000);
+      if (!tStore) tStore = Open(MemberLocator(etcd, r < 3 ? r : -1, 1), 1000);
       try {
         EXPECT_EQ(CheckListing(now, wrong), "") << "reader " << r;
         ++listings;

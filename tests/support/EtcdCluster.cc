@@ -282,6 +282,19 @@ void EtcdCluster::RestartAll() {
   if (!WaitUp(kHealthy)) throw std::runtime_error("an etcd member lost a port");
 }
 
+double EtcdCluster::ClientBytesSent() const {
+  const std::string name = "\netcd_network_client_grpc_sent_bytes_total ";
+  double sent = 0;
+  for (const Member& m : members_) {
+    if (m.pid < 0) continue;
+    const std::string metrics = HttpGet(m.metricsPort, "/metrics");
+    const std::size_t at = metrics.find(name);
+    if (at == std::string::npos) throw std::runtime_error("etcd's /metrics has no " + name);
+    sent += std::stod(metrics.substr(at + name.size()));
+  }
+  return sent;
+}
+
 int EtcdCluster::LeaderIndex() const {
   for (const auto deadline = Clock::now() + kUpWithin; Clock::now() < deadline; usleep(20000)) {
     std::vector<int> leaders;

@@ -61,6 +61,9 @@ class EtcdCluster {
   // Starts every member that is not running, all at once (a lone member of
   // three waits for its peers before it is healthy), and returns once all are.
   void RestartAll();
+  // The bytes the running members have sent their clients, all together, by
+  // their own count (etcd_network_client_grpc_sent_bytes_total).
+  double ClientBytesSent() const;
   // Waits up to 20 s for exactly one running member to lead.
   int LeaderIndex() const;
   // etcdctl's standard output; throws with its error output when it fails.

@@ -65,7 +65,7 @@ std::string HelpText() {
       "names, unknown drp_policy_id).\n"
       "An etcd locator is\n"
       "  etcd[s]://[USER[:PASSWORD]@]HOST:PORT[,HOST:PORT...]/PREFIX\n"
-      "            [?cacert=FILE&cert=FILE&key=FILE&timeout=MS]\n"
+      "            [?cacert=FILE&cert=FILE&key=FILE&timeout=MS&cache=MIB]\n"
       "with %XX for any of @/?&,% in its parts; etcds:// uses TLS. What it leaves out\n"
       "comes from ETCDCTL_USER (USER[:PASSWORD]), ETCDCTL_PASSWORD and, for etcds://,\n"
       "ETCDCTL_CACERT, ETCDCTL_CERT and ETCDCTL_KEY. A new etcd catalogue reads as empty.\n"

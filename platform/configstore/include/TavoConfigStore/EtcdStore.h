@@ -28,6 +28,12 @@ struct EtcdStoreOptions {
   std::string password;
   // Each request to the cluster fails after this long (connecting included).
   int timeoutMs = 5000;
+  // Listings of whole collections kept in memory, at most this many MiB of
+  // them, so that reading a collection again costs one small request while
+  // nobody has changed it (0: none kept, every read fetches the objects). The
+  // stores of one process that name the same members, prefix, user and size
+  // share them. A collection larger than this is read afresh each time.
+  int cacheMiB = 64;
 };
 
 // True for "etcd://..." and "etcds://..." (see KindOfLocator for the rest).
@@ -35,7 +41,7 @@ CONFIGSTORE_EXPORT bool IsEtcdLocator(const std::string& locator);
 
 // Reads a locator
 //   etcd[s]://[USER[:PASSWORD]@]HOST:PORT[,HOST:PORT...]/PREFIX
-//              [?cacert=FILE&cert=FILE&key=FILE&timeout=MS]
+//              [?cacert=FILE&cert=FILE&key=FILE&timeout=MS&cache=MIB]
 // "etcds" turns TLS on. An IPv6 HOST goes in brackets. In a user name,
 // password, prefix or file name %XX stands for a byte; an '@' after the
 // endpoints is refused, as it is most likely a password's with a bare '/'.

@@ -101,8 +101,13 @@ void SetQuery(EtcdStoreOptions& options, std::string_view query) {
         Refuse("timeout must be a number of milliseconds from 1 to 9999999");
       }
       options.timeoutMs = std::stoi(value);
+    } else if (name == "cache") {
+      if (value.size() > 6 || value.find_first_not_of("0123456789") != std::string::npos) {
+        Refuse("cache must be a number of MiB from 0 (none) to 999999");
+      }
+      options.cacheMiB = std::stoi(value);
     } else {
-      Refuse("unknown option \"" + name + "\" (known: cacert, cert, key, timeout)");
+      Refuse("unknown option \"" + name + "\" (known: cacert, cert, key, timeout, cache)");
     }
   }
 }

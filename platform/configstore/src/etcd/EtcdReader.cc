@@ -39,6 +39,7 @@ Pointers PointersOf(const Keys& keys, const etcdwire::Range& range, std::int64_t
   for (const etcdwire::KeyValue& kv : range.kvs) {
     Current current;
     std::tie(current.gen, current.token) = etcdlayout::ParsePointer(kv.value);
+    current.value.assign(kv.value);
     current.version = kv.modRevision;
     pointers.byCollection.emplace(Keys::NameIn(area, kv.key), std::move(current));
   }
@@ -120,8 +121,9 @@ void KeepOnly(Pointers* pointers, const Keep& keep) {
 
 }  // namespace
 
-EtcdReader::EtcdReader(EtcdClient& client, std::string_view prefix)
-    : client_(client), keys_(prefix), legacyKeys_(Keys::Legacy(prefix)) {}
+EtcdReader::EtcdReader(EtcdClient& client, std::string_view prefix,
+                       std::shared_ptr<ListingCache> cache)
+    : client_(client), cache_(std::move(cache)), keys_(prefix), legacyKeys_(Keys::Legacy(prefix)) {}
 
 Pointers EtcdReader::ReadPointers(const std::string& collection, bool orphans) {
   // While the old root may hold the catalogue, every pointer under both
@@ -180,7 +182,19 @@ Pointers EtcdReader::ReadPointers(const std::string& collection, bool orphans) {
 }
 
 Pointers EtcdReader::ReadCollection(const std::string& collection, const std::string* instance,
-                                    Replies* replies, std::vector<Entry>* entries) {
+                                    std::shared_ptr<const Listing>* out) {
+  if (instance == nullptr && cache_ && layout_ != Layout::kLegacy) {
+    if (std::shared_ptr<const Listing> kept = cache_->Find(collection)) {
+      // Only what lies under the store's own root is kept, and a catalogue
+      // once there stays there.
+      layout_ = Layout::kCurrent;
+      return ReadKept(collection, std::move(kept), out);
+    }
+  }
+  auto listing = std::make_shared<Listing>();
+  *out = listing;
+  Replies* replies = &listing->replies;
+  std::vector<Entry>* entries = &listing->entries;
   Pointers pointers;
   auto last = lastRead_.find(collection);
   if (layout_ != Layout::kCurrent || last == lastRead_.end()) {
@@ -214,18 +228,115 @@ Pointers EtcdReader::ReadCollection(const std::string& collection, const std::st
       if (split) ranges.push_back(&replies->second.ranges[0]);
       ParseGeneration(keys_, gen, ranges, entries);
       Remember(collection, gen, instance ? nullptr : entries);
+      if (!instance) Keep(collection, *current, listing);
       return pointers;
+    }
+    if (current) {
+      // The replies hold another generation's keys, or an older snapshot.
+      listing = std::make_shared<Listing>();
+      *out = listing;
+      replies = &listing->replies;
+      entries = &listing->entries;
     }
   }
   const Current* current = pointers.Find(collection);
   if (!current) {
     lastRead_.erase(collection);
+    if (cache_ && pointers.keys == &keys_) cache_->Drop(collection);
     return pointers;
   }
   ReadGeneration(*pointers.keys, current->gen, instance, pointers.revision, &replies->first,
                  entries);
-  if (pointers.keys == &keys_) Remember(collection, current->gen, instance ? nullptr : entries);
+  if (pointers.keys == &keys_) {
+    Remember(collection, current->gen, instance ? nullptr : entries);
+    if (!instance) Keep(collection, *current, listing);
+  }
   return pointers;
+}
+
+Pointers EtcdReader::ReadKept(const std::string& collection, std::shared_ptr<const Listing> kept,
+                              std::shared_ptr<const Listing>* out) {
+  // Unchanged: the pointer alone. Changed: the pointer and the generation
+  // the listing was of, which a commit in place has changed and a commit
+  // into a new generation has deleted.
+  const std::string key = keys_.Pointer(collection);
+  etcdserverpb::TxnRequest txn;
+  etcdserverpb::Compare* same = txn.add_compare();
+  same->set_key(key);
+  same->set_target(etcdserverpb::Compare::MOD);
+  same->set_result(etcdserverpb::Compare::EQUAL);
+  same->set_mod_revision(kept->version);
+  // The value too, which holds a random token of the commit: a cluster put
+  // up afresh behind the same members may have reached the same revision.
+  etcdserverpb::Compare* value = txn.add_compare();
+  *value = *same;
+  value->set_target(etcdserverpb::Compare::VALUE);
+  value->set_value(kept->pointer);
+  AddRange(&txn, key, false);
+  txn.add_failure()->mutable_request_range()->set_key(key);
+  *txn.add_failure()->mutable_request_range() = GenerationRequest(keys_, kept->gen, nullptr);
+
+  auto listing = std::make_shared<Listing>();
+  client_.Txn(txn, &listing->replies.first);
+  const etcdwire::Reply& reply = listing->replies.first;
+  Pointers pointers = PointersOf(keys_, reply.ranges[0], reply.revision);
+  const Current* current = pointers.Find(collection);
+  if (reply.succeeded && current) {
+    *out = std::move(kept);
+    return pointers;
+  }
+  *out = listing;
+  if (!current) {
+    lastRead_.erase(collection);
+    cache_->Drop(collection);
+    return pointers;
+  }
+  if (current->gen == kept->gen) {
+    ParseGeneration(keys_, current->gen, {&reply.ranges[1]}, &listing->entries);
+  } else {
+    listing = std::make_shared<Listing>();
+    *out = listing;
+    ReadGeneration(keys_, current->gen, nullptr, pointers.revision, &listing->replies.first,
+                   &listing->entries);
+  }
+  Remember(collection, current->gen, &listing->entries);
+  Keep(collection, *current, listing);
+  return pointers;
+}
+
+std::shared_ptr<const Listing> EtcdReader::ReadListing(const Pointers& pointers,
+                                                       const std::string& collection,
+                                                       const std::string* instance) {
+  const Current* current = pointers.Find(collection);
+  const bool own = pointers.keys == &keys_;
+  if (instance == nullptr && cache_ && own) {
+    std::shared_ptr<const Listing> kept = cache_->Find(collection);
+    if (kept && kept->version == current->version && kept->pointer == current->value) return kept;
+  }
+  auto listing = std::make_shared<Listing>();
+  ReadGeneration(*pointers.keys, current->gen, instance, pointers.revision, &listing->replies.first,
+                 &listing->entries);
+  if (instance == nullptr && own) Keep(collection, *current, listing);
+  return listing;
+}
+
+void EtcdReader::Keep(const std::string& collection, const Current& current,
+                      const std::shared_ptr<Listing>& listing) {
+  if (!cache_) return;
+  // The entries hold what the ranges' views were needed for.
+  for (etcdwire::Reply* reply : {&listing->replies.first, &listing->replies.second}) {
+    reply->ranges.clear();
+    reply->ranges.shrink_to_fit();
+  }
+  if (!cache_->Fits(listing->Bytes())) {
+    cache_->Drop(collection);
+    return;
+  }
+  listing->kept = true;
+  listing->gen = current.gen;
+  listing->pointer = current.value;
+  listing->version = current.version;
+  cache_->Keep(collection, listing);
 }
 
 void EtcdReader::ReadGeneration(const Keys& keys, const std::string& gen,

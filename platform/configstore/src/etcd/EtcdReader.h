@@ -2,12 +2,17 @@
 // generations they point at, at one revision, so that one read is one
 // snapshot even when a commit switches generations in between.
 //
-// A read of one collection asks for its pointer and for the generation it
-// named last time in one request, and needs a second only when a commit has
-// moved the pointer since. A whole generation listed before is asked for in
-// two halves at once, split at an object's key remembered from then: etcd
-// reads and sends the two side by side. Replies are read where they arrived
-// (EtcdWire.h): an object's body is a view into its reply.
+// A whole collection listed before and kept (EtcdListingCache.h) costs one
+// small request while nobody changes it: its pointer, asked for on condition
+// that it still has the mod revision and value it had, and otherwise the
+// pointer and the generation it named, in one read-only transaction. Any
+// other read of one collection asks for its pointer and for the generation
+// it named last time in one request. Either needs a second request only when
+// a commit has moved the collection to another generation. A whole
+// generation listed before and not kept is asked for in two halves at once,
+// split at an object's key remembered from then: etcd reads and sends the
+// two side by side. Replies are read where they arrived (EtcdWire.h): an
+// object's body is a view into its reply.
 //
 // Until the store's first write, the catalogue may still lie where an
 // earlier version wrote it (EtcdLayout.h); readers read it there.
@@ -17,12 +22,15 @@
 
 #include <cstdint>
 #include <map>
+#include <memory>
 #include <string>
 #include <string_view>
 #include <vector>
 
 #include "EtcdClient.h"
 #include "EtcdLayout.h"
+#include "EtcdListing.h"
+#include "EtcdListingCache.h"
 #include "EtcdWire.h"
 
 namespace TavoConfigStore {
@@ -32,6 +40,7 @@ struct Current {
   std::string gen;
   std::int64_t version = 0;  // the pointer's mod revision; 0: no such collection
   std::string token;         // of the commit that wrote the pointer
+  std::string value;         // the pointer's value, all of it
 };
 
 struct Pointers {
@@ -51,33 +60,10 @@ struct Pointers {
   }
 };
 
-// An object's place in write order.
-struct Order {
-  std::int64_t revision = 0;
-  std::uint64_t index = 0;
-  bool operator<(const Order& other) const {
-    return revision != other.revision ? revision < other.revision : index < other.index;
-  }
-};
-
-// One stored object of a generation, its bytes still in the reply.
-struct Entry {
-  std::string instance;
-  Order order;
-  std::string_view body;
-  std::string joined;  // a body stored in several parts, put together
-  std::string damage;  // why the object cannot be read, if it cannot
-};
-
-// The replies a read of one collection keeps; entries point into them.
-struct Replies {
-  etcdwire::Reply first;
-  etcdwire::Reply second;  // the second half of a split listing
-};
-
 class EtcdReader {
  public:
-  EtcdReader(EtcdClient& client, std::string_view prefix);
+  // "cache" (may be null) keeps whole collections' listings between reads.
+  EtcdReader(EtcdClient& client, std::string_view prefix, std::shared_ptr<ListingCache> cache);
 
   // The layout of the store's own root.
   const etcdlayout::Keys& OwnKeys() const { return keys_; }
@@ -87,9 +73,17 @@ class EtcdReader {
   // left under the store's own root.
   Pointers ReadPointers(const std::string& collection, bool orphans = false);
   // The pointer of one collection and, when it has one, the objects of its
-  // generation (or its one object "instance"), at one revision.
+  // generation (or its one object "instance"), at one revision, in
+  // "*listing": for a whole collection, possibly one kept from an earlier
+  // read, and shared with other readers.
   Pointers ReadCollection(const std::string& collection, const std::string* instance,
-                          Replies* replies, std::vector<Entry>* entries);
+                          std::shared_ptr<const Listing>* listing);
+  // The objects of "collection" (or its one object "instance") as
+  // "pointers" has it, at their revision; a whole collection from the cache
+  // when it kept the listing that pointer names.
+  std::shared_ptr<const Listing> ReadListing(const Pointers& pointers,
+                                             const std::string& collection,
+                                             const std::string* instance);
   // The objects of a generation (or its one object "instance") at
   // "revision", in the order the cluster keeps the keys. Their bytes stay
   // in "*reply".
@@ -121,8 +115,15 @@ class EtcdReader {
   };
   void Remember(const std::string& collection, const std::string& gen,
                 const std::vector<Entry>* listed);
+  // ReadCollection of a collection whose listing "kept" was kept.
+  Pointers ReadKept(const std::string& collection, std::shared_ptr<const Listing> kept,
+                    std::shared_ptr<const Listing>* listing);
+  // Keeps a whole collection's listing, read under "current", for later reads.
+  void Keep(const std::string& collection, const Current& current,
+            const std::shared_ptr<Listing>& listing);
 
   EtcdClient& client_;
+  const std::shared_ptr<ListingCache> cache_;
   const etcdlayout::Keys keys_;
   const etcdlayout::Keys legacyKeys_;
   // Whether the old root may still hold this store's catalogue: asked once

@@ -3,7 +3,9 @@
 // A transaction is kept here, as what it did to each collection
 // (EtcdCommit.h) over what it read, until the outermost commit applies it.
 // Reads inside a transaction see its own changes; reads outside it read the
-// pointers and the objects at one revision (EtcdReader.h).
+// pointers and the objects at one revision (EtcdReader.h). Objects read from
+// a listing the store keeps for later reads view their bodies there; others
+// get copies, so that the replies they came in can go.
 
 #include <algorithm>
 #include <cstdint>
@@ -20,6 +22,7 @@
 #include "EtcdClient.h"
 #include "EtcdCommit.h"
 #include "EtcdLayout.h"
+#include "EtcdListingCache.h"
 #include "EtcdReader.h"
 #include "EtcdWatch.h"
 #include "TavoConfigStore/EtcdStore.h"
@@ -53,7 +56,9 @@ std::shared_ptr<ConfigStoreObject> DecodePut(const ConfigStoreObjectId& id, cons
 class EtcdStore final : public Backend {
  public:
   explicit EtcdStore(const EtcdStoreOptions& options)
-      : client_(options), reader_(client_, options.prefix), commit_(client_, reader_) {}
+      : client_(options),
+        reader_(client_, options.prefix, ListingCache::For(options)),
+        commit_(client_, reader_) {}
 
   ~EtcdStore() override { feed_.reset(); }
 
@@ -69,12 +74,11 @@ class EtcdStore final : public Backend {
     }
     const EtcdClient::Call call(client_);
     return EtcdReader::Snapshot([&]() -> std::shared_ptr<ConfigStoreObject> {
-      std::vector<Entry> entries;
-      Replies replies;
-      const Pointers pointers =
-          reader_.ReadCollection(collection, &id.InstanceId(), &replies, &entries);
+      std::shared_ptr<const Listing> listing;
+      const Pointers pointers = reader_.ReadCollection(collection, &id.InstanceId(), &listing);
       Observe(collection, pointers);
-      return entries.empty() ? nullptr : Decode(id, entries.front());
+      return listing->entries.empty() ? nullptr
+                                      : Decode(id, listing->entries.front(), listing, nullptr);
     });
   }
 
@@ -121,7 +125,7 @@ class EtcdStore final : public Backend {
   std::vector<std::shared_ptr<ConfigStoreObject>> List(const FilterSpecObject& filter) override {
     std::lock_guard<std::mutex> lock(mu_);
     const EtcdClient::Call call(client_);
-    return EtcdReader::Snapshot([&] { return Listing(filter); });
+    return EtcdReader::Snapshot([&] { return ListMatching(filter); });
   }
 
   void BeginTransaction() override {
@@ -166,15 +170,21 @@ class EtcdStore final : public Backend {
   }
 
  private:
+  // An object of "listing", kept by it when the store keeps the listing,
+  // else copied into "arena" (null: memory of its own).
   std::shared_ptr<ConfigStoreObject> Decode(const ConfigStoreObjectId& collection,
                                             const Entry& entry,
-                                            objectmodel::Arena* arena = nullptr) const {
+                                            const std::shared_ptr<const Listing>& listing,
+                                            objectmodel::Arena* arena) const {
     ConfigStoreObjectId id(collection.Key(), collection.Group(), collection.Component());
     id.SetInstanceId(entry.instance);
     if (!entry.damage.empty()) {
       return std::make_shared<DamagedObject>(
           std::move(id),
           ConfigStoreException(client_.Where() + ": " + entry.damage, kErrorCorruptObject));
+    }
+    if (listing->kept) {
+      return objectmodel::ViewOrDamaged(std::move(id), entry.body, listing, client_.Where());
     }
     return objectmodel::DecodeOrDamaged(std::move(id), entry.body, arena, client_.Where());
   }
@@ -205,15 +215,13 @@ class EtcdStore final : public Backend {
     if (levels_.Open()) observed_.emplace(collection, current ? current->version : 0);
   }
 
-  std::vector<std::shared_ptr<ConfigStoreObject>> Listing(const FilterSpecObject& filter) {
+  std::vector<std::shared_ptr<ConfigStoreObject>> ListMatching(const FilterSpecObject& filter) {
     const ConfigStoreObjectId& want = filter.Id();
     const std::string* instance = want.InstanceId().empty() ? nullptr : &want.InstanceId();
     const std::string exact = ExactCollection(want);
-    Replies replies;
-    std::vector<Entry> entries;
-    const Pointers pointers = exact.empty()
-                                  ? reader_.ReadPointers(exact)
-                                  : reader_.ReadCollection(exact, instance, &replies, &entries);
+    std::shared_ptr<const Listing> listing;
+    const Pointers pointers = exact.empty() ? reader_.ReadPointers(exact)
+                                            : reader_.ReadCollection(exact, instance, &listing);
     struct Listed {
       Order order;
       std::shared_ptr<ConfigStoreObject> object;
@@ -227,15 +235,11 @@ class EtcdStore final : public Backend {
       const Current* current = pointers.Find(name);
       const Pending* pending = PendingOf(name);
       if (current && !(pending && pending->cleared)) {
-        if (name != exact) {
-          entries.clear();
-          reader_.ReadGeneration(*pointers.keys, current->gen, instance, pointers.revision,
-                                 &replies.first, &entries);
-        }
-        for (const Entry& entry : entries) {
+        if (name != exact) listing = reader_.ReadListing(pointers, name, instance);
+        for (const Entry& entry : listing->entries) {
           if (!pending ||
               (!pending->deleted.count(entry.instance) && !pending->puts.count(entry.instance))) {
-            listed.push_back({entry.order, Decode(collection, entry, &arena)});
+            listed.push_back({entry.order, Decode(collection, entry, listing, &arena)});
           }
         }
       }

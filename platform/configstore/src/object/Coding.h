@@ -46,6 +46,12 @@ void PutLengthPrefixed(std::string* out, std::string_view bytes);
 // end first, or a varint is too long or overflows 64 bits; "*in" is then
 // left somewhere inside.
 inline bool GetVarint(std::string_view* in, std::uint64_t* value) {
+  // One byte is the common case: lengths and counts below 128.
+  if (!in->empty() && static_cast<unsigned char>(in->front()) < 0x80) {
+    *value = static_cast<unsigned char>(in->front());
+    in->remove_prefix(1);
+    return true;
+  }
   std::uint64_t result = 0;
   const std::size_t n = in->size() < kMaxVarintLength ? in->size() : kMaxVarintLength;
   for (std::size_t i = 0; i < n; ++i) {

@@ -101,9 +101,10 @@ Parts Split(std::string_view body) {
   parts.subs = in;
   std::size_t count = 0;
   if (!GetCount(&in, &count)) Corrupt("truncated sub-object count");
-  std::string_view ignored;
+  std::string_view array;
+  std::string_view key;
   for (std::size_t i = 0; i < count; ++i) {
-    if (!coding::GetLengthPrefixed(&in, &ignored) || !coding::GetLengthPrefixed(&in, &ignored)) {
+    if (!coding::GetLengthPrefixed(&in, &array) || !coding::GetLengthPrefixed(&in, &key)) {
       Corrupt("damaged sub-object identifier");
     }
     SkipValues(&in);

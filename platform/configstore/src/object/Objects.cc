@@ -147,18 +147,23 @@ class Access {
     return object.subs_;
   }
 
-  // An object over "body", whose sections "parts" are.
+  // An object over "body", whose sections "parts" are: over a copy in
+  // "arena" (null: memory of its own), or with "owner" set, over "body"
+  // itself, which "owner" keeps.
   static std::shared_ptr<ConfigStoreObject> Place(ConfigStoreObjectId&& id, std::string_view body,
-                                                  const format::Parts& parts, Arena* arena) {
-    Arena alone;
-    if (arena == nullptr) arena = &alone;
-    std::shared_ptr<const void> owner;
-    char* copy = arena->Allocate(body.size(), &owner);
-    std::memcpy(copy, body.data(), body.size());
+                                                  const format::Parts& parts, Arena* arena,
+                                                  std::shared_ptr<const void> owner) {
+    const char* at = body.data();
+    if (owner == nullptr) {
+      Arena alone;
+      char* copy = (arena ? arena : &alone)->Allocate(body.size(), &owner);
+      std::memcpy(copy, body.data(), body.size());
+      at = copy;
+    }
     auto object = std::make_shared<ConfigStoreObject>(std::move(id));
-    object->encodedSubs_ = copy + (parts.subs.data() - body.data());
+    object->encodedSubs_ = at + (parts.subs.data() - body.data());
     object->encodedSubsSize_ = parts.subs.size();
-    View(*object, std::string_view(copy + (parts.values.data() - body.data()), parts.values.size()),
+    View(*object, std::string_view(at + (parts.values.data() - body.data()), parts.values.size()),
          std::move(owner));
     return object;
   }
@@ -195,11 +200,14 @@ void EncodeObject(const ConfigStoreObject& object, std::string* out) {
 
 std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId id, std::string_view body,
                                                 Arena* arena) {
-  return Access::Place(std::move(id), body, format::Split(body), arena);
+  return Access::Place(std::move(id), body, format::Split(body), arena, nullptr);
 }
 
-std::shared_ptr<ConfigStoreObject> DecodeOrDamaged(ConfigStoreObjectId id, std::string_view body,
-                                                   Arena* arena, const std::string& where) {
+namespace {
+
+std::shared_ptr<ConfigStoreObject> PlaceOrDamaged(ConfigStoreObjectId&& id, std::string_view body,
+                                                  Arena* arena, std::shared_ptr<const void> owner,
+                                                  const std::string& where) {
   format::Parts parts;
   try {
     parts = format::Split(body);
@@ -207,7 +215,20 @@ std::shared_ptr<ConfigStoreObject> DecodeOrDamaged(ConfigStoreObjectId id, std::
     return std::make_shared<DamagedObject>(
         std::move(id), ConfigStoreException(where + ": " + e.Message(), e.Code()));
   }
-  return Access::Place(std::move(id), body, parts, arena);
+  return Access::Place(std::move(id), body, parts, arena, std::move(owner));
+}
+
+}  // namespace
+
+std::shared_ptr<ConfigStoreObject> DecodeOrDamaged(ConfigStoreObjectId id, std::string_view body,
+                                                   Arena* arena, const std::string& where) {
+  return PlaceOrDamaged(std::move(id), body, arena, nullptr, where);
+}
+
+std::shared_ptr<ConfigStoreObject> ViewOrDamaged(ConfigStoreObjectId id, std::string_view body,
+                                                 std::shared_ptr<const void> owner,
+                                                 const std::string& where) {
+  return PlaceOrDamaged(std::move(id), body, nullptr, std::move(owner), where);
 }
 
 }  // namespace objectmodel

@@ -29,6 +29,13 @@ std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId id, std::str
 std::shared_ptr<ConfigStoreObject> DecodeOrDamaged(ConfigStoreObjectId id, std::string_view body,
                                                    Arena* arena, const std::string& where);
 
+// As DecodeOrDamaged, except that "body" is not copied: the object reads it
+// where it lies, and keeps "owner", which must keep the body there unchanged
+// (a listing the store keeps for later reads, handed to many callers).
+std::shared_ptr<ConfigStoreObject> ViewOrDamaged(ConfigStoreObjectId id, std::string_view body,
+                                                 std::shared_ptr<const void> owner,
+                                                 const std::string& where);
+
 }  // namespace objectmodel
 }  // namespace TavoConfigStore
 

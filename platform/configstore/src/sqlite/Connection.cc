@@ -13,11 +13,11 @@ void Connection::Open(const std::string& name, int busyTimeoutMs) {
       sqlite3_open_v2(name.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
   if (rc != SQLITE_OK) {
     // Without memory for a handle, SQLite gives none to ask for the message.
-    const ConfigStoreException error(
-        where_ + ": cannot open: " + (db_ != nullptr ? sqlite3_errmsg(db_) : sqlite3_errstr(rc)),
-        db_ != nullptr ? sqlite3_extended_errcode(db_) : rc);
+    const std::string message =
+        where_ + ": cannot open: " + (db_ != nullptr ? sqlite3_errmsg(db_) : sqlite3_errstr(rc));
+    const int code = db_ != nullptr ? sqlite3_extended_errcode(db_) : rc;
     Close();
-    throw error;
+    throw ConfigStoreException(message, code);
   }
   sqlite3_extended_result_codes(db_, 1);
   sqlite3_busy_timeout(db_, busyTimeoutMs);
