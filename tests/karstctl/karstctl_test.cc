@@ -45,32 +45,28 @@ struct ToolResult {
 };
 
 [[noreturn]] void ExecKarstctl(std::vector<std::string> args) {
-  std::vector<char*> argv = {const_cast<char*>(KARSTCTL_BINARY)};
-  for (std::string& arg : args) argv.push_back(arg.data());
-  argv.push_back(nullptr);
-  execv(argv[0], argv.data());
-  _exit(126);
+  args.insert(args.begin(), KARSTCTL_BINARY);
+  Exec(args);
 }
 
-// karstctl left running (watch), its output read line by line as it comes.
+// karstctl left running (watch), its standard output read line by line as
+// it comes; its standard error is in Errors().
 class Background {
  public:
-  Background(const std::vector<std::string>& args, const std::string& errPath) {
-    int fds[2];
-    if (pipe(fds) != 0) throw std::runtime_error("pipe failed");
+  Background(const std::vector<std::string>& args, const ScratchDir& dir)
+      : out_(dir.File("background.out")), err_(dir.File("background.err")) {
+    WriteFile(out_, "");
+    WriteFile(err_, "");
     pid_ = fork();
     if (pid_ == 0) {
       prctl(PR_SET_PDEATHSIG, SIGKILL);  // not outliving a test that fails first
-      dup2(fds[1], 1);
-      dup2(open(errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600), 2);
+      dup2(open(out_.c_str(), O_WRONLY), 1);
+      dup2(open(err_.c_str(), O_WRONLY), 2);
       ExecKarstctl(args);
     }
-    close(fds[1]);
-    fd_ = fds[0];
   }
   ~Background() {
     if (pid_ > 0) Stop(SIGKILL);
-    close(fd_);
   }
   Background(const Background&) = delete;
   Background& operator=(const Background&) = delete;
@@ -78,43 +74,42 @@ class Background {
   // The next line, or "" when none is whole within "seconds".
   std::string NextLine(double seconds) {
     const auto deadline = std::chrono::steady_clock::now() + std::chrono::duration<double>(seconds);
-    std::size_t end;
-    while ((end = pending_.find('\n')) == std::string::npos) {
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-          deadline - std::chrono::steady_clock::now());
-      pollfd p{fd_, POLLIN, 0};
-      char buffer[4096];
-      ssize_t got = 0;
-      if (left.count() <= 0 || poll(&p, 1, static_cast<int>(left.count())) <= 0 ||
-          (got = read(fd_, buffer, sizeof buffer)) <= 0) {
-        return "";
+    for (;; usleep(10000)) {
+      const std::string out = ReadFile(out_);
+      const std::size_t end = out.find('\n', read_);
+      if (end != std::string::npos) {
+        const std::size_t start = std::exchange(read_, end + 1);
+        return out.substr(start, read_ - start);
       }
-      pending_.append(buffer, static_cast<std::size_t>(got));
+      if (std::chrono::steady_clock::now() > deadline) return "";
     }
-    std::string line = pending_.substr(0, end + 1);
-    pending_.erase(0, end + 1);
-    return line;
+  }
+  // Its standard error, once there is some or "seconds" have passed.
+  std::string Errors(double seconds = 0) const {
+    for (int waited = 0; waited < seconds * 1000 && ReadFile(err_).empty(); waited += 50) {
+      usleep(50000);
+    }
+    return ReadFile(err_);
   }
 
   // Sends "signal"; the exit status (128 + signal when killed by one), or -1
   // when it is still running ten seconds later.
   int Stop(int signal) {
     kill(pid_, signal);
-    int status = 0;
-    bool hung = false;
-    for (int waited = 0; waitpid(pid_, &status, WNOHANG) == 0; waited += 10) {
-      if (waited == 10000) hung = kill(pid_, SIGKILL) == 0;
-      usleep(10000);
+    const int status = WaitFor(pid_, 10);
+    if (status == -1) {
+      kill(pid_, SIGKILL);
+      waitpid(pid_, nullptr, 0);
     }
     pid_ = -1;
-    if (hung) return -1;
+    if (status == -1) return -1;
     return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
   }
 
  private:
+  const std::string out_, err_;
   pid_t pid_;
-  int fd_;
-  std::string pending_;
+  std::size_t read_ = 0;
 };
 
 // Each test has an empty store in its own folder; the library in this process
@@ -125,15 +120,17 @@ class Karstctl : public ::testing::Test {
   void TearDown() override { unsetenv("TAVO_CONFIGSTORE_PATH"); }
 
   // Runs karstctl with "args" and "input" on stdin; stdout comes back through
-  // the child's result pipe unless "outPath" takes it. Killed after a minute.
+  // the child's result pipe unless "outPath" takes it, and the descriptors in
+  // "closed" are closed. Killed after a minute.
   ToolResult RunTool(std::vector<std::string> args, const std::string& input = "",
-                     const char* outPath = nullptr) {
+                     const char* outPath = nullptr, const std::vector<int>& closed = {}) {
     WriteFile(dir_.File("stdin"), input);
     const ChildResult child = RunChild(
         [&](int resultFd) {
           dup2(open(dir_.File("stdin").c_str(), O_RDONLY), 0);
           dup2(outPath ? open(outPath, O_WRONLY) : resultFd, 1);
           dup2(open(dir_.File("stderr").c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600), 2);
+          for (int fd : closed) close(fd);
           ExecKarstctl(args);
         },
         60);
@@ -272,15 +269,6 @@ TEST_F(Karstctl, BlobCommandsWriteTheRawBytesOrNothing) {
   for (const auto& [args, bytes] : cases) EXPECT_EQ(Ok(args), bytes) << args[1];
 }
 
-TEST_F(Karstctl, StoreIsTheOptionElseTheEnvironment) {
-  Ok({"reset"});
-  const std::string other = dir_.File("other.db");
-  UseStoreAt(other);
-  EXPECT_EQ(RunTool({"import", "-"}, R"({"policies": [{"name": "env"}]})").status, 0);
-  EXPECT_THAT(RunTool({"--store=" + other, "policies", "list"}).out, HasSubstr("env"));
-  EXPECT_EQ(RunTool({"--store", store_, "policies", "list"}).out, "[]\n");
-}
-
 // Every rejected command line or input exits 2 naming what is wrong, and
 // leaves the store file as it was, byte for byte.
 TEST_F(Karstctl, BadCommandLinesAndInputsExitTwoAndLeaveTheStoreAlone) {
@@ -413,19 +401,19 @@ TEST_F(Karstctl, BadLocatorsExitTwoBeforeAnythingIsCreated) {
   const std::string cwd = std::filesystem::current_path(), here = dir_.File("here");
   std::filesystem::create_directory(here);
   std::filesystem::current_path(here);
+  // The whole messages are the locator parser's own tests.
   const std::pair<std::vector<std::string>, std::string> cases[] = {
-      {{"--store", "ETCD://u:cret@h:1/p", "import", "-"},
-       "karstctl: store locator \"ETCD://u:***@h:1/p\" looks like a URL but is no etcd:// or "
-       "etcds:// locator; put ./ in front to make it a file path (bad locator, 1010)\n"},
-      {{"--store", "etcd://u:cret/cret@h:1/p", "watch"},
-       "karstctl: etcd locator: '@' after the endpoints: write it as %40, and a '/' in a user "
-       "name or password as %2F (bad locator, 1010)\n"},
-      {{"policies", "set", "-"},
-       "karstctl: etcd locator: a client certificate needs its key and a key its "
-       "certificate (cert and key) (bad locator, 1010)\n"},
+      {{"--store", "ETCD://u:cret@h:1/p", "import", "-"}, "store locator \"ETCD://u:***@h:1/p\""},
+      {{"--store", "etcd://u:cret/cret@h:1/p", "watch"}, "etcd locator: '@' after the endpoints"},
+      {{"policies", "set", "-"}, "etcd locator: a client certificate needs its key"},
   };
   setenv("TAVO_CONFIGSTORE_PATH", "etcds://u:cret@h:1/p?cert=c", 1);
-  for (const auto& [args, err] : cases) ExpectFailure(RunTool(args, "["), 2, err);
+  for (const auto& [args, err] : cases) {
+    const ToolResult result = RunTool(args, "[");
+    ExpectFailure(result, 2, "karstctl: " + err);
+    EXPECT_THAT(result.err, ::testing::EndsWith(" (bad locator, 1010)\n"));
+    EXPECT_THAT(result.err, ::testing::Not(HasSubstr("cret")));
+  }
   std::filesystem::current_path(cwd);
   EXPECT_TRUE(std::filesystem::is_empty(here));
 }
@@ -435,7 +423,7 @@ TEST_F(Karstctl, BadLocatorsExitTwoBeforeAnythingIsCreated) {
 // with status 0.
 TEST_F(Karstctl, WatchPrintsTheDigestsAgainAtEachChange) {
   Ok({"import", "-"}, R"({"policies": [{"name": "a"}]})");
-  Background watch({"--store", store_, "watch"}, dir_.File("watch.err"));
+  Background watch({"--store", store_, "watch"}, dir_);
   EXPECT_EQ(watch.NextLine(10), HashLine(store_));
   // Each write follows the last line at once, so a watch that slept for
   // seconds between looks would answer late every time.
@@ -452,7 +440,7 @@ TEST_F(Karstctl, WatchPrintsTheDigestsAgainAtEachChange) {
   EXPECT_LT(std::chrono::duration_cast<std::chrono::milliseconds>(fastest).count(), 1000);
   EXPECT_EQ(watch.NextLine(0.5), "");
   EXPECT_EQ(watch.Stop(SIGINT), 0);
-  EXPECT_EQ(ReadFile(dir_.File("watch.err")), "");
+  EXPECT_EQ(watch.Errors(), "");
 }
 
 // Watching a store that does not exist yet creates nothing, and prints when
@@ -461,17 +449,17 @@ TEST_F(Karstctl, WatchPrintsTheDigestsAgainAtEachChange) {
 // SIGTERM ends the watch with status 0 too.
 TEST_F(Karstctl, WatchWaitsForTheStoreAndOutlastsFailedReads) {
   Ok({"reset"});
-  const std::string later = dir_.File("later/store.db"), err = dir_.File("watch.err");
-  Background watch({"--store", later, "watch"}, err);
+  const std::string later = dir_.File("later/store.db");
+  Background watch({"--store", later, "watch"}, dir_);
   EXPECT_EQ(watch.NextLine(10), HashLine(store_));
   EXPECT_EQ(watch.NextLine(0.5), "");
   EXPECT_FALSE(std::filesystem::exists(dir_.File("later")));
 
   std::filesystem::create_directory(dir_.File("later"));
   WriteFile(later, std::string(8192, 'G'));
-  for (int i = 0; i < 100 && ReadFile(err).empty(); ++i) usleep(50000);
-  EXPECT_THAT(ReadFile(err), ::testing::MatchesRegex("(karstctl: warning: [^\n]*\\(SQLITE_NOTADB, "
-                                                     "26\\); trying again\n)+"));
+  EXPECT_THAT(watch.Errors(5),
+              ::testing::MatchesRegex("(karstctl: warning: [^\n]*\\(SQLITE_NOTADB, "
+                                      "26\\); trying again\n)+"));
   EXPECT_EQ(ReadFile(later), std::string(8192, 'G'));
   std::filesystem::remove(later);
   ASSERT_EQ(RunTool({"--store", later, "import", "-"}, R"({"policies": [{"name": "a"}]})").status,
@@ -488,36 +476,32 @@ TEST_F(Karstctl, WatchReadsAgainUntilAReadSucceeds) {
   const std::string store = etcd.Locator("limited/karst");
   ASSERT_EQ(RunTool({"--store", store, "import", "-"}, R"({"policies": [{"name": "a"}]})").status,
             0);
-  const std::string err = dir_.File("watch.err");
-  Background watch({"--store", etcd.Locator("limited/karst", {"limited"}), "watch"}, err);
+  Background watch({"--store", etcd.Locator("limited/karst", {"limited"}), "watch"}, dir_);
   EXPECT_EQ(watch.NextLine(10), HashLine(store));
 
   etcd.Etcdctl(
       {"role", "revoke-permission", "limited", "--prefix=true", EtcdCluster::kLimitedPrefix});
   ASSERT_EQ(RunTool({"--store", store, "import", "-"}, R"({"policies": [{"name": "b"}]})").status,
             0);
-  for (int i = 0; i < 200 && ReadFile(err).empty(); ++i) usleep(50000);
-  EXPECT_THAT(ReadFile(err), HasSubstr("(etcd PERMISSION_DENIED, 1107); trying again\n"));
+  EXPECT_THAT(watch.Errors(10), HasSubstr("(etcd PERMISSION_DENIED, 1107); trying again\n"));
   etcd.Etcdctl({"role", "grant-permission", "limited", "--prefix=true", "readwrite",
                 EtcdCluster::kLimitedPrefix});
   EXPECT_EQ(watch.NextLine(10), HashLine(store));
   EXPECT_EQ(watch.Stop(SIGINT), 0);
 }
 
-TEST_F(Karstctl, UnwritableOutputExitsOne) {
+// Output that cannot be written exits 1. Started with standard input or
+// output closed, karstctl reads and writes nothing there, never a descriptor
+// some library opened in its place.
+TEST_F(Karstctl, UnwritableOrClosedStandardDescriptors) {
   Ok({"import", "-"},
-     R"({"policies": [{"name": "n", "policy_id": "p", "blobs": [{"datastore_namespace": "CORRA", "blob": "b"}]}]})");
-  const std::vector<std::string> commands[] = {
-      {"--store", store_, "export"}, {"--store", store_, "blob", "corra-by-id", "p"}, {"--help"}};
-  for (const auto& args : commands) {
+     R"({"policies": [{"name": "kept", "policy_id": "p", "blobs": [{"datastore_namespace": "CORRA", "blob": "b"}]}]})");
+  for (const std::vector<std::string>& args :
+       {std::vector<std::string>{"--store", store_, "export"},
+        {"--store", store_, "blob", "corra-by-id", "p"},
+        {"--help"}}) {
     ExpectFailure(RunTool(args, "", "/dev/full"), 1, "cannot write standard output");
   }
-}
-
-// Started with standard input or output closed, karstctl reads and writes
-// nothing there, never a descriptor some library opened in its place.
-TEST_F(Karstctl, ClosedStandardDescriptorsAreNobodyElses) {
-  Ok({"import", "-"}, R"({"policies": [{"name": "kept"}]})");
   const std::string before = ReadFile(store_);
   const struct {
     std::vector<int> closed;
@@ -525,28 +509,19 @@ TEST_F(Karstctl, ClosedStandardDescriptorsAreNobodyElses) {
     int status;
     std::string err;  // "" with standard error closed
   } cases[] = {
-      {{0}, {"import", "-"}, 2, "karstctl: <stdin>:1:1: syntax error while parsing value"},
-      {{1}, {"hash"}, 0, ""},
-      {{0, 1, 2}, {"import", "-"}, 2, ""},
+      {{0},
+       {"--store", store_, "import", "-"},
+       2,
+       "karstctl: <stdin>:1:1: syntax error while parsing value"},
+      {{1}, {"--store", store_, "hash"}, 0, ""},
+      {{0, 1, 2}, {"--store", store_, "import", "-"}, 2, ""},
   };
   for (const auto& c : cases) {
-    SCOPED_TRACE(c.args[0]);
-    const std::string err = dir_.File("stderr");
-    WriteFile(err, "");
-    const ChildResult child = RunChild(
-        [&](int resultFd) {
-          dup2(resultFd, 1);
-          dup2(open(err.c_str(), O_WRONLY), 2);
-          for (int fd : c.closed) close(fd);
-          std::vector<std::string> args = {"--store", store_};
-          args.insert(args.end(), c.args.begin(), c.args.end());
-          ExecKarstctl(args);
-        },
-        60);
-    EXPECT_TRUE(child.exited) << child.Describe();
-    EXPECT_EQ(child.code, c.status);
-    EXPECT_EQ(child.output, "");
-    EXPECT_THAT(ReadFile(err), ::testing::StartsWith(c.err));
+    SCOPED_TRACE(c.args[2]);
+    const ToolResult result = RunTool(c.args, "", nullptr, c.closed);
+    EXPECT_EQ(result.status, c.status);
+    EXPECT_EQ(result.out, "");
+    EXPECT_THAT(result.err, ::testing::StartsWith(c.err));
     EXPECT_EQ(ReadFile(store_), before);
   }
 }
@@ -627,6 +602,8 @@ TEST_F(Karstctl, WritesWarnAboutRecordsTheStoreCollapses) {
   EXPECT_EQ(KarstLib::ListDatastoreInfo().size(), 2u);
 }
 
+// Options go anywhere on the line, --store wins over the environment, and
+// each command has its help.
 TEST_F(Karstctl, OptionsGoAnywhereAndEachCommandHasItsHelp) {
   EXPECT_EQ(RunTool({"blob", "corra-by-name", "--help"}).out,
             "Usage: karstctl [OPTIONS] blob corra-by-name NAME\n"
@@ -635,6 +612,10 @@ TEST_F(Karstctl, OptionsGoAnywhereAndEachCommandHasItsHelp) {
   EXPECT_EQ(group.status, 0);
   EXPECT_EQ(std::count(group.out.begin(), group.out.end(), '\n'), 4 * 3 - 1) << group.out;
   Ok({"policies", "set", "-"}, R"([{"name": "-n", "policy_id": "p"}])");
+  const std::string other = dir_.File("other.db");
+  UseStoreAt(other);
+  EXPECT_EQ(RunTool({"import", "-"}, R"({"policies": [{"name": "env"}]})").status, 0);
+  EXPECT_THAT(RunTool({"--store=" + other, "policies", "list"}).out, HasSubstr("env"));
   EXPECT_THAT(RunTool({"policies", "list", "--store", store_}).out, HasSubstr("\"-n\""));
   EXPECT_EQ(RunTool({"export", "--store=" + store_, "--wait", "2.5"}).status, 0);
 }

@@ -32,16 +32,7 @@
 namespace TavoConfigStore {
 namespace {
 
-using karst_test::CodeOf;
-using karst_test::Describe;
-using karst_test::Dump;
-using karst_test::Filter;
-using karst_test::List;
-using karst_test::Obj;
-using karst_test::RawDb;
-using karst_test::ReadFile;
-using karst_test::Set;
-using karst_test::WriteFile;
+using namespace karst_test;  // NOLINT: the suite's own helpers
 using ::testing::ElementsAre;
 using ::testing::ElementsAreArray;
 
@@ -51,14 +42,13 @@ class StoreConformance : public ::testing::TestWithParam<std::string> {
     if (GetParam() == "etcd") {
       // A catalogue of its own for each test.
       static int tests = 0;
-      store_ = OpenStore(
-          karst_test::SharedEtcdCluster().Locator("conformance" + std::to_string(++tests)));
+      store_ = OpenStore(SharedEtcdCluster().Locator("conformance" + std::to_string(++tests)));
     } else {
       store_ = GetParam() == "memory" ? NewMemoryStore() : NewSqliteStore(dir_.File("store.db"));
     }
   }
 
-  karst_test::ScratchDir dir_;
+  ScratchDir dir_;
   std::shared_ptr<ConfigStore> store_;  // closed before the folder goes
 };
 
@@ -305,7 +295,7 @@ class SqliteStoreTest : public ::testing::Test {
  protected:
   std::string Path(const std::string& name = "store.db") const { return dir_.File(name); }
 
-  karst_test::ScratchDir dir_;
+  ScratchDir dir_;
 };
 
 TEST_F(SqliteStoreTest, ConnectionsSeeOnlyCommittedWrites) {
@@ -338,42 +328,30 @@ TEST_F(SqliteStoreTest, ConnectionsSeeOnlyCommittedWrites) {
 // The catalogue is private whatever the umask: directories the store makes
 // 0700, the file and its -wal and -shm 0600.
 TEST_F(SqliteStoreTest, NewStoreIsPrivateUnderAnyUmask) {
+  auto mode = [](const std::string& file) {
+    struct stat st {};
+    EXPECT_EQ(stat(file.c_str(), &st), 0) << file;
+    return st.st_mode & 07777;
+  };
   for (const mode_t mask : {022, 0}) {
     const mode_t old = umask(mask);
     const std::string top = Path("u" + std::to_string(mask)), path = top + "/a/store.db";
     Set(*NewSqliteStore(path), Sample("x"));
     umask(old);
-    for (const auto& [file, mode] : {std::pair{top, 0700},
-                                     {top + "/a", 0700},
-                                     {path, 0600},
-                                     {path + "-wal", 0600},
-                                     {path + "-shm", 0600}}) {
-      struct stat st {};
-      ASSERT_EQ(stat(file.c_str(), &st), 0) << file;
-      EXPECT_EQ(st.st_mode & 07777, static_cast<mode_t>(mode)) << file << " umask " << mask;
+    for (const auto& [file, expected] : {std::pair{top, 0700},
+                                         {top + "/a", 0700},
+                                         {path, 0600},
+                                         {path + "-wal", 0600},
+                                         {path + "-shm", 0600}}) {
+      EXPECT_EQ(mode(file), static_cast<mode_t>(expected)) << file << " umask " << mask;
     }
     // Shared with a group by a chmod of the file: the next writer to open
     // the store gives the -wal and -shm the same mode, or the group could
     // not read it.
     chmod(path.c_str(), 0640);
     NewSqliteStore(path);
-    for (const char* suffix : {"-wal", "-shm"}) {
-      struct stat st {};
-      ASSERT_EQ(stat((path + suffix).c_str(), &st), 0);
-      EXPECT_EQ(st.st_mode & 07777, 0640u) << suffix;
-    }
+    for (const char* suffix : {"-wal", "-shm"}) EXPECT_EQ(mode(path + suffix), 0640u) << suffix;
   }
-}
-
-// Reading a store nobody has written finds it empty and creates nothing; a
-// write creates it.
-TEST_F(SqliteStoreTest, ReadsOfAMissingStoreCreateNothing) {
-  auto store = NewSqliteStore(Path("missing/store.db"));
-  EXPECT_TRUE(store->GetObjects(Filter()).empty());
-  EXPECT_EQ(store->GetObject(Sample("x")->Id()), nullptr);
-  EXPECT_FALSE(std::filesystem::exists(Path("missing")));
-  Set(*store, Sample("x"));
-  EXPECT_THAT(List(*NewSqliteStore(Path("missing/store.db"))), ElementsAre("x"));
 }
 
 // A link at the store's name (or its log's) is refused, the target untouched:
@@ -449,12 +427,14 @@ TEST_F(SqliteStoreTest, WriterWaitsForAnotherConnectionsLock) {
 
 // A watcher sees another connection's commit within a poll or two, also one
 // made before it began to wait, and times out when nothing is committed.
-// Waiting for a store that does not exist creates nothing; the file's
-// appearance is the change.
+// Reading or waiting for a store that does not exist finds it empty and
+// creates nothing; the file's appearance is the change.
 TEST_F(SqliteStoreTest, WaitForChangeSeesOtherConnectionsCommits) {
   using std::chrono::milliseconds;
   auto watcher = NewSqliteStore(Path("new/store.db"));
   auto writer = NewSqliteStore(Path("new/store.db"));
+  EXPECT_TRUE(writer->GetObjects(Filter()).empty());
+  EXPECT_EQ(writer->GetObject(Sample("first")->Id()), nullptr);
   // How long a wait with that timeout took, and what it said.
   auto timed = [&watcher](int timeoutMs) {
     const auto start = std::chrono::steady_clock::now();
@@ -481,6 +461,7 @@ TEST_F(SqliteStoreTest, WaitForChangeSeesOtherConnectionsCommits) {
   Set(*writer, Sample("before the wait"));
   EXPECT_TRUE(watcher->WaitForChange(0));
   EXPECT_FALSE(watcher->WaitForChange(0));
+  EXPECT_THAT(List(*watcher), ElementsAre("first", "second", "before the wait"));
   watcher->BeginTransaction();
   EXPECT_EQ(CodeOf([&] { watcher->WaitForChange(0); }), SQLITE_MISUSE);
   watcher->AbortTransaction();
@@ -513,7 +494,7 @@ TEST_F(SqliteStoreTest, WaitForChangeFollowsTheFileAtThePath) {
 // after that would be committed alone at once, beyond the caller's Abort,
 // and a Commit reporting success would lose the earlier writes silently.
 TEST_F(SqliteStoreTest, RefusesToCarryOnAfterSqliteRolledBack) {
-  karst_test::FaultVfs::Install();
+  FaultVfs::Install();
   auto store = NewSqliteStore(Path());
   Set(*store, Sample("kept"));
   const auto before = Dump(*store);
@@ -522,9 +503,9 @@ TEST_F(SqliteStoreTest, RefusesToCarryOnAfterSqliteRolledBack) {
   for (const bool commit : {true, false}) {
     store->BeginTransaction();
     Set(*store, Sample("lost"));
-    karst_test::FaultVfs::Arm({karst_test::IoFault::kFail, karst_test::io::kWrite, 1, true});
+    FaultVfs::Arm({IoFault::kFail, io::kWrite, 1, true});
     const std::int32_t failed = CodeOf([&] { Set(*store, big); });
-    karst_test::FaultVfs::Disarm();
+    FaultVfs::Disarm();
     ASSERT_EQ(failed & 0xff, SQLITE_IOERR) << failed;
     EXPECT_EQ(CodeOf([&] { Set(*store, Sample("after")); }), SQLITE_ABORT_ROLLBACK);
     EXPECT_EQ(CodeOf([&] { store->DeleteObjects(Filter()); }), SQLITE_ABORT_ROLLBACK);
@@ -546,7 +527,7 @@ TEST_F(SqliteStoreTest, RefusesToCarryOnAfterSqliteRolledBack) {
 // library's level; these are the store's own checks of its schema.
 TEST_F(SqliteStoreTest, RefusesFilesThatAreNotStoresAndLeavesThemAlone) {
   NewSqliteStore(Path("future"));
-  karst_test::WriteFile(Path("random"), std::string(8192, 'Z'));
+  WriteFile(Path("random"), std::string(8192, 'Z'));
   const struct {
     const char* name;
     const char* sql;
@@ -561,11 +542,11 @@ TEST_F(SqliteStoreTest, RefusesFilesThatAreNotStoresAndLeavesThemAlone) {
   for (const auto& c : cases) {
     SCOPED_TRACE(c.name);
     if (*c.sql) RawDb(Path(c.name), SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE).Exec(c.sql);
-    const std::string before = karst_test::ReadFile(Path(c.name));
+    const std::string before = ReadFile(Path(c.name));
     for (int attempt = 0; attempt < 2; ++attempt) {  // nothing was half set up
       EXPECT_EQ(CodeOf([&] { NewSqliteStore(Path(c.name)); }), c.code);
     }
-    EXPECT_EQ(karst_test::ReadFile(Path(c.name)), before);
+    EXPECT_EQ(ReadFile(Path(c.name)), before);
     EXPECT_FALSE(std::filesystem::exists(Path(c.name) + "-wal"));
   }
 }
@@ -694,7 +675,7 @@ TEST_F(SqliteStoreTest, ThreadsMayReadObjectsTogether) {
 // last handle given out, and kept when a handle is merely dropped.
 TEST_F(SqliteStoreTest, DefaultStoreAbandonsTransactionsOnlyWhenUnwinding) {
   EXPECT_EQ(CodeOf([] { ConfigStore::GetStore("elsewhere"); }), kErrorUnknownNamespace);
-  karst_test::UseStoreAt(Path("a.db"));
+  UseStoreAt(Path("a.db"));
   try {
     auto store = ConfigStore::GetStore(sGlobalNamespace);
     store->BeginTransaction();
@@ -706,7 +687,7 @@ TEST_F(SqliteStoreTest, DefaultStoreAbandonsTransactionsOnlyWhenUnwinding) {
   ConfigStore::GetStore(sGlobalNamespace)->BeginTransaction();
   Set(*ConfigStore::GetStore(sGlobalNamespace), Sample("kept"));
   ConfigStore::GetStore(sGlobalNamespace)->CommitTransaction();
-  karst_test::UseStoreAt(Path("b.db"));
+  UseStoreAt(Path("b.db"));
   Set(*ConfigStore::GetStore(sGlobalNamespace), Sample("b"));
   EXPECT_THAT(List(*NewSqliteStore(Path("a.db"))), ElementsAre("kept"));
   EXPECT_THAT(List(*NewSqliteStore(Path("b.db"))), ElementsAre("b"));

@@ -29,6 +29,7 @@ namespace {
 using karst_test::EtcdCluster;
 using karst_test::EtcdKeys;
 using karst_test::Filter;
+using karst_test::Set;
 using karst_test::SharedEtcdCluster;
 using karst_test::StoreRoot;
 using karst_test::Valued;
@@ -39,17 +40,6 @@ std::shared_ptr<ConfigStore> StoreAt(const std::string& prefix) {
   options.endpoints = {SharedEtcdCluster().Endpoint(0)};
   options.prefix = prefix;
   return NewEtcdStore(options);
-}
-
-void Set(ConfigStore& store, const std::string& instance, const std::string& value) {
-  karst_test::Set(store, Valued(instance, value));
-}
-
-std::string Printable(const std::string& bytes) {
-  std::string out;
-  for (unsigned char c : bytes)
-    out += c >= 0x20 && c < 0x7f ? std::string(1, c) : "\\" + std::to_string(c);
-  return out;
 }
 
 // Writers on every store at once, after a dead writer left a generation in
@@ -84,16 +74,16 @@ TEST(EtcdLayoutTest, NeighbouringStoresKeepToTheirOwnKeys) {
       for (int round = 0; round < 4; ++round) {
         store->BeginTransaction();
         store->DeleteObjects(Filter("k", "g", "c"));
-        for (int i = 0; i <= round; ++i) Set(*store, "o" + std::to_string(i), prefix);
+        for (int i = 0; i <= round; ++i) Set(*store, Valued("o" + std::to_string(i), prefix));
         store->CommitTransaction();
-        Set(*store, "last", prefix + std::to_string(round));  // in place
+        Set(*store, Valued("last", prefix + std::to_string(round)));  // in place
       }
     });
   }
   for (std::thread& writer : writers) writer.join();
 
   for (const std::string& prefix : prefixes) {
-    SCOPED_TRACE(Printable(prefix));
+    SCOPED_TRACE(::testing::PrintToString(prefix));
     EXPECT_EQ(ValuesOf(*StoreAt(prefix)),
               (std::vector<std::string>{"o0=" + prefix, "o1=" + prefix, "o2=" + prefix,
                                         "o3=" + prefix, "last=" + prefix + "3"}));
@@ -103,7 +93,7 @@ TEST(EtcdLayoutTest, NeighbouringStoresKeepToTheirOwnKeys) {
   for (const auto& kv : raw.List("/m")) {
     int owners = 0;
     for (const std::string& prefix : prefixes) owners += kv.first.rfind(StoreRoot(prefix), 0) == 0;
-    EXPECT_EQ(owners, 1) << Printable(kv.first);
+    EXPECT_EQ(owners, 1) << ::testing::PrintToString(kv.first);
   }
 
   // A store cleared leaves its neighbours as they were.

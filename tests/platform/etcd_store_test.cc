@@ -11,9 +11,11 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <functional>
+#include <map>
 #include <sstream>
 #include <string>
 #include <thread>
@@ -196,41 +198,6 @@ TEST(EtcdStoreTest, RacingWritersConflictOnlyWhenWhatTheyReadChanged) {
   EXPECT_EQ(ValuesOf(*other), std::vector<std::string>{"b=mine"});
 }
 
-// A reader asks for the generation it read last together with the pointer.
-// Once another writer has moved the collection to a new generation, or
-// removed it, the reader's look-ups and listings show that, not what it read
-// before.
-TEST(EtcdStoreTest, ReadersFollowAnotherWritersNewGeneration) {
-  const std::string locator = SharedEtcdCluster().Locator("follow");
-  auto reader = OpenStore(locator);
-  auto writer = OpenStore(locator);
-  auto value = [&](const std::string& instance) {
-    auto o = reader->GetObject(ConfigStoreObjectId("k", "g", "c", instance));
-    std::string v = "absent";
-    if (o) o->GetValue("v", &v);
-    return v;
-  };
-  auto listing = [&] { return ValuesOf(*reader, Filter("k", "g", "c")); };
-  Set(*writer, Valued("a", "1"));
-  EXPECT_EQ(value("a"), "1");
-  EXPECT_EQ(listing(), std::vector<std::string>{"a=1"});
-
-  writer->BeginTransaction();
-  Clear(*writer);
-  Set(*writer, Valued("b", "2"));
-  writer->CommitTransaction();
-  EXPECT_EQ(value("a"), "absent");
-  EXPECT_EQ(value("b"), "2");
-  EXPECT_EQ(listing(), std::vector<std::string>{"b=2"});
-
-  Clear(*writer);
-  EXPECT_EQ(value("b"), "absent");
-  EXPECT_THAT(listing(), ::testing::IsEmpty());
-  Set(*writer, Valued("c", "3"));
-  EXPECT_EQ(listing(), std::vector<std::string>{"c=3"});
-  EXPECT_EQ(value("c"), "3");
-}
-
 // "instance=value" of each object of collection "k", or "instance!why" for
 // one that cannot be read, in order.
 std::vector<std::string> Describe(ConfigStore& store) {
@@ -256,9 +223,10 @@ std::string Revision(const EtcdCluster& etcd) {
 }
 
 // Whatever changes a collection, a reader that keeps listings between reads
-// lists, read after read, exactly what a reader that keeps none lists:
-// order, values, damage and all; and what a caller does to the objects it
-// got does not reach the next listing.
+// lists and looks up, read after read, exactly what a reader that keeps none
+// finds: order, values, damage and all, also once another writer has moved
+// the collection to a new generation or removed it; and what a caller does
+// to the objects it got does not reach the next listing.
 TEST(EtcdStoreTest, AKeptListingIsWhatAFreshReadFinds) {
   EtcdCluster& etcd = SharedEtcdCluster();
   const std::string locator = etcd.Locator("kept");
@@ -307,10 +275,36 @@ TEST(EtcdStoreTest, AKeptListingIsWhatAFreshReadFinds) {
       {"the collection cleared", [&] { Clear(*writer); }},
       {"written again", [&] { Set(*another, Valued("j", "j")); }},
   };
+  // Describe's entries, found by looking up each object ever written, in
+  // name order.
+  const auto lookUp = [](ConfigStore& store) {
+    std::vector<std::string> found;
+    for (const std::string i : {"a", "b", "c", "d", "e", "f", "g", "h", "i", "j"}) {
+      const auto o = store.GetObject(ConfigStoreObjectId("k", "g", "c", i));
+      if (!o) continue;
+      std::string v;
+      const ConfigStoreException e = ErrorOf([&] { o->GetValue("v", &v); });
+      found.push_back(i + (e.Code() ? "!" + e.Message() : "=" + v));
+    }
+    return found;
+  };
+  // What both must list where a reader stuck on the generation it read last
+  // would show the old one.
+  const std::map<std::string, std::vector<std::string>> known = {
+      {"a replace", {"f=f", "e=e"}}, {"the collection cleared", {}}, {"written again", {"j=j"}}};
   for (const auto& [what, change] : changes) {
     change();
+    // The keeping reader looks up before it lists, the fresh one lists first.
+    const std::vector<std::string> keptLookUps = lookUp(*keeping);
     const std::vector<std::string> expected = Describe(*fresh);
     EXPECT_EQ(Describe(*keeping), expected) << "after " << what;
+    if (known.count(what)) {
+      EXPECT_EQ(expected, known.at(what));
+    }
+    std::vector<std::string> byName = expected;
+    std::sort(byName.begin(), byName.end());
+    EXPECT_EQ(keptLookUps, byName) << "after " << what;
+    EXPECT_EQ(lookUp(*fresh), byName) << "after " << what;
     for (const auto& o : keeping->GetObjects(
              std::make_shared<FilterSpecObject>(ConfigStoreObjectId("k", "g", "c")))) {
       o->SetValue("v", "changed by a caller");
@@ -361,9 +355,20 @@ TEST(EtcdStoreTest, AnUnchangedCollectionCostsTheClusterASmallRead) {
 }
 
 // A writer that dies mid-replace leaves a generation nobody points at; once
-// its lease is gone the next writer removes it, and readers never saw it.
-TEST(EtcdStoreTest, ADeadWritersGenerationIsRemovedByTheNextWriter) {
+// its lease is gone the next writer removes it, and readers never saw it. A
+// writer renews its one lease from replace to replace rather than granting
+// one each time, and gets a new one when it has gone.
+TEST(EtcdStoreTest, ADeadWritersGenerationGoesWithItsLeaseAndAWriterKeepsOne) {
   EtcdCluster& etcd = SharedEtcdCluster();
+  auto leases = [&] {
+    std::istringstream out(etcd.Etcdctl({"lease", "list"}));
+    std::string line;
+    std::vector<std::string> ids;
+    std::getline(out, line);  // "found N leases"
+    while (out >> line) ids.push_back(line);
+    return ids;
+  };
+  for (const std::string& id : leases()) etcd.Etcdctl({"lease", "revoke", id});
   auto store = OpenStore(etcd.Locator("dead"));
   Set(*store, Valued("kept", "old"));
   // What a writer leaves when it dies after its first batch.
@@ -380,31 +385,14 @@ TEST(EtcdStoreTest, ADeadWritersGenerationIsRemovedByTheNextWriter) {
   Set(*store, Valued("new", "1"));  // the writer's lease still runs: left alone
   EXPECT_EQ(RawKeys(etcd, "dead", "g/0123456789abcdef/").size(), 2u);
   raw.RevokeLease(lease);
-  Clear(*store);
-  Set(*store, Valued("newer", "2"));
+  for (int i = 0; i < 3; ++i) {
+    Clear(*store);
+    Set(*store, Valued("newer", std::to_string(i)));
+  }
   EXPECT_THAT(RawKeys(etcd, "dead", "g/0123456789abcdef/"), ::testing::IsEmpty());
   EXPECT_EQ(RawKeys(etcd, "dead", "r/").size(), 1u);
   EXPECT_EQ(ValuesOf(*store), std::vector<std::string>{"newer=2"});
-}
 
-// A writer renews its one lease from replace to replace rather than granting
-// one each time, and gets a new one when it has gone.
-TEST(EtcdStoreTest, AWriterKeepsOneLeaseAcrossReplaces) {
-  EtcdCluster& etcd = SharedEtcdCluster();
-  auto leases = [&] {
-    std::istringstream out(etcd.Etcdctl({"lease", "list"}));
-    std::string line;
-    std::vector<std::string> ids;
-    std::getline(out, line);  // "found N leases"
-    while (out >> line) ids.push_back(line);
-    return ids;
-  };
-  for (const std::string& id : leases()) etcd.Etcdctl({"lease", "revoke", id});
-  auto store = OpenStore(etcd.Locator("leases"));
-  for (int i = 0; i < 3; ++i) {
-    Clear(*store);
-    Set(*store, Valued("a", std::to_string(i)));
-  }
   const std::vector<std::string> kept = leases();
   ASSERT_EQ(kept.size(), 1u);
   etcd.Etcdctl({"lease", "revoke", kept[0]});
@@ -412,7 +400,7 @@ TEST(EtcdStoreTest, AWriterKeepsOneLeaseAcrossReplaces) {
   Set(*store, Valued("a", "after"));
   EXPECT_EQ(ValuesOf(*store), std::vector<std::string>{"a=after"});
   EXPECT_EQ(leases().size(), 1u);
-  EXPECT_THAT(RawKeys(etcd, "leases", "w/"), ::testing::IsEmpty());
+  EXPECT_THAT(RawKeys(etcd, "dead", "w/"), ::testing::IsEmpty());
 }
 
 // With every member refusing, every operation fails at once (not at the
@@ -479,8 +467,7 @@ std::string RefusingEndpoint() {
 // A member that does not answer holds a request about a second before the
 // next member gets it; one that refuses holds it not at all. The member that
 // answered is asked first from then on, so the next call is not held again.
-// With no member answering, a request ends at the timeout; with every one
-// refusing, at once.
+// With no member answering, a request ends at the timeout.
 TEST(EtcdStoreTest, ARequestGoesToAMemberThatAnswers) {
   const SilentMember silent;
   const std::string good = SharedEtcdCluster().Endpoint(0);
@@ -497,7 +484,6 @@ TEST(EtcdStoreTest, ARequestGoesToAMemberThatAnswers) {
       {"refusing first", refusing + "," + good, 5000, 0, 0, 1000},
       {"all silent", silent.Endpoint() + "," + silent.Endpoint(), 1500, kErrorEtcdBase + 4, 1400,
        3000},
-      {"all refusing", refusing + "," + RefusingEndpoint(), 5000, kErrorEtcdBase + 14, 0, 1000},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.name);

@@ -7,6 +7,7 @@
 #include <cstdio>
 #include <memory>
 #include <stdexcept>
+#include <utility>
 
 namespace karst_test {
 namespace {
@@ -31,7 +32,7 @@ auto ReadPem(const std::string& path, Read read) {
 // Signs a new key's certificate with "issuerKey" (the new key itself when
 // null) and writes both files.
 CertificateFiles Make(const std::string& dir, const std::string& name, Validity validity,
-                      X509* issuer, EVP_PKEY* issuerKey) {
+                      X509* issuer, EVP_PKEY* issuerKey, const std::string& subjectAltName) {
   Key key(EVP_EC_gen("P-256"), EVP_PKEY_free);
   Certificate certificate(X509_new(), X509_free);
   Check(key && certificate, "no memory");
@@ -49,11 +50,15 @@ CertificateFiles Make(const std::string& dir, const std::string& name, Validity 
   X509V3_CTX context;
   X509V3_set_ctx(&context, issuer ? issuer : certificate.get(), certificate.get(), nullptr, nullptr,
                  0);
-  X509_EXTENSION* constraints = X509V3_EXT_conf_nid(
-      nullptr, &context, NID_basic_constraints, issuer ? "critical,CA:FALSE" : "critical,CA:TRUE");
-  Check(constraints != nullptr, "basic constraints");
-  X509_add_ext(certificate.get(), constraints, -1);
-  X509_EXTENSION_free(constraints);
+  for (const auto& [nid, value] :
+       {std::pair{NID_basic_constraints, issuer ? "critical,CA:FALSE" : "critical,CA:TRUE"},
+        {NID_subject_alt_name, subjectAltName.c_str()}}) {
+    if (*value == '\0') continue;
+    X509_EXTENSION* extension = X509V3_EXT_conf_nid(nullptr, &context, nid, value);
+    Check(extension != nullptr, "an extension");
+    X509_add_ext(certificate.get(), extension, -1);
+    X509_EXTENSION_free(extension);
+  }
   Check(X509_sign(certificate.get(), issuerKey ? issuerKey : key.get(), EVP_sha256()) > 0, "sign");
 
   const CertificateFiles files{dir + "/" + name + ".pem", dir + "/" + name + ".key"};
@@ -71,14 +76,15 @@ CertificateFiles Make(const std::string& dir, const std::string& name, Validity 
 }  // namespace
 
 CertificateFiles MakeCa(const std::string& dir, const std::string& name, Validity validity) {
-  return Make(dir, name, validity, nullptr, nullptr);
+  return Make(dir, name, validity, nullptr, nullptr, "");
 }
 
 CertificateFiles MakeSigned(const std::string& dir, const std::string& name,
-                            const CertificateFiles& ca, Validity validity) {
+                            const CertificateFiles& ca, Validity validity,
+                            const std::string& subjectAltName) {
   Certificate issuer(ReadPem(ca.cert, PEM_read_X509), X509_free);
   Key issuerKey(ReadPem(ca.key, PEM_read_PrivateKey), EVP_PKEY_free);
-  return Make(dir, name, validity, issuer.get(), issuerKey.get());
+  return Make(dir, name, validity, issuer.get(), issuerKey.get(), subjectAltName);
 }
 
 }  // namespace karst_test

@@ -21,9 +21,11 @@ struct Validity {
 
 // A self-signed CA, "<dir>/<name>.pem" and "<dir>/<name>.key".
 CertificateFiles MakeCa(const std::string& dir, const std::string& name, Validity validity = {});
-// A client certificate that "ca" signs, in the same two files.
+// A certificate that "ca" signs, in the same two files; a server's names its
+// address in "subjectAltName" ("IP:127.0.0.1").
 CertificateFiles MakeSigned(const std::string& dir, const std::string& name,
-                            const CertificateFiles& ca, Validity validity = {});
+                            const CertificateFiles& ca, Validity validity = {},
+                            const std::string& subjectAltName = "");
 
 }  // namespace karst_test
 

@@ -9,6 +9,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <chrono>
+#include <cstdio>
 #include <cstring>
 #include <exception>
 #include <iostream>
@@ -31,6 +32,24 @@ void WriteAll(int fd, const std::string& bytes) {
     if (n < 0 && errno == EINTR) continue;
     if (n <= 0) return;
     done += static_cast<std::size_t>(n);
+  }
+}
+
+void Exec(const std::vector<std::string>& argv) {
+  std::vector<char*> args;
+  for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
+  args.push_back(nullptr);
+  execvp(args[0], args.data());
+  std::perror(args[0]);
+  _exit(127);
+}
+
+int WaitFor(pid_t pid, double seconds) {
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::duration<double>(seconds);
+  for (int status = 0;; usleep(1000)) {
+    const pid_t r = waitpid(pid, &status, WNOHANG);
+    if (r == pid || (r < 0 && errno != EINTR)) return r == pid ? status : 0;
+    if (std::chrono::steady_clock::now() >= deadline) return -1;
   }
 }
 
@@ -104,19 +123,14 @@ ChildResult RunChild(const std::function<void(int resultFd)>& body, double timeo
     kill(pid, SIGKILL);
   }
   close(fds[0]);
-  int status = 0;
   // EOF may come before the exit; a child stuck after closing its pipe is
   // killed at the deadline all the same.
-  for (;;) {
-    const pid_t r = waitpid(pid, &status, WNOHANG);
-    if (r == pid || (r < 0 && errno != EINTR)) break;
-    if (std::chrono::steady_clock::now() > deadline) {
-      result.timedOut = true;
-      kill(pid, SIGKILL);
-      waitpid(pid, &status, 0);
-      break;
-    }
-    usleep(1000);
+  const std::chrono::duration<double> left = deadline - std::chrono::steady_clock::now();
+  int status = WaitFor(pid, std::max(left.count(), 0.0));
+  if (status == -1) {
+    result.timedOut = true;
+    kill(pid, SIGKILL);
+    waitpid(pid, &status, 0);
   }
   result.exited = WIFEXITED(status);
   result.code = result.exited ? WEXITSTATUS(status) : WTERMSIG(status);

@@ -3,8 +3,11 @@
 #ifndef KARST_TESTS_SUPPORT_CHILD_H_
 #define KARST_TESTS_SUPPORT_CHILD_H_
 
+#include <sys/types.h>
+
 #include <functional>
 #include <string>
+#include <vector>
 
 namespace karst_test {
 
@@ -26,6 +29,14 @@ ChildResult RunChild(const std::function<void(int resultFd)>& body, double timeo
 
 // Writes all of "bytes" to "fd", retrying short writes.
 void WriteAll(int fd, const std::string& bytes);
+
+// Replaces this process with "argv" (a program found on the PATH), or ends it
+// with 127 when that fails.
+[[noreturn]] void Exec(const std::vector<std::string>& argv);
+
+// Waits up to "seconds" for the child "pid" to end: its wait status, or -1
+// while it still runs.
+int WaitFor(pid_t pid, double seconds);
 
 }  // namespace karst_test
 

@@ -18,6 +18,7 @@
 #include <sstream>
 #include <stdexcept>
 
+#include "Certificates.h"
 #include "Child.h"
 
 namespace karst_test {
@@ -78,16 +79,6 @@ std::vector<std::string> Words(const std::string& text) {
   return {std::istream_iterator<std::string>(in), std::istream_iterator<std::string>()};
 }
 
-[[noreturn]] void Exec(const std::vector<std::string>& argv) {
-  std::vector<char*> args;
-  args.reserve(argv.size() + 1);
-  for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
-  args.push_back(nullptr);
-  execvp(args[0], args.data());
-  std::perror(args[0]);
-  _exit(127);
-}
-
 // A process that dies with the calling thread, its output appended to "log".
 pid_t Spawn(const std::vector<std::string>& argv, const std::string& log) {
   const pid_t parent = getpid();
@@ -104,16 +95,6 @@ pid_t Spawn(const std::vector<std::string>& argv, const std::string& log) {
   }
   if (pid < 0) throw std::runtime_error(std::string("fork: ") + std::strerror(errno));
   return pid;
-}
-
-// True once "pid" has ended and been reaped, polling until "deadline".
-bool Reap(pid_t pid, Clock::time_point deadline) {
-  for (;;) {
-    const pid_t r = waitpid(pid, nullptr, WNOHANG);
-    if (r == pid || (r < 0 && errno != EINTR)) return true;
-    if (Clock::now() >= deadline) return false;
-    usleep(10000);
-  }
 }
 
 void KillAndReap(pid_t pid) {
@@ -229,7 +210,7 @@ bool EtcdCluster::WaitUp(const char* state) {
       Member& m = members_[i];
       if (m.pid < 0 || HttpGet(m.metricsPort, "/health").find(state) != std::string::npos) continue;
       up = false;
-      const bool died = Reap(m.pid, Clock::now());
+      const bool died = WaitFor(m.pid, 0) != -1;
       if (!died && Clock::now() <= deadline) continue;
       if (died) m.pid = -1;
       std::string log = ReadFile(m.dir + "/etcd.log");
@@ -244,18 +225,11 @@ bool EtcdCluster::WaitUp(const char* state) {
   }
 }
 
+// The client's name is no user's: only a password lets it in once auth is on.
 void EtcdCluster::MakeCertificates() const {
-  const std::string req =
-      "openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -days 30 -subj "
-      "/CN=karst-test-";
-  const std::string signedByCa =
-      " -CA ca.pem -CAkey ca.key -addext basicConstraints=critical,CA:FALSE";
-  Run(Words(req + "ca -keyout ca.key -out ca.pem"), scratch_.Path());
-  Run(Words(req + "server -keyout server.key -out server.pem -addext subjectAltName=IP:127.0.0.1" +
-            signedByCa),
-      scratch_.Path());
-  // Its name is no user's: only a password lets the client in once auth is on.
-  Run(Words(req + "client -keyout client.key -out client.pem" + signedByCa), scratch_.Path());
+  const CertificateFiles ca = MakeCa(scratch_.Path(), "ca");
+  MakeSigned(scratch_.Path(), "server", ca, {}, "IP:127.0.0.1");
+  MakeSigned(scratch_.Path(), "client", ca);
 }
 
 void EtcdCluster::EnableAuth() const {
@@ -366,7 +340,7 @@ void EtcdCluster::Stop() {
     if (m.pid < 0) continue;
     kill(m.pid, SIGTERM);
     kill(m.pid, SIGCONT);  // a paused member acts on it
-    if (!Reap(m.pid, Clock::now() + std::chrono::milliseconds(500))) KillAndReap(m.pid);
+    if (WaitFor(m.pid, 0.5) == -1) KillAndReap(m.pid);
     m.pid = -1;
   }
 }

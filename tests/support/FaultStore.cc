@@ -64,32 +64,17 @@ class WatchedObject final : public ReportsValueReads<ConfigStoreObject> {
 };
 
 std::function<void()> ThrowerFor(FaultKind kind) {
-  switch (kind) {
-    case FaultKind::kStoreErrorOnce:
-    case FaultKind::kStoreErrorFromThenOn:
-      return [] { throw TavoConfigStore::ConfigStoreException(kFaultMessage, kFaultCode); };
-    case FaultKind::kBadAlloc:
-      return [] { throw std::bad_alloc(); };
-    case FaultKind::kProcessDeath:
-      return [] { _exit(kDeathStatus); };
-  }
-  return nullptr;
+  if (kind == FaultKind::kBadAlloc) return [] { throw std::bad_alloc(); };
+  if (kind == FaultKind::kProcessDeath) return [] { _exit(kDeathStatus); };
+  return [] { throw TavoConfigStore::ConfigStoreException(kFaultMessage, kFaultCode); };
 }
 
 }  // namespace
 
 const char* Describe(FaultKind kind) {
-  switch (kind) {
-    case FaultKind::kStoreErrorOnce:
-      return "store error once";
-    case FaultKind::kStoreErrorFromThenOn:
-      return "store error from then on";
-    case FaultKind::kBadAlloc:
-      return "bad_alloc";
-    case FaultKind::kProcessDeath:
-      return "process death";
-  }
-  return "?";
+  static const char* const kNames[] = {"store error once", "store error from then on", "bad_alloc",
+                                       "process death"};
+  return kNames[static_cast<int>(kind)];
 }
 
 FaultStore::FaultStore(std::shared_ptr<ConfigStore> target) : ForwardingStore(std::move(target)) {}

@@ -9,13 +9,7 @@ namespace karst_test {
 TavoKarst::KarstPolicyInfo Policy(const std::string& name, const std::string& id,
                                   std::vector<TavoKarst::KarstPolicyBlob> blobs,
                                   const std::string& description, std::int64_t generation) {
-  TavoKarst::KarstPolicyInfo p;
-  p.name = name;
-  p.policy_id = id;
-  p.description = description;
-  p.generation_number = generation;
-  p.blobs = std::move(blobs);
-  return p;
+  return {std::move(blobs), name, id, description, generation};
 }
 
 TavoKarst::KarstDatastoreInfo Datastore(const std::string& url, const std::string& ns,
@@ -26,18 +20,6 @@ TavoKarst::KarstDatastoreInfo Datastore(const std::string& url, const std::strin
 }  // namespace karst_test
 
 namespace TavoKarst {
-
-bool operator==(const KarstPolicyBlob& a, const KarstPolicyBlob& b) {
-  return a.blob == b.blob && a.datastore_namespace == b.datastore_namespace;
-}
-bool operator==(const KarstPolicyInfo& a, const KarstPolicyInfo& b) {
-  return a.name == b.name && a.policy_id == b.policy_id && a.description == b.description &&
-         a.generation_number == b.generation_number && a.blobs == b.blobs;
-}
-bool operator==(const KarstDatastoreInfo& a, const KarstDatastoreInfo& b) {
-  return a.url == b.url && a.datastore_namespace == b.datastore_namespace &&
-         a.drp_policy_id == b.drp_policy_id;
-}
 
 // Long byte strings print by length and a prefix, so a failure over a
 // 10 MiB blob stays readable.

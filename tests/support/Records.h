@@ -22,9 +22,18 @@ TavoKarst::KarstDatastoreInfo Datastore(const std::string& url, const std::strin
 
 namespace TavoKarst {
 // Found by argument-dependent lookup, so EXPECT_EQ and matchers print records.
-bool operator==(const KarstPolicyBlob& a, const KarstPolicyBlob& b);
-bool operator==(const KarstPolicyInfo& a, const KarstPolicyInfo& b);
-bool operator==(const KarstDatastoreInfo& a, const KarstDatastoreInfo& b);
+// The comparisons are inline, for the fuzzer's check that links no gtest.
+inline bool operator==(const KarstPolicyBlob& a, const KarstPolicyBlob& b) {
+  return a.blob == b.blob && a.datastore_namespace == b.datastore_namespace;
+}
+inline bool operator==(const KarstPolicyInfo& a, const KarstPolicyInfo& b) {
+  return a.name == b.name && a.policy_id == b.policy_id && a.description == b.description &&
+         a.generation_number == b.generation_number && a.blobs == b.blobs;
+}
+inline bool operator==(const KarstDatastoreInfo& a, const KarstDatastoreInfo& b) {
+  return a.url == b.url && a.datastore_namespace == b.datastore_namespace &&
+         a.drp_policy_id == b.drp_policy_id;
+}
 void PrintTo(const KarstPolicyBlob& b, std::ostream* os);
 void PrintTo(const KarstPolicyInfo& p, std::ostream* os);
 void PrintTo(const KarstDatastoreInfo& d, std::ostream* os);
