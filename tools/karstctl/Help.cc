@@ -30,7 +30,7 @@ std::string HelpText() {
   };
 
   std::string out =
-      "Usage: karstctl [--store PATH] [--wait SECONDS] COMMAND [ARGS]\n"
+      "Usage: karstctl [--store PATH] [--wait SECONDS] [--output FORM] COMMAND [ARGS]\n"
       "       karstctl COMMAND --help\n"
       "\n"
       "Reads and replaces the storage policy and datastore catalogues.\n"
@@ -44,7 +44,14 @@ std::string HelpText() {
   out += line("--wait SECONDS", "how long to wait for another process's write lock");
   out += line("", "(default 10, fractions allowed), or for each etcd request");
   out += line("", "(default the locator's timeout, else 5)");
-  out += line("--help", "print this help, or with a COMMAND that command's usage");
+  out += line("--output FORM", "pretty (indented JSON, the default), json (one document on one");
+  out += line("", "line) or lines (each record of a list on a line of its own); for");
+  out += line("", "commands that print records or digests; watch's default is lines;");
+  out += line("", "with json an error is one JSON object on stderr");
+  out += line("--quiet", "writes, check and diff: warnings as one line of counts per kind");
+  out += line("--strict", "writes, check and diff: any warning exits 2, the store unwritten");
+  out += line("--require", "blob commands: exit 3 when the look-up finds no blob");
+  out += line("--help", "print this help, or with a COMMAND that command's options");
   out += line("--version", "print the version");
   out += line("--", "ends the options: later words starting with - are operands");
   out +=
@@ -76,7 +83,9 @@ std::string HelpText() {
       "  0  success\n"
       "  1  store error, or any other failure\n"
       "  2  usage or input error, or a locator that cannot be used; the input is checked\n"
-      "     whole before the store is touched\n";
+      "     whole before the store is touched\n"
+      "  3  get found no such record, or blob --require found no blob\n"
+      "diff exits 0 when the file would change nothing, 1 when it would, 2 on any failure.\n";
   return out;
 }
 
@@ -84,7 +93,18 @@ std::string CommandHelpText(const std::vector<const CommandEntry*>& topics) {
   std::string out;
   for (const CommandEntry* entry : topics) {
     out += (out.empty() ? "" : "\n") + std::string("Usage: karstctl [OPTIONS] ") +
-           Synopsis(*entry) + "\n  " + entry->summary + "\n";
+           Synopsis(*entry) + "\n  " + entry->summary + "\nOptions:\n";
+    for (const OptionEntry& option : OptionTable()) {
+      // --store and --wait serve every command that opens the store.
+      const bool common = option.name == "--store" || option.name == "--wait";
+      const bool takes = std::find(entry->options.begin(), entry->options.end(), option.name) !=
+                         entry->options.end();
+      if (!(common ? entry->store != StoreUse::kNone : takes)) continue;
+      std::string left = option.name + (option.value.empty() ? "" : " " + option.value);
+      left.resize(std::max<std::size_t>(18, left.size() + 2), ' ');
+      out += "  " + left + option.summary + "\n";
+    }
+    out += "Example:\n  " + entry->example + "\n";
   }
   return out;
 }
