@@ -747,6 +747,20 @@ TEST_F(Karstctl, DiffShowsWhatAWriteWouldChangeAndWritesNothing) {
     std::string out;
   } cases[] = {
       {{"diff", "-"}, kStored, 0, "no changes\n"},
+      {{"diff", "--output", "lines", "-"},
+       R"([{"name": "gold", "policy_id": "p1", "description": "fast"}])",
+       1,
+       R"({"change":"removed","name":"empty","record":{"name":"empty","policy_id":"p2",)"
+       R"("description":"","generation_number":0,"blobs":[{"datastore_namespace":"CORRA",)"
+       R"("blob":""}]},"catalogue":"policies"})"
+       "\n"
+       R"({"change":"changed","name":"gold","fields":[{"field":"blob",)"
+       R"("datastore_namespace":"CORRA","old":"c1","new":null},{"field":"blob",)"
+       R"("datastore_namespace":"NFS","old":"n1","new":null}],"catalogue":"policies"})"
+       "\n"
+       R"({"change":"removed","name":"old","record":{"name":"old","policy_id":"p3",)"
+       R"("description":"","generation_number":0,"blobs":[]},"catalogue":"policies"})"
+       "\n"},
       {{"diff", "-"}, R"({"datastores": []})", 1, ""},
       {{"diff", "-"}, "[]", 2, ""},
       {{"diff", "-"}, "{", 2, ""},

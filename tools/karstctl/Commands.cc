@@ -204,8 +204,9 @@ int Diff(const Invocation& invocation, StoreSession& store) {
     WriteOutput(DiffToText(diff));
   } else if (*invocation.output == OutputForm::kLines) {
     // One change a line, each naming its catalogue.
+    const Json byCatalogue = DiffToJson(diff);
     Json changes = Json::array();
-    for (const auto& [catalogue, list] : DiffToJson(diff).items()) {
+    for (const auto& [catalogue, list] : byCatalogue.items()) {
       for (Json change : list) {
         change["catalogue"] = catalogue;
         changes.push_back(std::move(change));

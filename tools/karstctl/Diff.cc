@@ -32,8 +32,9 @@ std::map<std::string, std::string> BlobsKept(const KarstPolicyInfo& policy) {
 // The policy as the store keeps it: the last blob of each namespace, in the
 // order of their namespaces.
 KarstPolicyInfo Kept(KarstPolicyInfo policy) {
+  const auto blobs = BlobsKept(policy);
   policy.blobs.clear();
-  for (auto& [ns, blob] : BlobsKept(policy)) policy.blobs.push_back({blob, ns});
+  for (const auto& [ns, blob] : blobs) policy.blobs.push_back({blob, ns});
   return policy;
 }
 
