@@ -199,6 +199,8 @@ int Diff(const Invocation& invocation, StoreSession& store) {
   });
   store.Open();
   WarnBeforeWriting(proposed, invocation);
+  // The comparison takes what is stored and what the file would make it,
+  // so any catalogue kept elsewhere (an earlier version) compares alike.
   const CatalogueDiff diff = DiffCatalogues(Stored(), proposed);
   if (!invocation.output) {
     WriteOutput(DiffToText(diff));
