@@ -638,6 +638,8 @@ TEST_F(Karstctl, OptionsGoAnywhereAndEachCommandHasItsHelp) {
             "  --store PATH      the store file or etcd locator; by default "
             "$TAVO_CONFIGSTORE_PATH\n"
             "  --wait SECONDS    how long to wait for another writer's lock or an etcd request\n"
+            "  --output FORM     pretty, json (one line) or lines (a record a line); json: errors "
+            "too\n"
             "  --require         exit 3 when the look-up finds no blob\n"
             "Example:\n"
             "  karstctl blob corra-by-name --require gold > gold.bin\n");
@@ -647,7 +649,7 @@ TEST_F(Karstctl, OptionsGoAnywhereAndEachCommandHasItsHelp) {
     args.push_back("--help");
     const std::string help = RunTool(args).out;
     EXPECT_THAT(help, HasSubstr("Example:\n  karstctl ")) << help;
-    for (const char* option : {"--output", "--quiet", "--strict", "--require"}) {
+    for (const char* option : {"--quiet", "--strict", "--require"}) {
       const bool takes = std::count(entry.options.begin(), entry.options.end(), option) > 0;
       EXPECT_EQ(help.find(std::string("  ") + option) != std::string::npos, takes) << help;
     }
@@ -812,6 +814,8 @@ TEST_F(Karstctl, OutputFormsAndJsonErrors) {
        R"({"code":"not found","number":null,"exit":3,"message":"no policy with name \"zzz\""})"},
       {{"--store", garbage, "export"}, R"({"code":"SQLITE_NOTADB","number":26,"exit":1,)"},
       {{"--colour"}, R"({"code":"usage","number":null,"exit":2,"message":"unknown option)"},
+      {{"--store", store_, "import", "-"},
+       R"({"code":"input","number":null,"exit":2,"message":"<stdin>:1:1: )"},
   };
   for (const auto& [args, start] : errors) {
     std::vector<std::string> withJson = args;

@@ -108,7 +108,7 @@ const std::vector<OptionEntry>& OptionTable() {
   static const std::vector<OptionEntry> table = {
       {"--store", "PATH", "the store file or etcd locator; by default $TAVO_CONFIGSTORE_PATH"},
       {"--wait", "SECONDS", "how long to wait for another writer's lock or an etcd request"},
-      {"--output", "FORM", "pretty (indented JSON), json (one document) or lines (a value a line)"},
+      {"--output", "FORM", "pretty, json (one line) or lines (a record a line); json: errors too"},
       {"--quiet", "", "print warnings as one line of counts per kind"},
       {"--strict", "", "exit 2 at any warning, before the store is written"},
       {"--require", "", "exit 3 when the look-up finds no blob"},
@@ -148,7 +148,6 @@ Invocation ParseArgs(const std::vector<std::string>& args) {
       invocation.waitMs = ParseWaitMs(*seconds);
     } else if (auto form = OptionValue(args, at, "--output", "a FORM")) {
       invocation.output = ParseOutputForm(*form);
-      commandOptions.push_back("--output");
     } else if (arg == "--quiet" || arg == "--strict" || arg == "--require") {
       (arg == "--quiet"    ? invocation.quiet
        : arg == "--strict" ? invocation.strict

@@ -22,7 +22,7 @@ enum class OutputForm { kPretty, kJson, kLines };
 
 // One line of the command table: the words that select the command, the
 // operands it takes, what it does (for --help), what it needs of the store,
-// the options it takes beyond --store, --wait and --help, an example for its
+// the options it takes beyond --store, --wait, --output and --help, an example for its
 // --help, and the function that carries it out. That function reads and
 // checks its input first and then opens the store through "store", which
 // knows the command's StoreUse. It returns the exit status, or throws

@@ -45,9 +45,9 @@ std::string HelpText() {
   out += line("", "(default 10, fractions allowed), or for each etcd request");
   out += line("", "(default the locator's timeout, else 5)");
   out += line("--output FORM", "pretty (indented JSON, the default), json (one document on one");
-  out += line("", "line) or lines (each record of a list on a line of its own); for");
-  out += line("", "commands that print records or digests; watch's default is lines;");
-  out += line("", "with json an error is one JSON object on stderr");
+  out += line("", "line) or lines (each record of a list on a line of its own), for");
+  out += line("", "what a command prints (watch's default is lines; diff's and");
+  out += line("", "status's is text); with json an error is one JSON object on stderr");
   out += line("--quiet", "writes, check and diff: warnings as one line of counts per kind");
   out += line("--strict", "writes, check and diff: any warning exits 2, the store unwritten");
   out += line("--require", "blob commands: exit 3 when the look-up finds no blob");
@@ -98,11 +98,13 @@ std::string CommandHelpText(const std::vector<const CommandEntry*>& topics) {
     out += (out.empty() ? "" : "\n") + std::string("Usage: karstctl [OPTIONS] ") +
            Synopsis(*entry) + "\n  " + entry->summary + "\nOptions:\n";
     for (const OptionEntry& option : OptionTable()) {
-      // --store and --wait serve every command that opens the store.
-      const bool common = option.name == "--store" || option.name == "--wait";
-      const bool takes = std::find(entry->options.begin(), entry->options.end(), option.name) !=
-                         entry->options.end();
-      if (!(common ? entry->store != StoreUse::kNone : takes)) continue;
+      // --store and --wait serve every command that opens the store, and
+      // --output every command (its errors, at least).
+      const bool storeOption = option.name == "--store" || option.name == "--wait";
+      const bool takes = option.name == "--output" ||
+                         std::find(entry->options.begin(), entry->options.end(), option.name) !=
+                             entry->options.end();
+      if (!(storeOption ? entry->store != StoreUse::kNone : takes)) continue;
       std::string left = option.name + (option.value.empty() ? "" : " " + option.value);
       left.resize(std::max<std::size_t>(18, left.size() + 2), ' ');
       out += "  " + left + option.summary + "\n";
