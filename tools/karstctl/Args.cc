@@ -91,7 +91,7 @@ OutputForm ParseOutputForm(const std::string& text) {
   throw UsageError("--output needs pretty, json or lines, not '" + text + "'");
 }
 
-// Options that only some commands take are refused elsewhere, so that a
+// Options that only some commands take are refused by the others, so that a
 // mistaken one is not silently ignored.
 void RequireTakes(const CommandEntry& command, const std::vector<std::string>& given) {
   for (const auto& option : given) {
