@@ -844,6 +844,8 @@ TEST_F(Karstctl, QuietSumsWarningsUpAndStrictWritesNothing) {
       Run({"check", "--quiet", "-"}, "{\"policies\": [], \"datastores\": " + dangling + "}");
   EXPECT_EQ(quiet.status, 0);
   EXPECT_EQ(quiet.err, summary);
+  const ToolResult json = Run({"check", "--quiet", "--output", "json", "-"}, dangling);
+  EXPECT_EQ(json.err, "{\"warnings\":1,\"kinds\":{\"repeated url\":1}}\n");
 
   const std::pair<std::vector<std::string>, std::string> writes[] = {
       {{"datastores", "set", "-"}, dangling},

@@ -1,6 +1,6 @@
 #include "Output.h"
 
-#include <map>
+#include <cstdio>
 
 #include "Errors.h"
 #include "Io.h"
@@ -40,20 +40,38 @@ void PrintJson(const Json& value, OutputForm form) { WriteOutput(RenderJson(valu
 
 void ReportWarnings(const std::vector<Warning>& warnings, const Invocation& invocation) {
   if (warnings.empty()) return;
+  // With --output json, a script reads standard error as JSON lines, one
+  // object a warning or one summary, as it reads an error.
+  const bool json = invocation.output == OutputForm::kJson;
+  auto write = [json](const Json& object, const std::string& text) {
+    if (json) {
+      const std::string line = Compact(object) + "\n";
+      std::fwrite(line.data(), 1, line.size(), stderr);
+    } else {
+      WriteDiagnostic("warning: " + text);
+    }
+  };
   if (invocation.quiet) {
     // Kinds in the order they first occur, so the summary reads like the file.
-    std::vector<std::string> order;
-    std::map<std::string, std::size_t> counts;
+    Json counts = Json::object();
     for (const Warning& warning : warnings) {
-      if (counts[warning.kind]++ == 0) order.push_back(warning.kind);
+      counts[warning.kind] = counts.value(warning.kind, 0) + 1;
     }
-    std::string line = "warning: " + Count(warnings.size(), "warning") + ":";
-    for (const auto& kind : order) {
-      line += (&kind == &order.front() ? " " : ", ") + std::to_string(counts[kind]) + " " + kind;
+    std::string text = Count(warnings.size(), "warning") + ":";
+    for (const auto& [kind, count] : counts.items()) {
+      text += (text.back() == ':' ? " " : ", ") + count.dump() + " " + kind;
     }
-    WriteDiagnostic(line);
+    Json summary = Json::object();
+    summary["warnings"] = warnings.size();
+    summary["kinds"] = counts;
+    write(summary, text);
   } else {
-    for (const Warning& warning : warnings) WriteDiagnostic("warning: " + warning.message);
+    for (const Warning& warning : warnings) {
+      Json object = Json::object();
+      object["warning"] = warning.kind;
+      object["message"] = warning.message;
+      write(object, warning.message);
+    }
   }
   if (invocation.strict) {
     throw InputError(Count(warnings.size(), "warning") +

@@ -19,8 +19,10 @@ std::string RenderJson(const Json& value, OutputForm form);
 void PrintJson(const Json& value, OutputForm form);
 
 // Writes the warnings to standard error, one line each or, with --quiet,
-// one line of counts per kind; with --strict any warning then throws
-// InputError, so the caller writes nothing.
+// one line of counts per kind: text, or with --output json one JSON object a
+// line ({"warning": KIND, "message": TEXT}, or {"warnings": N, "kinds":
+// {KIND: COUNT, ...}}). With --strict any warning then throws InputError, so
+// the caller writes nothing.
 void ReportWarnings(const std::vector<Warning>& warnings, const Invocation& invocation);
 
 // An error as --output json reports it on standard error: one line holding
