@@ -125,11 +125,16 @@ libvelkcore, the links to build against them, the CMake package
 (find_package(karst) and karst::karst) and the pkg-config file karst.pc.")
 
 set(CPACK_DEBIAN_KARSTCTL_PACKAGE_SECTION admin)
+# The completion file uses bash-completion's helpers (_init_completion,
+# _filedir); without the package it does nothing, so it is recommended, not
+# required.
+set(CPACK_DEBIAN_KARSTCTL_PACKAGE_RECOMMENDS bash-completion)
 set(CPACK_DEBIAN_KARSTCTL_DESCRIPTION "command-line tool for the storage policy catalogue
 karstctl does every operation of libkarst from a shell, with JSON in and
 out: it imports and exports the storage policy and datastore catalogues,
-lists them, writes a policy's blob for a namespace and prints the catalogue
-digests. A file is checked whole before the store is touched, so a bad file
-never changes the catalogue.")
+shows what an import would change, lists them or one record, writes a
+policy's blob for a namespace and prints the catalogue digests. A file is
+checked whole before the store is touched, so a bad file never changes the
+catalogue.")
 
 include(CPack)

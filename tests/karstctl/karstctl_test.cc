@@ -19,6 +19,7 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <nlohmann/json.hpp>
 
 #include "Args.h"
 #include "Child.h"
@@ -38,6 +39,7 @@ namespace {
 
 using TavoKarst::KarstLib;
 using ::testing::HasSubstr;
+using Json = nlohmann::json;
 
 struct ToolResult {
   int status;  // exit status; 128 + signal number when killed
@@ -545,7 +547,8 @@ TEST_F(Karstctl, HelpAndVersionNeedNoStore) {
   std::string man = ReadFile(KARSTCTL_SOURCE_DIR "/karstctl.1");
   for (std::size_t at; (at = man.find("\\-")) != std::string::npos;) man.erase(at, 1);
   const std::string completion = ReadFile(KARSTCTL_SOURCE_DIR "/karstctl.bash-completion");
-  std::vector<std::string> names = {"--store", "--wait", "--help", "--version"};
+  std::vector<std::string> names = {"--store",  "--wait",    "--output", "--quiet",
+                                    "--strict", "--require", "--help",   "--version"};
   for (const auto& entry : karstctl::CommandTable()) {
     names.push_back(entry.words[0] + (entry.words.size() > 1 ? " " + entry.words[1] : ""));
     EXPECT_THAT(completion, HasSubstr(entry.words.back()));
@@ -607,10 +610,27 @@ TEST_F(Karstctl, WritesWarnAboutRecordsTheStoreCollapses) {
 TEST_F(Karstctl, OptionsGoAnywhereAndEachCommandHasItsHelp) {
   EXPECT_EQ(RunTool({"blob", "corra-by-name", "--help"}).out,
             "Usage: karstctl [OPTIONS] blob corra-by-name NAME\n"
-            "  CORRA blob of the policy named NAME\n");
-  const ToolResult group = RunTool({"--store", dir_.File("none.db"), "blob", "--help"});
-  EXPECT_EQ(group.status, 0);
-  EXPECT_EQ(std::count(group.out.begin(), group.out.end(), '\n'), 4 * 3 - 1) << group.out;
+            "  CORRA blob of the policy named NAME\n"
+            "Options:\n"
+            "  --store PATH      the store file or etcd locator; by default "
+            "$TAVO_CONFIGSTORE_PATH\n"
+            "  --wait SECONDS    how long to wait for another writer's lock or an etcd request\n"
+            "  --output FORM     pretty, json (one line) or lines (a record a line); json: errors "
+            "too\n"
+            "  --require         exit 3 when the look-up finds no blob\n"
+            "Example:\n"
+            "  karstctl blob corra-by-name --require gold > gold.bin\n");
+  // Each command's help names only the options it takes, and an example.
+  for (const auto& entry : karstctl::CommandTable()) {
+    std::vector<std::string> args = entry.words;
+    args.push_back("--help");
+    const std::string help = RunTool(args).out;
+    EXPECT_THAT(help, HasSubstr("Example:\n  karstctl ")) << help;
+    for (const char* option : {"--quiet", "--strict", "--require"}) {
+      const bool takes = std::count(entry.options.begin(), entry.options.end(), option) > 0;
+      EXPECT_EQ(help.find(std::string("  ") + option) != std::string::npos, takes) << help;
+    }
+  }
   Ok({"policies", "set", "-"}, R"([{"name": "-n", "policy_id": "p"}])");
   const std::string other = dir_.File("other.db");
   UseStoreAt(other);
@@ -618,6 +638,258 @@ TEST_F(Karstctl, OptionsGoAnywhereAndEachCommandHasItsHelp) {
   EXPECT_THAT(RunTool({"--store=" + other, "policies", "list"}).out, HasSubstr("env"));
   EXPECT_THAT(RunTool({"policies", "list", "--store", store_}).out, HasSubstr("\"-n\""));
   EXPECT_EQ(RunTool({"export", "--store=" + store_, "--wait", "2.5"}).status, 0);
+}
+
+const char kStored[] = R"({
+    "policies": [
+      {"name": "gold", "policy_id": "p1", "description": "fast",
+       "blobs": [{"datastore_namespace": "CORRA", "blob": "c1"}, {"datastore_namespace": "NFS", "blob": "n1"}]},
+      {"name": "empty", "policy_id": "p2", "blobs": [{"datastore_namespace": "CORRA", "blob": ""}]},
+      {"name": "old", "policy_id": "p3"}],
+    "datastores": [{"url": "ds://a", "datastore_namespace": "NFS", "drp_policy_id": "p1"},
+                   {"url": "ds://b", "datastore_namespace": "NFS", "drp_policy_id": "p9"}]})";
+
+// get prints one record as a listing does and --require tells a missing
+// blob from an empty one; a missing one exits 3 with one line, and an option
+// a command does not take is refused.
+TEST_F(Karstctl, GetAndRequireExitThreeForWhatIsNotThere) {
+  ASSERT_EQ(Run({"import", "-"}, kStored).status, 0);
+  const struct {
+    std::vector<std::string> args;
+    int status;
+    std::string out, err;
+  } cases[] = {
+      {{"datastores", "get", "ds://a", "--output", "json"},
+       0,
+       "{\"url\":\"ds://a\",\"datastore_namespace\":\"NFS\",\"drp_policy_id\":\"p1\"}\n",
+       ""},
+      {{"policies", "get", "zzz"}, 3, "", "karstctl: no policy with name \"zzz\"\n"},
+      {{"datastores", "get", "ds://z"}, 3, "", "karstctl: no datastore with url \"ds://z\"\n"},
+      {{"blob", "corra-by-name", "zzz"}, 0, "", ""},
+      {{"blob", "corra-by-name", "zzz", "--require"}, 3, "", "karstctl: no policy named \"zzz\"\n"},
+      {{"blob", "corra-by-name", "empty", "--require"}, 0, "", ""},
+      {{"blob", "corra-by-id", "p3", "--require"},
+       3,
+       "",
+       "karstctl: the policy with id \"p3\" has no blob for namespace \"CORRA\"\n"},
+      {{"blob", "by-id", "p1", "ds://a", "--require"}, 0, "n1", ""},
+      {{"blob", "by-id", "p1", "ds://z", "--require"},
+       3,
+       "",
+       "karstctl: no datastore with url \"ds://z\"\n"},
+      {{"blob", "default", "ds://b", "--require"}, 3, "", "karstctl: no policy with id \"p9\"\n"},
+      {{"hash", "--require"}, 2, "", "karstctl: 'hash' takes no --require (see karstctl --help)\n"},
+  };
+  for (const auto& c : cases) {
+    const ToolResult result = Run(c.args);
+    EXPECT_EQ(result.status, c.status) << c.args[0] << " " << c.args[2];
+    EXPECT_EQ(result.out, c.out) << c.args[2];
+    EXPECT_EQ(result.err, c.err) << c.args[2];
+  }
+  EXPECT_EQ(Ok({"policies", "get", "old"}),
+            "{\n  \"name\": \"old\",\n  \"policy_id\": \"p3\",\n  \"description\": \"\",\n"
+            "  \"generation_number\": 0,\n  \"blobs\": []\n}\n");
+}
+
+// diff compares in the store's terms (the last record of each key, blobs by
+// namespace, none without one), exits as cmp does and only reads the store.
+TEST_F(Karstctl, DiffShowsWhatAWriteWouldChangeAndWritesNothing) {
+  ASSERT_EQ(Run({"import", "-"}, kStored).status, 0);
+  const std::string before = ReadFile(store_);
+  const std::string file = R"({"policies": [
+      {"name": "gold", "policy_id": "p1", "description": "slow",
+       "blobs": [{"datastore_namespace": "CORRA", "blob": "c1"}, {"datastore_namespace": "", "blob": "x"},
+                 {"datastore_namespace": "NFS", "blob": "n1"}, {"datastore_namespace": "NFS", "blob": "n22"},
+                 {"datastore_namespace": "S3", "blob": "s"}]},
+      {"name": "old", "policy_id": "changed"}, {"name": "old", "policy_id": "p3"},
+      {"name": "new", "policy_id": "p4"}]})";
+  const ToolResult text = Run({"diff", "-"}, file);
+  EXPECT_EQ(text.status, 1) << text.err;
+  EXPECT_EQ(text.out,
+            "policy \"empty\": removed\n"
+            "policy \"gold\": description \"fast\" -> \"slow\"\n"
+            "policy \"gold\": blob \"NFS\" changed (2 bytes -> 3 bytes)\n"
+            "policy \"gold\": blob \"S3\" added (none -> 1 byte)\n"
+            "policy \"new\": added\n"
+            "policies: 1 added, 1 removed, 1 changed; datastores: 0 added, 0 removed, 0 changed\n");
+  const ToolResult json =
+      Run({"diff", "--output", "json", "-"}, R"([{"url": "ds://a", "datastore_namespace": "S3"}])");
+  EXPECT_EQ(json.status, 1) << json.err;
+  EXPECT_EQ(json.out,
+            R"({"policies":[],"datastores":[{"change":"changed","url":"ds://a","fields":[)"
+            R"({"field":"datastore_namespace","old":"NFS","new":"S3"},)"
+            R"({"field":"drp_policy_id","old":"p1","new":""}]},)"
+            R"({"change":"removed","url":"ds://b","record":{"url":"ds://b",)"
+            R"("datastore_namespace":"NFS","drp_policy_id":"p9"}}]})"
+            "\n");
+
+  const struct {
+    std::vector<std::string> args;
+    std::string input;
+    int status;
+    std::string out;
+  } cases[] = {
+      {{"diff", "-"}, kStored, 0, "no changes\n"},
+      {{"diff", "--output", "lines", "-"},
+       R"([{"name": "gold", "policy_id": "p1", "description": "fast"}])",
+       1,
+       R"({"change":"removed","name":"empty","record":{"name":"empty","policy_id":"p2",)"
+       R"("description":"","generation_number":0,"blobs":[{"datastore_namespace":"CORRA",)"
+       R"("blob":""}]},"catalogue":"policies"})"
+       "\n"
+       R"({"change":"changed","name":"gold","fields":[{"field":"blob",)"
+       R"("datastore_namespace":"CORRA","old":"c1","new":null},{"field":"blob",)"
+       R"("datastore_namespace":"NFS","old":"n1","new":null}],"catalogue":"policies"})"
+       "\n"
+       R"({"change":"removed","name":"old","record":{"name":"old","policy_id":"p3",)"
+       R"("description":"","generation_number":0,"blobs":[]},"catalogue":"policies"})"
+       "\n"},
+      {{"diff", "-"}, R"({"datastores": []})", 1, ""},
+      {{"diff", "-"}, "[]", 2, ""},
+      {{"diff", "-"}, "{", 2, ""},
+      {{"diff", "-", "--strict"}, R"({"policies": [{"name": "a"}, {"name": "a"}]})", 2, ""},
+      {{"diff", "--store", dir_.File("none.db"), "-"}, "{}", 2, ""},
+  };
+  for (const auto& c : cases) {
+    const ToolResult result = Run(c.args, c.input);
+    EXPECT_EQ(result.status, c.status) << c.input << result.err;
+    if (!c.out.empty()) {
+      EXPECT_EQ(result.out, c.out) << c.input;
+    }
+  }
+  EXPECT_EQ(ReadFile(store_), before);
+}
+
+// --output means the same for every command that prints records or digests,
+// hash and watch alike; with json an error is one JSON object.
+TEST_F(Karstctl, OutputFormsAndJsonErrors) {
+  ASSERT_EQ(Run({"import", "-"}, kStored).status, 0);
+  const std::string hash = HashLine(store_);
+  const std::pair<std::vector<std::string>, std::string> forms[] = {
+      {{"--output", "lines"}, hash},
+      {{"--output=json"}, hash},
+      {{"--output", "pretty"}, Ok({"hash"})},
+  };
+  for (const auto& [option, printed] : forms) {
+    std::vector<std::string> args = {"--store", store_, "watch"};
+    args.insert(args.end(), option.begin(), option.end());
+    Background watch(args, dir_.File("watch.err"));
+    std::string first;
+    for (std::string line; (line = watch.NextLine(10)) != "" && (first += line) != printed;) {
+    }
+    EXPECT_EQ(first, printed) << option[0];
+    EXPECT_EQ(watch.Stop(SIGINT), 0);
+    std::vector<std::string> hashArgs = {"hash"};
+    hashArgs.insert(hashArgs.end(), option.begin(), option.end());
+    EXPECT_EQ(Ok(hashArgs), printed);
+  }
+  const std::string lines = Ok({"datastores", "list", "--output", "lines"});
+  EXPECT_EQ(lines,
+            "{\"url\":\"ds://a\",\"datastore_namespace\":\"NFS\",\"drp_policy_id\":\"p1\"}\n"
+            "{\"url\":\"ds://b\",\"datastore_namespace\":\"NFS\",\"drp_policy_id\":\"p9\"}\n");
+
+  const std::string garbage = dir_.File("garbage.db");
+  WriteFile(garbage, std::string(8192, 'G'));
+  const std::pair<std::vector<std::string>, std::string> errors[] = {
+      {{"--store", store_, "policies", "get", "zzz"},
+       R"({"code":"not found","number":null,"exit":3,"message":"no policy with name \"zzz\""})"},
+      {{"--store", garbage, "export"}, R"({"code":"SQLITE_NOTADB","number":26,"exit":1,)"},
+      {{"--colour"}, R"({"code":"usage","number":null,"exit":2,"message":"unknown option)"},
+      {{"--store", store_, "import", "-"},
+       R"({"code":"input","number":null,"exit":2,"message":"<stdin>:1:1: )"},
+  };
+  for (const auto& [args, start] : errors) {
+    std::vector<std::string> withJson = args;
+    withJson.insert(withJson.begin(), {"--output", "json"});
+    const ToolResult result = RunTool(withJson);
+    EXPECT_THAT(result.err, ::testing::StartsWith(start));
+    EXPECT_THAT(result.err, ::testing::MatchesRegex("\\{[^\n]*\\}\n"));
+    EXPECT_EQ(result.status, Json::parse(result.err)["exit"].get<int>());
+  }
+}
+
+// --quiet sums warnings up per kind; --strict refuses any write that warns
+// and leaves the store as it was.
+TEST_F(Karstctl, QuietSumsWarningsUpAndStrictWritesNothing) {
+  ASSERT_EQ(Run({"import", "-"}, kStored).status, 0);
+  const std::string before = ReadFile(store_);
+  std::string dangling = "[";
+  for (int i = 0; i < 300; ++i) {
+    dangling += (i ? ", " : "") + std::string("{\"url\": \"u") + std::to_string(i % 299) +
+                "\", \"drp_policy_id\": \"none\"}";
+  }
+  dangling += "]";
+  const std::string summary =
+      "karstctl: warning: 301 warnings: 300 drp_policy_id naming no policy, 1 repeated url\n";
+  const ToolResult quiet =
+      Run({"check", "--quiet", "-"}, "{\"policies\": [], \"datastores\": " + dangling + "}");
+  EXPECT_EQ(quiet.status, 0);
+  EXPECT_EQ(quiet.err, summary);
+  const ToolResult json = Run({"check", "--quiet", "--output", "json", "-"}, dangling);
+  EXPECT_EQ(json.err, "{\"warnings\":1,\"kinds\":{\"repeated url\":1}}\n");
+
+  const std::pair<std::vector<std::string>, std::string> writes[] = {
+      {{"datastores", "set", "-"}, dangling},
+      {{"policies", "set", "-"}, "[]"},  // leaves the stored datastores dangling
+      {{"import", "-"}, R"({"policies": [{"name": "a"}, {"name": "a"}]})"},
+  };
+  for (const auto& [args, input] : writes) {
+    std::vector<std::string> strict = args;
+    strict.push_back("--strict");
+    const ToolResult result = Run(strict, input);
+    EXPECT_EQ(result.status, 2) << args[0];
+    EXPECT_THAT(result.err, HasSubstr(" and --strict: the store is left as it was\n"));
+    EXPECT_EQ(ReadFile(store_), before) << args[0];
+  }
+}
+
+// check reads every form karstctl reads, and names the record a repeated key
+// drops and the stored datastores a policy write leaves without a policy.
+TEST_F(Karstctl, CheckReadsEveryFormAndWarningsNameTheCause) {
+  ASSERT_EQ(Run({"import", "-"}, kStored).status, 0);
+  const std::string w = "karstctl: warning: ";
+  const std::pair<std::string, std::string> cases[] = {
+      {Ok({"policies", "list"}), ""},
+      {Ok({"datastores", "list"}), ""},
+      {Ok({"export"}), w + "datastores[1].drp_policy_id \"p9\" names no policy in the file\n"},
+      {R"({"policies": [{"name": "gold", "policy_id": "p1"}, {"name": "gold", "policy_id": "p2"}],
+          "datastores": [{"url": "u", "drp_policy_id": "p1"}]})",
+       w + "policies[1].name \"gold\" repeats policies[0]; the store keeps only the last\n" + w +
+           "datastores[0].drp_policy_id \"p1\" names only policies[0] of the file, which the store "
+           "drops for its repeated name\n"},
+  };
+  for (const auto& [file, err] : cases) {
+    const ToolResult result = Run({"check", "-"}, file);
+    EXPECT_EQ(result.status, 0) << result.err;
+    EXPECT_EQ(result.err, err) << file;
+  }
+  const ToolResult write =
+      Run({"policies", "set", "-"}, R"([{"name": "gold", "policy_id": "p1"}])");
+  EXPECT_EQ(write.err, w + "stored datastore \"ds://b\": drp_policy_id \"p9\" names no policy in "
+                           "the file\n");
+}
+
+// status names the store and what chose it, its kind, format and counts; a
+// store it cannot read fails it.
+TEST_F(Karstctl, StatusNamesTheStoreAndWhyItIsInUse) {
+  ASSERT_EQ(Run({"import", "-"}, kStored).status, 0);
+  EXPECT_EQ(Ok({"status"}), "store: " + store_ +
+                                "\nchosen by: --store\nkind: sqlite\nformat: 2\n"
+                                "history: not kept\npolicies: 3\ndatastores: 2\n");
+  const ToolResult env = RunTool({"status", "--output", "json"});
+  EXPECT_EQ(env.status, 0) << env.err;
+  EXPECT_EQ(Json::parse(env.out)["chosen_by"], "TAVO_CONFIGSTORE_PATH");
+  unsetenv("TAVO_CONFIGSTORE_PATH");
+  const char* state = getenv("XDG_STATE_HOME");
+  const std::string saved = state ? state : "";
+  setenv("XDG_STATE_HOME", dir_.Path().c_str(), 1);
+  ExpectFailure(RunTool({"status"}), 1,
+                "karstctl: no store at " + dir_.File("tavo/configstore.db") + "\n");
+  if (state) {
+    setenv("XDG_STATE_HOME", saved.c_str(), 1);
+  } else {
+    unsetenv("XDG_STATE_HOME");
+  }
 }
 
 // However the disk fails while an import commits, the store holds both old

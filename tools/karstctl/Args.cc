@@ -84,12 +84,53 @@ const CommandEntry& MatchCommand(const std::vector<std::string>& words) {
   throw UsageError("unknown command '" + command + "'" + kSeeHelp);
 }
 
+OutputForm ParseOutputForm(const std::string& text) {
+  if (text == "pretty") return OutputForm::kPretty;
+  if (text == "json") return OutputForm::kJson;
+  if (text == "lines") return OutputForm::kLines;
+  throw UsageError("--output needs pretty, json or lines, not '" + text + "'");
+}
+
+// Options that only some commands take are refused by the others, so that a
+// mistaken one is not silently ignored.
+void RequireTakes(const CommandEntry& command, const std::vector<std::string>& given) {
+  for (const auto& option : given) {
+    if (std::find(command.options.begin(), command.options.end(), option) ==
+        command.options.end()) {
+      throw UsageError("'" + Join(command.words) + "' takes no " + option + kSeeHelp);
+    }
+  }
+}
+
 }  // namespace
+
+const std::vector<OptionEntry>& OptionTable() {
+  static const std::vector<OptionEntry> table = {
+      {"--store", "PATH", "the store file or etcd locator; by default $TAVO_CONFIGSTORE_PATH"},
+      {"--wait", "SECONDS", "how long to wait for another writer's lock or an etcd request"},
+      {"--output", "FORM", "pretty, json (one line) or lines (a record a line); json: errors too"},
+      {"--quiet", "", "print warnings as one line of counts per kind"},
+      {"--strict", "", "exit 2 at any warning, before the store is written"},
+      {"--require", "", "exit 3 when the look-up finds no blob"},
+  };
+  return table;
+}
+
+bool AsksForJsonErrors(const std::vector<std::string>& args) {
+  for (std::size_t at = 0; at < args.size() && args[at] != "--"; ++at) {
+    if (args[at] == "--output=json" ||
+        (args[at] == "--output" && at + 1 < args.size() && args[at + 1] == "json")) {
+      return true;
+    }
+  }
+  return false;
+}
 
 Invocation ParseArgs(const std::vector<std::string>& args) {
   Invocation invocation;
   std::vector<std::string> words;  // the command and its operands
   bool help = false, version = false, optionsEnded = false;
+  std::vector<std::string> commandOptions;  // those only some commands take
   for (std::size_t at = 0; at < args.size(); ++at) {
     const std::string& arg = args[at];
     if (optionsEnded || arg == "-" || arg.compare(0, 1, "-") != 0) {
@@ -105,6 +146,13 @@ Invocation ParseArgs(const std::vector<std::string>& args) {
       invocation.store = *path;
     } else if (auto seconds = OptionValue(args, at, "--wait", "SECONDS")) {
       invocation.waitMs = ParseWaitMs(*seconds);
+    } else if (auto form = OptionValue(args, at, "--output", "a FORM")) {
+      invocation.output = ParseOutputForm(*form);
+    } else if (arg == "--quiet" || arg == "--strict" || arg == "--require") {
+      (arg == "--quiet"    ? invocation.quiet
+       : arg == "--strict" ? invocation.strict
+                           : invocation.require) = true;
+      commandOptions.push_back(arg);
     } else {
       throw UsageError("unknown option '" + arg + "'" + kSeeHelp);
     }
@@ -131,6 +179,7 @@ Invocation ParseArgs(const std::vector<std::string>& args) {
   if (given > match.operands.size()) {
     throw UsageError("too many arguments for '" + name + "'" + kSeeHelp);
   }
+  RequireTakes(match, commandOptions);
   invocation.command = &match;
   invocation.operands.assign(words.begin() + static_cast<std::ptrdiff_t>(match.words.size()),
                              words.end());

@@ -8,9 +8,13 @@
 #include <vector>
 
 #include "Args.h"
+#include "BlobLookups.h"
+#include "Diff.h"
 #include "Errors.h"
 #include "Io.h"
 #include "Json.h"
+#include "Output.h"
+#include "Status.h"
 #include "StoreErrors.h"
 #include "StoreSession.h"
 #include "TavoConfigStore/ConfigStore.h"
@@ -20,9 +24,11 @@
 namespace karstctl {
 
 using TavoKarst::KarstLib;
-using Operands = std::vector<std::string>;
 
 namespace {
+
+constexpr int kExitSuccess = 0;
+constexpr int kExitChanges = 1;  // diff: the file would change the store
 
 // Parses the input and decodes it with "decode", naming the source in any
 // error so the message points at the file as well as the field.
@@ -37,10 +43,8 @@ auto ReadRecords(const std::string& fileOrDash, Decode decode) {
   }
 }
 
-void PrintJson(const Json& value) { WriteOutput(DumpJsonText(value)); }
-
-void Warn(const std::vector<std::string>& warnings) {
-  for (const auto& warning : warnings) WriteDiagnostic("warning: " + warning);
+OutputForm Form(const Invocation& invocation, OutputForm otherwise = OutputForm::kPretty) {
+  return invocation.output.value_or(otherwise);
 }
 
 Json Digests() {
@@ -51,46 +55,33 @@ Json Digests() {
   return out;
 }
 
-void Reset(const Operands&, StoreSession& store) {
-  store.Open();
-  KarstLib::Reset();
+Catalogue Stored() {
+  Catalogue stored;
+  stored.policies = KarstLib::ListPolicyInfo();
+  stored.datastores = KarstLib::ListDatastoreInfo();
+  return stored;
 }
 
-void SetPolicies(const Operands& operands, StoreSession& store) {
-  auto policies =
-      ReadRecords(operands[0], [](const Json& json) { return PoliciesFromJson(json, "policies"); });
-  Warn(PolicyWarnings(policies));
-  store.Open();
-  KarstLib::AddPolicyInfo(policies);
-}
-
-void ListPolicies(const Operands&, StoreSession& store) {
-  store.Open();
-  PrintJson(PoliciesToJson(KarstLib::ListPolicyInfo()));
-}
-
-void SetDatastores(const Operands& operands, StoreSession& store) {
-  auto datastores = ReadRecords(
-      operands[0], [](const Json& json) { return DatastoresFromJson(json, "datastores"); });
-  store.Open();
-  const auto stored = KarstLib::ListPolicyInfo();
-  Warn(DatastoreWarnings(datastores, &stored, "the store"));
-  KarstLib::AddDatastoreInfo(datastores);
-}
-
-void ListDatastores(const Operands&, StoreSession& store) {
-  store.Open();
-  PrintJson(DatastoresToJson(KarstLib::ListDatastoreInfo()));
+// Reads what a write would need of the store beside "catalogue" and reports
+// the warnings; with --strict a warning ends the command here.
+void WarnBeforeWriting(const Catalogue& catalogue, const Invocation& invocation) {
+  std::vector<TavoKarst::KarstPolicyInfo> policies;
+  std::vector<TavoKarst::KarstDatastoreInfo> datastores;
+  StoredBeside stored;
+  if (catalogue.datastores && !catalogue.policies) {
+    policies = KarstLib::ListPolicyInfo();
+    stored.policies = &policies;
+  }
+  if (catalogue.policies && !catalogue.datastores) {
+    datastores = KarstLib::ListDatastoreInfo();
+    stored.datastores = &datastores;
+  }
+  ReportWarnings(CatalogueWarnings(catalogue, stored), invocation);
 }
 
 // Each replace commits its own transaction; begun inside this one, it is a
 // savepoint of it, so both catalogues become durable together or not at all.
-void Import(const Operands& operands, StoreSession& store) {
-  const Catalogue catalogue = ReadRecords(operands[0], CatalogueFromJson);
-  store.Open();
-  std::vector<TavoKarst::KarstPolicyInfo> stored;
-  if (catalogue.datastores && !catalogue.policies) stored = KarstLib::ListPolicyInfo();
-  Warn(CatalogueWarnings(catalogue, &stored));
+void Write(const Catalogue& catalogue) {
   auto transaction = TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace);
   transaction->BeginTransaction();
   try {
@@ -107,40 +98,169 @@ void Import(const Operands& operands, StoreSession& store) {
   }
 }
 
-void Export(const Operands&, StoreSession& store) {
+int Reset(const Invocation&, StoreSession& store) {
+  store.Open();
+  KarstLib::Reset();
+  return kExitSuccess;
+}
+
+int SetPolicies(const Invocation& invocation, StoreSession& store) {
+  Catalogue catalogue;
+  catalogue.policies = ReadRecords(
+      invocation.operands[0], [](const Json& json) { return PoliciesFromJson(json, "policies"); });
+  store.Open();
+  WarnBeforeWriting(catalogue, invocation);
+  KarstLib::AddPolicyInfo(*catalogue.policies);
+  return kExitSuccess;
+}
+
+int SetDatastores(const Invocation& invocation, StoreSession& store) {
+  Catalogue catalogue;
+  catalogue.datastores = ReadRecords(invocation.operands[0], [](const Json& json) {
+    return DatastoresFromJson(json, "datastores");
+  });
+  store.Open();
+  WarnBeforeWriting(catalogue, invocation);
+  KarstLib::AddDatastoreInfo(*catalogue.datastores);
+  return kExitSuccess;
+}
+
+int Import(const Invocation& invocation, StoreSession& store) {
+  const Catalogue catalogue = ReadRecords(invocation.operands[0], CatalogueFromJson);
+  store.Open();
+  WarnBeforeWriting(catalogue, invocation);
+  Write(catalogue);
+  return kExitSuccess;
+}
+
+int ListPolicies(const Invocation& invocation, StoreSession& store) {
+  store.Open();
+  PrintJson(PoliciesToJson(KarstLib::ListPolicyInfo()), Form(invocation));
+  return kExitSuccess;
+}
+
+int ListDatastores(const Invocation& invocation, StoreSession& store) {
+  store.Open();
+  PrintJson(DatastoresToJson(KarstLib::ListDatastoreInfo()), Form(invocation));
+  return kExitSuccess;
+}
+
+// The record stored under "key", printed as a listing prints it.
+template <typename Record>
+int GetRecord(const Invocation& invocation, const std::vector<Record>& records,
+              std::string Record::*key, const char* what, const char* keyName,
+              Json (*toJson)(const std::vector<Record>&)) {
+  for (const Record& record : records) {
+    if (record.*key == invocation.operands[0]) {
+      PrintJson(toJson({record})[0], Form(invocation));
+      return kExitSuccess;
+    }
+  }
+  throw NotFoundError(std::string("no ") + what + " with " + keyName + " " +
+                      EncodeBytes(invocation.operands[0]).dump());
+}
+
+int GetPolicy(const Invocation& invocation, StoreSession& store) {
+  store.Open();
+  return GetRecord(invocation, KarstLib::ListPolicyInfo(), &TavoKarst::KarstPolicyInfo::name,
+                   "policy", "name", PoliciesToJson);
+}
+
+int GetDatastore(const Invocation& invocation, StoreSession& store) {
+  store.Open();
+  return GetRecord(invocation, KarstLib::ListDatastoreInfo(), &TavoKarst::KarstDatastoreInfo::url,
+                   "datastore", "url", DatastoresToJson);
+}
+
+int Export(const Invocation& invocation, StoreSession& store) {
   store.Open();
   auto policies = KarstLib::ListPolicyInfo();
   auto datastores = KarstLib::ListDatastoreInfo();
-  PrintJson(CatalogueToJson(policies, datastores));
+  PrintJson(CatalogueToJson(policies, datastores), Form(invocation));
+  return kExitSuccess;
 }
 
-void Check(const Operands& operands, StoreSession&) {
-  Warn(CatalogueWarnings(ReadRecords(operands[0], CatalogueFromJson), nullptr));
+int Check(const Invocation& invocation, StoreSession&) {
+  const Catalogue catalogue = ReadRecords(invocation.operands[0], CatalogueFromAnyJson);
+  ReportWarnings(CatalogueWarnings(catalogue, StoredBeside()), invocation);
+  return kExitSuccess;
 }
 
-void BlobById(const Operands& operands, StoreSession& store) {
+int Diff(const Invocation& invocation, StoreSession& store) {
+  const std::string& file = invocation.operands[0];
+  const Catalogue proposed = ReadRecords(file, [](const Json& json) {
+    Catalogue catalogue = CatalogueFromAnyJson(json);
+    if (json.is_array() && !catalogue.policies && !catalogue.datastores) {
+      throw InputError(
+          "an empty list is no catalogue to compare: write {\"policies\": []} "
+          "or {\"datastores\": []}");
+    }
+    return catalogue;
+  });
   store.Open();
-  WriteOutput(KarstLib::GetPolicyBlobById(operands[0], operands[1]));
+  WarnBeforeWriting(proposed, invocation);
+  // The comparison takes what is stored and what the file would make it,
+  // so any catalogue kept elsewhere (an earlier version) compares alike.
+  const CatalogueDiff diff = DiffCatalogues(Stored(), proposed);
+  if (!invocation.output) {
+    WriteOutput(DiffToText(diff));
+  } else if (*invocation.output == OutputForm::kLines) {
+    // One change a line, each naming its catalogue.
+    const Json byCatalogue = DiffToJson(diff);
+    Json changes = Json::array();
+    for (const auto& [catalogue, list] : byCatalogue.items()) {
+      for (Json change : list) {
+        change["catalogue"] = catalogue;
+        changes.push_back(std::move(change));
+      }
+    }
+    PrintJson(changes, OutputForm::kLines);
+  } else {
+    PrintJson(DiffToJson(diff), *invocation.output);
+  }
+  return diff.Empty() ? kExitSuccess : kExitChanges;
 }
 
-void BlobCorraById(const Operands& operands, StoreSession& store) {
-  store.Open();
-  WriteOutput(KarstLib::GetCorraPolicyBlobById(operands[0]));
+// A blob is written raw; with --require, finding none (which the library
+// cannot tell from an empty blob) is explained and exits 3.
+int PrintBlob(const Invocation& invocation, BlobLookup lookup, const std::string& blob) {
+  if (blob.empty() && invocation.require) {
+    const std::string missing = WhyNoBlob(lookup, invocation.operands);
+    if (!missing.empty()) throw NotFoundError(missing);
+  }
+  WriteOutput(blob);
+  return kExitSuccess;
 }
 
-void BlobCorraByName(const Operands& operands, StoreSession& store) {
+int BlobById(const Invocation& invocation, StoreSession& store) {
   store.Open();
-  WriteOutput(KarstLib::GetCorraPolicyBlobByName(operands[0]));
+  const auto& operands = invocation.operands;
+  return PrintBlob(invocation, BlobLookup::kById,
+                   KarstLib::GetPolicyBlobById(operands[0], operands[1]));
 }
 
-void BlobDefault(const Operands& operands, StoreSession& store) {
+int BlobCorraById(const Invocation& invocation, StoreSession& store) {
   store.Open();
-  WriteOutput(KarstLib::GetDefaultPolicyBlob(operands[0]));
+  return PrintBlob(invocation, BlobLookup::kCorraById,
+                   KarstLib::GetCorraPolicyBlobById(invocation.operands[0]));
 }
 
-void Hash(const Operands&, StoreSession& store) {
+int BlobCorraByName(const Invocation& invocation, StoreSession& store) {
   store.Open();
-  PrintJson(Digests());
+  return PrintBlob(invocation, BlobLookup::kCorraByName,
+                   KarstLib::GetCorraPolicyBlobByName(invocation.operands[0]));
+}
+
+int BlobDefault(const Invocation& invocation, StoreSession& store) {
+  store.Open();
+  return PrintBlob(invocation, BlobLookup::kDefault,
+                   KarstLib::GetDefaultPolicyBlob(invocation.operands[0]));
+}
+
+int Hash(const Invocation& invocation, StoreSession& store) {
+  store.Open();
+  PrintJson(Digests(), Form(invocation));
+  return kExitSuccess;
 }
 
 volatile std::sig_atomic_t gStopWatching = 0;
@@ -168,15 +288,17 @@ void PauseBeforeRetry() {
 // change: the change that a failed read missed has been announced already
 // (on etcd, a watcher whose role is revoked still hears of commits it may
 // not read), and waiting for another would keep the old digests until some
-// later commit.
-void Watch(const Operands&, StoreSession& session) {
+// later commit. The digests print as hash prints them for the same
+// --output; without one, on one line each.
+int Watch(const Invocation& invocation, StoreSession& session) {
   session.Open();
   struct sigaction stop {};
   stop.sa_handler = StopWatching;
   sigaction(SIGINT, &stop, nullptr);
   sigaction(SIGTERM, &stop, nullptr);
+  const OutputForm form = Form(invocation, OutputForm::kLines);
   auto store = TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace);
-  std::string last = Digests().dump() + "\n";
+  std::string last = RenderJson(Digests(), form);
   WriteOutput(last);
   bool failed = false;
   while (gStopWatching == 0) {
@@ -187,86 +309,152 @@ void Watch(const Operands&, StoreSession& session) {
       } else if (!store->WaitForChange(static_cast<int>(kWatchWait.count()))) {
         continue;
       }
-      std::string line = Digests().dump() + "\n";
+      std::string digests = RenderJson(Digests(), form);
       failed = false;
-      if (line != last) WriteOutput(last = std::move(line));
+      if (digests != last) WriteOutput(last = std::move(digests));
     } catch (const TavoConfigStore::ConfigStoreException& e) {
       failed = true;
       WriteDiagnostic("warning: " + DescribeStoreError(e) + "; trying again");
     }
   }
+  return kExitSuccess;
 }
+
+int Status(const Invocation& invocation, StoreSession& store) {
+  PrintStatus(invocation, store);
+  return kExitSuccess;
+}
+
+// The options of the commands that read a file to write or compare it, and
+// of the blob look-ups; every command takes --output.
+const std::vector<std::string> kWarns = {"--quiet", "--strict"};
+const std::vector<std::string> kLooksUp = {"--require"};
 
 }  // namespace
 
 const std::vector<CommandEntry>& CommandTable() {
   static const std::vector<CommandEntry> table = {
-      {{"reset"}, {}, "clear both catalogues", StoreUse::kWrite, Reset},
+      {{"reset"}, {}, "clear both catalogues", StoreUse::kWrite, {}, "karstctl reset", Reset},
       {{"policies", "set"},
        {"FILE|-"},
        "replace the policy catalogue with a JSON array of policies",
        StoreUse::kWrite,
+       kWarns,
+       "karstctl policies set --strict policies.json",
        SetPolicies},
       {{"policies", "list"},
        {},
        "print the policy catalogue as a JSON array",
        StoreUse::kRead,
+       {},
+       "karstctl policies list --output lines",
        ListPolicies},
+      {{"policies", "get"},
+       {"NAME"},
+       "print the policy stored under NAME; exit 3 if there is none",
+       StoreUse::kRead,
+       {},
+       "karstctl policies get gold",
+       GetPolicy},
       {{"datastores", "set"},
        {"FILE|-"},
        "replace the datastore catalogue with a JSON array of datastores",
        StoreUse::kWrite,
+       kWarns,
+       "karstctl datastores set --quiet datastores.json",
        SetDatastores},
       {{"datastores", "list"},
        {},
        "print the datastore catalogue as a JSON array",
        StoreUse::kRead,
+       {},
+       "karstctl datastores list --output json",
        ListDatastores},
+      {{"datastores", "get"},
+       {"URL"},
+       "print the datastore stored under URL; exit 3 if there is none",
+       StoreUse::kRead,
+       {},
+       "karstctl datastores get ds://store-a",
+       GetDatastore},
       {{"import"},
        {"FILE|-"},
        "replace each catalogue the file holds, as export prints them; all or none",
        StoreUse::kWrite,
+       kWarns,
+       "karstctl import --strict catalogue.json",
        Import},
       {{"export"},
        {},
        "print {\"policies\": [...], \"datastores\": [...]}",
        StoreUse::kRead,
+       {},
+       "karstctl export > catalogue.json",
        Export},
       {{"check"},
        {"FILE|-"},
-       "validate a file as import would, without opening the store",
+       "validate any form karstctl reads, as a write would; opens no store",
        StoreUse::kNone,
+       kWarns,
+       "karstctl policies list | karstctl check -",
        Check},
+      {{"diff"},
+       {"FILE|-"},
+       "what writing the file would change, record by record; exit 1 if anything",
+       StoreUse::kRead,
+       kWarns,
+       "karstctl diff catalogue.json",
+       Diff,
+       2},
       {{"blob", "by-id"},
        {"POLICY_ID", "URL"},
        "blob of the first policy POLICY_ID for datastore URL's namespace",
        StoreUse::kRead,
+       kLooksUp,
+       "karstctl blob by-id pol-0001 ds://store-a > blob.bin",
        BlobById},
       {{"blob", "corra-by-id"},
        {"POLICY_ID"},
        "CORRA blob of the first policy POLICY_ID",
        StoreUse::kRead,
+       kLooksUp,
+       "karstctl blob corra-by-id pol-0001 > corra.bin",
        BlobCorraById},
       {{"blob", "corra-by-name"},
        {"NAME"},
        "CORRA blob of the policy named NAME",
        StoreUse::kRead,
+       kLooksUp,
+       "karstctl blob corra-by-name --require gold > gold.bin",
        BlobCorraByName},
       {{"blob", "default"},
        {"URL"},
        "blob of datastore URL's default policy for its namespace",
        StoreUse::kRead,
+       kLooksUp,
+       "karstctl blob default ds://store-a > default.bin",
        BlobDefault},
       {{"hash"},
        {},
        "print {\"policies\": \"<crc32>\", \"datastores\": \"<crc32>\"}",
        StoreUse::kRead,
+       {},
+       "karstctl hash --output json",
        Hash},
       {{"watch"},
        {},
-       "one line of hash's digests now and at each change, until interrupted",
+       "hash's digests now and at each change, until interrupted",
        StoreUse::kWatch,
+       {},
+       "karstctl watch",
        Watch},
+      {{"status"},
+       {},
+       "the store in use and why, its kind, format and record counts",
+       StoreUse::kRead,
+       {},
+       "karstctl status",
+       Status},
   };
   return table;
 }

@@ -20,6 +20,13 @@ class InputError : public std::runtime_error {
   using std::runtime_error::runtime_error;
 };
 
+// A record asked for by its key (policies get NAME), or a blob asked for
+// with --require, that is not there. Exit status 3.
+class NotFoundError : public std::runtime_error {
+ public:
+  using std::runtime_error::runtime_error;
+};
+
 }  // namespace karstctl
 
 #endif  // KARSTCTL_ERRORS_H_

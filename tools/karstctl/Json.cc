@@ -445,4 +445,25 @@ Catalogue CatalogueFromJson(const Json& value) {
   return catalogue;
 }
 
+Catalogue CatalogueFromAnyJson(const Json& value) {
+  if (!value.is_array()) return CatalogueFromJson(value);
+  Catalogue catalogue;
+  if (value.empty()) return catalogue;
+  for (const Json& record : value) {
+    if (!record.is_object()) continue;
+    for (const auto& item : record.items()) {
+      const bool datastoreKey =
+          std::any_of(kDatastoreFields.begin(), kDatastoreFields.end(),
+                      [&item](const auto& f) { return item.key() == f.first; });
+      if (datastoreKey) {
+        catalogue.datastores = DatastoresFromJson(value, kDatastores);
+        return catalogue;
+      }
+    }
+    if (!record.empty()) break;
+  }
+  catalogue.policies = PoliciesFromJson(value, kPolicies);
+  return catalogue;
+}
+
 }  // namespace karstctl

@@ -73,6 +73,12 @@ Json CatalogueToJson(const std::vector<TavoKarst::KarstPolicyInfo>& policies,
                      const std::vector<TavoKarst::KarstDatastoreInfo>& datastores);
 Catalogue CatalogueFromJson(const Json& value);
 
+// Any form karstctl reads: the import form, or a list of policies or of
+// datastores as "policies set" and "datastores set" take them. A list is of
+// datastores when its first record that is not empty has a datastore's key,
+// else of policies; an empty list is neither (both catalogues absent).
+Catalogue CatalogueFromAnyJson(const Json& value);
+
 }  // namespace karstctl
 
 #endif  // KARSTCTL_JSON_H_

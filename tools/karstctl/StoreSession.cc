@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdlib>
 #include <stdexcept>
 
 #include "Errors.h"
@@ -12,10 +13,24 @@
 
 namespace karstctl {
 
+namespace {
+
+// Which of the variables DefaultStorePath reads gave the default, in its
+// order.
+std::string DefaultChosenBy() {
+  const char* path = std::getenv("TAVO_CONFIGSTORE_PATH");
+  if (path != nullptr && *path != '\0') return "TAVO_CONFIGSTORE_PATH";
+  const char* state = std::getenv("XDG_STATE_HOME");
+  return state != nullptr && *state == '/' ? "default under XDG_STATE_HOME" : "default under HOME";
+}
+
+}  // namespace
+
 StoreSession::StoreSession(const Invocation& invocation)
     : use_(invocation.command->store), waitMs_(invocation.waitMs) {
   if (use_ == StoreUse::kNone) return;
   locator_ = invocation.store ? *invocation.store : TavoConfigStore::DefaultStorePath();
+  chosenBy_ = invocation.store ? "--store" : DefaultChosenBy();
   try {
     if (TavoConfigStore::KindOfLocator(locator_) == TavoConfigStore::LocatorKind::kEtcd) {
       etcd_ = TavoConfigStore::ParseEtcdLocator(locator_);

@@ -29,9 +29,16 @@ class StoreSession {
 
   void Open();
 
+  // The locator in use, and what chose it: "--store", the environment
+  // variable that named it or that the default is derived from.
+  const std::string& Locator() const { return locator_; }
+  const std::string& ChosenBy() const { return chosenBy_; }
+  bool IsEtcd() const { return etcd_.has_value(); }
+
  private:
   StoreUse use_;
   std::string locator_;
+  std::string chosenBy_;
   std::optional<TavoConfigStore::EtcdStoreOptions> etcd_;
   std::optional<int> waitMs_;
 };
