@@ -773,7 +773,7 @@ TEST_F(Karstctl, OutputFormsAndJsonErrors) {
   for (const auto& [option, printed] : forms) {
     std::vector<std::string> args = {"--store", store_, "watch"};
     args.insert(args.end(), option.begin(), option.end());
-    Background watch(args, dir_.File("watch.err"));
+    Background watch(args, dir_);
     std::string first;
     for (std::string line; (line = watch.NextLine(10)) != "" && (first += line) != printed;) {
     }
