@@ -38,6 +38,7 @@ struct Invocation {
   bool version = false;               // --version (without --help)
   std::optional<std::string> store;   // --store PATH
   std::optional<int> waitMs;          // --wait SECONDS
+  std::optional<std::string> kept;    // --version N: read kept version N
   std::vector<std::string> operands;  // in the order CommandEntry lists them
   // For help: the commands asked about ("blob --help" names all blob
   // commands); empty for the general help.

@@ -9,6 +9,7 @@
 
 #include "Args.h"
 #include "Errors.h"
+#include "HistoryCommands.h"
 #include "Io.h"
 #include "Json.h"
 #include "StoreErrors.h"
@@ -229,7 +230,7 @@ const std::vector<CommandEntry>& CommandTable() {
        Import},
       {{"export"},
        {},
-       "print {\"policies\": [...], \"datastores\": [...]}",
+       "print {\"policies\": [...], \"datastores\": [...]}; --version N: kept version N",
        StoreUse::kRead,
        Export},
       {{"check"},
@@ -262,6 +263,21 @@ const std::vector<CommandEntry>& CommandTable() {
        "print {\"policies\": \"<crc32>\", \"datastores\": \"<crc32>\"}",
        StoreUse::kRead,
        Hash},
+      {{"history", "depth"},
+       {"K"},
+       "keep the last K versions from now on (default 10; 0 keeps none)",
+       StoreUse::kWrite,
+       SetHistoryDepth},
+      {{"history"},
+       {},
+       "list the kept versions, newest first, with their counts and hash digests",
+       StoreUse::kRead,
+       ListHistory},
+      {{"rollback"},
+       {"N"},
+       "make kept version N current again, in one transaction (a new version)",
+       StoreUse::kWrite,
+       RollBack},
       {{"watch"},
        {},
        "one line of hash's digests now and at each change, until interrupted",

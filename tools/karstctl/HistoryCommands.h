@@ -1,0 +1,29 @@
+#ifndef KARSTCTL_HISTORY_COMMANDS_H_
+#define KARSTCTL_HISTORY_COMMANDS_H_
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace karstctl {
+
+class StoreSession;
+
+// The commands on the versions the store keeps, for the command table.
+// Each throws as CommandEntry says.
+
+// The kept versions, newest first, each with its record counts and the
+// digests hash printed for it.
+void ListHistory(const std::vector<std::string>& operands, StoreSession& store);
+// Keeps the last K versions from now on.
+void SetHistoryDepth(const std::vector<std::string>& operands, StoreSession& store);
+// Makes a kept version current again, as a new version.
+void RollBack(const std::vector<std::string>& operands, StoreSession& store);
+
+// A version number as given on the command line: digits, at least 1.
+// Throws UsageError naming "what".
+std::uint64_t ParseVersionNumber(const std::string& text, const std::string& what);
+
+}  // namespace karstctl
+
+#endif  // KARSTCTL_HISTORY_COMMANDS_H_
