@@ -46,6 +46,7 @@ std::string HelpText() {
   out += line("", "(default the locator's timeout, else 5)");
   out += line("--help", "print this help, or with a COMMAND that command's usage");
   out += line("--version", "print the version");
+  out += line("--version N", "with a command that reads: read kept version N (see history)");
   out += line("--", "ends the options: later words starting with - are operands");
   out +=
       "\n"
