@@ -53,7 +53,10 @@ class History {
   // becomes the newest version, and the versions beyond the depth go.
   void Record();
   // What this transaction moved is unknown again (it was undone).
-  void Forget() { moved_.clear(); }
+  void Forget() {
+    moved_.clear();
+    pruned_ = false;
+  }
 
   std::vector<StoreVersion> Versions();
   unsigned Depth();
@@ -75,6 +78,7 @@ class History {
 
   Connection& conn_;
   std::set<sqlite3_int64> moved_;  // collections with a new table in this transaction
+  bool pruned_ = false;            // the oldest version went in this transaction
 };
 
 }  // namespace sqlite
