@@ -108,8 +108,10 @@ TEST_F(StoreHistoryTest, KeptVersionsReadAsCommittedUnderEveryKindOfWrite) {
   SetHistoryDepth(*other, 0);
   EXPECT_TRUE(ListVersions(store).empty());
   EXPECT_EQ(Tables(), 5 + 2);
+  const std::uint64_t newest = NewestVersion(store);
   Replace(store, "k", {"z"});
   EXPECT_TRUE(ListVersions(store).empty());
+  EXPECT_EQ(NewestVersion(store), newest + 1) << "numbers go on when none is kept";
 }
 
 TEST_F(StoreHistoryTest, RollbackMakesAKeptVersionCurrentAsANewOne) {
@@ -120,6 +122,7 @@ TEST_F(StoreHistoryTest, RollbackMakesAKeptVersionCurrentAsANewOne) {
   Change(store, [&] { Set(store, Valued("a", "a2")); });
 
   Change(store, [&] { EXPECT_EQ(Rollback(store, 2), 5u); });
+  EXPECT_EQ(NewestVersion(store), 5u);
   EXPECT_EQ(Everything(store), states_[1]) << "objects and their order as version 2 had them";
 
   // A version not kept: nothing changes, not even the version count.

@@ -55,6 +55,17 @@ Json Describe(const std::shared_ptr<ConfigStore>& store, const TavoConfigStore::
 
 }  // namespace
 
+Json HistoryStatus() {
+  const auto store = SessionStore();
+  try {
+    return Json::object({{"depth", TavoConfigStore::HistoryDepth(*store)},
+                         {"newest", TavoConfigStore::NewestVersion(*store)}});
+  } catch (const TavoConfigStore::ConfigStoreException& e) {
+    if (e.Code() != TavoConfigStore::kErrorNoHistory) throw;
+    return nullptr;
+  }
+}
+
 std::uint64_t ParseVersionNumber(const std::string& text, const std::string& what) {
   const bool digits = !text.empty() && text.size() <= 18 &&
                       text.find_first_not_of("0123456789") == std::string::npos;

@@ -5,6 +5,8 @@
 #include <string>
 #include <vector>
 
+#include <nlohmann/json.hpp>
+
 namespace karstctl {
 
 class StoreSession;
@@ -19,6 +21,10 @@ void ListHistory(const std::vector<std::string>& operands, StoreSession& store);
 void SetHistoryDepth(const std::vector<std::string>& operands, StoreSession& store);
 // Makes a kept version current again, as a new version.
 void RollBack(const std::vector<std::string>& operands, StoreSession& store);
+
+// For status: {"depth": K, "newest": N} of the store installed for the
+// process, or null for a store that keeps no history.
+nlohmann::ordered_json HistoryStatus();
 
 // A version number as given on the command line: digits, at least 1.
 // Throws UsageError naming "what".

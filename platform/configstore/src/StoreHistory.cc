@@ -85,6 +85,8 @@ std::string NotKeptMessage(const std::string& where, std::uint64_t number) {
 
 std::vector<StoreVersion> ListVersions(ConfigStore& store) { return SourceOf(store).Versions(); }
 
+std::uint64_t NewestVersion(ConfigStore& store) { return SourceOf(store).Newest(); }
+
 unsigned HistoryDepth(ConfigStore& store) { return SourceOf(store).Depth(); }
 
 void SetHistoryDepth(ConfigStore& store, unsigned depth) { SourceOf(store).SetDepth(depth); }

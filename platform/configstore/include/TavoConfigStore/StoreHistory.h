@@ -34,6 +34,10 @@ struct StoreVersion {
 // The kept versions, newest first. A store nobody has written yet has none.
 CONFIGSTORE_EXPORT std::vector<StoreVersion> ListVersions(ConfigStore& store);
 
+// The number of the newest version, also when none is kept (depth 0); 0
+// before the first write.
+CONFIGSTORE_EXPORT std::uint64_t NewestVersion(ConfigStore& store);
+
 // How many versions the store keeps: 10 unless SetHistoryDepth changed it.
 CONFIGSTORE_EXPORT unsigned HistoryDepth(ConfigStore& store);
 
