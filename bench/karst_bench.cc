@@ -5,6 +5,7 @@
 #include <benchmark/benchmark.h>
 #include <malloc.h>
 #include <sys/resource.h>
+#include <sys/stat.h>
 #include <zlib.h>
 
 #include <algorithm>
@@ -22,6 +23,7 @@
 #include "PeakRss.h"
 #include "RawSqlite.h"
 #include "TavoConfigStore/ConfigStore.h"
+#include "TavoConfigStore/StoreHistory.h"
 #include "TavoKarst/KarstLib.h"
 #include "hash/Crc32.h"
 
@@ -152,13 +154,28 @@ BENCHMARK(BM_Crc32Portable)->Arg(40)->Arg(1 << 20);
 // Each iteration replaces N stored policies with N policies (the store is
 // filled once before timing), in one transaction.
 
-void BM_KarstAdd(benchmark::State& state) {
+// A replace on a store that keeps "depth" versions (the default keeps 10);
+// the file's size afterwards shows what the kept versions take.
+void ReplaceKeeping(benchmark::State& state, unsigned depth) {
   const auto& policies = Policies(N(state));
-  UseKarstStore("karst-add-" + std::to_string(N(state)) + ".db");
-  KarstLib::AddPolicyInfo(policies);
+  const std::string name =
+      "karst-add-d" + std::to_string(depth) + "-" + std::to_string(N(state)) + ".db";
+  UseKarstStore(name);
+  TavoConfigStore::SetHistoryDepth(
+      *TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace), depth);
+  // Until the store keeps all its versions, each replace makes the file
+  // larger; timed from then on, the loop sees the steady state a store in
+  // use is in, where a replace reuses the pages of the version it forgets.
+  for (unsigned i = 0; i <= depth; ++i) KarstLib::AddPolicyInfo(policies);
   for (auto _ : state) KarstLib::AddPolicyInfo(policies);
   state.SetItemsProcessed(static_cast<std::int64_t>(state.iterations() * N(state)));
+  struct stat file {};
+  stat((StoreDir() + "/" + name).c_str(), &file);
+  state.counters["file_mib"] = static_cast<double>(file.st_size) / (1 << 20);
 }
+
+void BM_KarstAdd(benchmark::State& state) { ReplaceKeeping(state, 10); }
+void BM_KarstAddKeepingNone(benchmark::State& state) { ReplaceKeeping(state, 0); }
 
 void BM_RawReplace(benchmark::State& state, Layout layout) {
   const auto& policies = Policies(N(state));
@@ -330,6 +347,9 @@ void Register() {
   };
   for (std::int64_t n : sizes) {
     sized(benchmark::RegisterBenchmark("BM_KarstAdd", BM_KarstAdd), n);
+    if (n == 10000) {
+      sized(benchmark::RegisterBenchmark("BM_KarstAddKeepingNone", BM_KarstAddKeepingNone), n);
+    }
     sized(benchmark::RegisterBenchmark("BM_KarstList", BM_KarstList), n);
     sized(benchmark::RegisterBenchmark("BM_KarstListBoth", BM_KarstListBoth), n);
     sized(benchmark::RegisterBenchmark("BM_KarstGetDbHash", BM_KarstGetDbHash), n);

@@ -78,6 +78,8 @@ def main():
     raw_list = [f"BM_RawList_{l}/10000" for l in ("onerow", "twotables")]
     raw_keyed = [f"BM_RawBlobByName_{l}/10000" for l in ("onerow", "twotables")]
     ratio_row("AddPolicyInfo, N=10,000 / raw replace", "BM_KarstAdd/10000", raw_replace, 1.15)
+    ratio_row("AddPolicyInfo keeping 10 versions / keeping none, N=10,000", "BM_KarstAdd/10000",
+              ["BM_KarstAddKeepingNone/10000"], 1.10)
     ratio_row("ListPolicyInfo, N=10,000 / raw read", "BM_KarstList/10000", raw_list, 1.15)
     ratio_row("GetCorraPolicyBlobByName / raw keyed SELECT", "BM_KarstBlobByName/10000",
               raw_keyed, 1.3)

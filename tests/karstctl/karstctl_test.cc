@@ -27,6 +27,7 @@
 #include "EtcdCluster.h"
 #include "FaultVfs.h"
 #include "Files.h"
+#include "Json.h"
 #include "RawSqlite.h"
 #include "Records.h"
 
@@ -37,9 +38,9 @@
 namespace karst_test {
 namespace {
 
+using karstctl::Json;
 using TavoKarst::KarstLib;
 using ::testing::HasSubstr;
-using Json = nlohmann::json;
 
 struct ToolResult {
   int status;  // exit status; 128 + signal number when killed
@@ -347,12 +348,49 @@ TEST_F(Karstctl, BadCommandLinesAndInputsExitTwoAndLeaveTheStoreAlone) {
       // Good policies stay out when the datastores beside them are bad.
       {imp, R"({"policies": [], "datastores": [{"url": "u", "policy": "p"}]})",
        "datastores[0]: unknown key \"policy\""},
+      {{"rollback", "x"}, "", "rollback needs a version number"},
+      {{"export", "--version", "0"}, "", "--version needs a version number"},
+      {{"import", "--version", "1", "-"}, "{}", "'import' does not read the catalogue"},
+      {{"history", "depth", "-1"}, "", "unknown option '-1'"},
+      {{"history", "depth", "many"}, "", "history depth needs a number of versions"},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.fragment);
     ExpectFailure(Run(c.args, c.input), 2, c.fragment);
     ASSERT_EQ(ReadFile(store_), before);
   }
+}
+
+// history lists what each kept version held as hash and export print it,
+// export --version N prints it, and rollback N brings it back whole as a new
+// version; a version not kept is a store error that changes nothing.
+TEST_F(Karstctl, HistoryExportAtAVersionAndRollback) {
+  Ok({"import", "-"}, kCatalogue);
+  const std::string hash = Ok({"hash"});
+  EXPECT_EQ(Run({"policies", "set", "-"}, "[]").status, 0);  // warns of a dangling datastore
+  Ok({"import", "-"}, R"({"policies": [{"name": "a"}, {"name": "b"}], "datastores": []})");
+
+  const Json history = Json::parse(Ok({"history"}));
+  ASSERT_EQ(history.size(), 3u);
+  const Json& first = history[2];
+  EXPECT_EQ(first["version"], 1);
+  EXPECT_EQ(first["policies"], 1);
+  EXPECT_EQ(first["datastores"], 1);
+  EXPECT_EQ(first["hash"], Json::parse(hash));
+  EXPECT_EQ(history[0]["version"], 3);
+  EXPECT_EQ(history[0]["policies"], 2);
+  for (const char* field : {"time", "host", "user"}) EXPECT_TRUE(first[field].is_string());
+
+  EXPECT_EQ(Ok({"export", "--version", "1"}), kCatalogue);
+  Ok({"rollback", "1"});
+  EXPECT_EQ(Ok({"hash"}), hash);
+  EXPECT_EQ(Ok({"export"}), kCatalogue);
+  EXPECT_EQ(Json::parse(Ok({"history"}))[0]["version"], 4);
+
+  const std::string before = ReadFile(store_);
+  ExpectFailure(Run({"rollback", "99"}), 1, "version 99 is not kept (version not kept, 1020)");
+  ExpectFailure(Run({"export", "--version", "99"}), 1, "version 99 is not kept");
+  EXPECT_EQ(ReadFile(store_), before);
 }
 
 // Store failures exit 1 in the store's words with the code's name; a read
@@ -874,8 +912,9 @@ TEST_F(Karstctl, CheckReadsEveryFormAndWarningsNameTheCause) {
 TEST_F(Karstctl, StatusNamesTheStoreAndWhyItIsInUse) {
   ASSERT_EQ(Run({"import", "-"}, kStored).status, 0);
   EXPECT_EQ(Ok({"status"}), "store: " + store_ +
-                                "\nchosen by: --store\nkind: sqlite\nformat: 2\n"
-                                "history: not kept\npolicies: 3\ndatastores: 2\n");
+                                "\nchosen by: --store\nkind: sqlite\nformat: 3\n"
+                                "history: the last 10 versions, newest 1\npolicies: 3\n"
+                                "datastores: 2\n");
   const ToolResult env = RunTool({"status", "--output", "json"});
   EXPECT_EQ(env.status, 0) << env.err;
   EXPECT_EQ(Json::parse(env.out)["chosen_by"], "TAVO_CONFIGSTORE_PATH");

@@ -536,7 +536,7 @@ TEST_F(SqliteStoreTest, RefusesFilesThatAreNotStoresAndLeavesThemAlone) {
       {"random", "", SQLITE_NOTADB},
       {"foreign-id", "PRAGMA application_id = 4242;", kErrorNotAStore},
       {"foreign-version", "PRAGMA user_version = 7;", kErrorNotAStore},
-      {"future", "PRAGMA user_version = 3;", kErrorNotAStore},
+      {"future", "PRAGMA user_version = 4;", kErrorNotAStore},
       {"no-table", "PRAGMA application_id = 1413568079; PRAGMA user_version = 1;", kErrorNotAStore},
   };
   for (const auto& c : cases) {

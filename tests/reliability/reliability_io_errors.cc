@@ -1,7 +1,8 @@
 // Crashes, I/O errors and a full disk under the SQLite store.
 //
 // Injected: the fault VFS fails every write, sync, truncate and read SQLite
-// makes during a replace and during Reset, in turn: once, from then on, and
+// makes during a replace, during Reset and during a rollback to a kept
+// version, in turn: once, from then on, and
 // (writes) as a full disk. Each runs on a new connection with a cold cache, so
 // reads happen inside the write statements; an I/O error there makes SQLite
 // roll the whole transaction back by itself, and the store must not go on
@@ -21,6 +22,7 @@
 // filled to the brim (in a private mount namespace; skipped where the
 // machine does not allow it).
 
+#include "TavoConfigStore/StoreHistory.h"
 #include "reliability_util.h"
 
 namespace karst_reliability {
@@ -70,6 +72,7 @@ TEST(IoErrors, EveryWriteSyncTruncateAndReadFailsOrCrashes) {
   const std::string path = dir.File("store.db"), seed = dir.File("seed.db");
   UseStoreAt(path);
   TavoConfigStore::SetGlobalStore(TavoConfigStore::NewSqliteStore(seed));
+  StoreCatalogue({PoliciesFor(kNew), DatastoresFor(kNew)});  // version 2, for the rollback
   StoreCatalogue({PoliciesFor(kOld), DatastoresFor(kOld)});
   const auto replacePolicies = [] { KarstLib::AddPolicyInfo(PoliciesFor(kNew)); };
   const auto replaceDatastores = [] { KarstLib::AddDatastoreInfo(DatastoresFor(kNew)); };
@@ -84,10 +87,15 @@ TEST(IoErrors, EveryWriteSyncTruncateAndReadFailsOrCrashes) {
     sqlite3_exec(db, "PRAGMA wal_checkpoint(FULL);", nullptr, nullptr, nullptr);
     sqlite3_close(db);
   };
+  const auto rollBack = [] {
+    TavoConfigStore::Rollback(
+        *TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace), 2);
+  };
   const SweepOperation writes[] = {
       {"replace policies", replacePolicies, {PoliciesFor(kNew), DatastoresFor(kOld)}},
       {"replace datastores", replaceDatastores, {PoliciesFor(kOld), DatastoresFor(kNew)}},
       {"reset", KarstLib::Reset, {}},
+      {"rollback", rollBack, {PoliciesFor(kNew), DatastoresFor(kNew)}},
       {"checkpointing replace", replaceAndCheckpoint, {PoliciesFor(kLarge), DatastoresFor(kOld)}}};
   // The call fails once, from then on, or as a full disk; or the process
   // ends before the call, half way through it (a torn write), or after a
@@ -252,16 +260,26 @@ TEST(IoErrors, FileSizeLimitAndFullTmpfs) {
   }
 }
 
-// A store file of the earlier format, as that build wrote it, is upgraded in
-// place by the first process that opens it, in one transaction: a crash at
-// any write, sync or truncate of the upgrade, or an I/O error at any of its
-// calls (reads included), leaves
-// a file from which the next process reads the whole catalogue in its order.
+// A store file of either earlier format, as those builds wrote it, is
+// upgraded in place by the first process that opens it, in one transaction:
+// a crash at any write, sync or truncate of the upgrade, or an I/O error at
+// any of its calls (reads included), leaves a file from which the next
+// process reads the whole catalogue in its order.
+void UpgradeIsAllOrNothing(const std::string& format);
+
 TEST(IoErrors, UpgradeOfAnOldStoreFileIsAllOrNothing) {
+  for (const char* format : {"1", "2"}) {
+    SCOPED_TRACE(std::string("format ") + format);
+    UpgradeIsAllOrNothing(format);
+  }
+}
+
+void UpgradeIsAllOrNothing(const std::string& format) {
   FaultVfs::Install();
   ScratchDir dir;
   const std::string path = dir.File("store.db");
-  const std::string fixture = ReadFile(KARST_FIXTURES_DIR "/store-format1.db");
+  const std::string fixture =
+      ReadFile(std::string(KARST_FIXTURES_DIR) + "/store-format" + format + ".db");
   auto restore = [&] {
     for (const char* suffix : {"", "-wal", "-shm"}) std::filesystem::remove(path + suffix);
     WriteFile(path, fixture);
@@ -282,7 +300,7 @@ TEST(IoErrors, UpgradeOfAnOldStoreFileIsAllOrNothing) {
   };
   const std::string whole =
       "gold,silver,bronze,ds://cluster-a/pool-ssd,ds://archive-01/export,"
-      "ds://cluster-b/pool-ssd,42207bee 14fc1308 format 2";
+      "ds://cluster-b/pool-ssd,42207bee 14fc1308 format 3";
 
   restore();
   FaultVfs::KeepLog(true);
@@ -317,11 +335,11 @@ TEST(IoErrors, UpgradeOfAnOldStoreFileIsAllOrNothing) {
     }
   }
   ReportFigures(
-      "upgrade",
-      "upgrade: an old store file, a crash (whole or torn write) or an I/O error at "
+      ("upgrade" + format).c_str(),
+      "upgrade%s: a store file of format %s, a crash (whole or torn write) or an I/O error at "
       "each of the %d reads, writes, syncs and truncates of its upgrade: %d points, errors "
       "naming the file %d, next process read the catalogue whole %d, wrong %d",
-      calls, points, refused, points - wrong, wrong);
+      format.c_str(), format.c_str(), calls, points, refused, points - wrong, wrong);
 }
 
 }  // namespace karst_reliability

@@ -139,8 +139,17 @@ Invocation ParseArgs(const std::vector<std::string>& args) {
       optionsEnded = true;
     } else if (arg == "--help" || arg == "-h") {
       help = true;
+    } else if (arg.compare(0, 10, "--version=") == 0) {
+      invocation.kept = arg.substr(10);
     } else if (arg == "--version") {
-      version = true;
+      // Followed by a number, a kept version to read; alone, this tool's.
+      const bool number = at + 1 < args.size() && !args[at + 1].empty() &&
+                          args[at + 1].find_first_not_of("0123456789") == std::string::npos;
+      if (number) {
+        invocation.kept = args[++at];
+      } else {
+        version = true;
+      }
     } else if (auto path = OptionValue(args, at, "--store", "a PATH")) {
       if (path->empty()) throw UsageError("--store needs a non-empty PATH");
       invocation.store = *path;

@@ -62,6 +62,7 @@ struct Invocation {
   bool quiet = false;                 // --quiet: warnings as one summary line
   bool strict = false;                // --strict: any warning fails before a write
   bool require = false;               // --require: a blob found nowhere exits 3
+  std::optional<std::string> kept;    // --version N: read kept version N
   std::vector<std::string> operands;  // in the order CommandEntry lists them
   // For help: the commands asked about ("blob --help" names all blob
   // commands); empty for the general help.

@@ -11,6 +11,7 @@
 #include "BlobLookups.h"
 #include "Diff.h"
 #include "Errors.h"
+#include "HistoryCommands.h"
 #include "Io.h"
 #include "Json.h"
 #include "Output.h"
@@ -386,7 +387,7 @@ const std::vector<CommandEntry>& CommandTable() {
        Import},
       {{"export"},
        {},
-       "print {\"policies\": [...], \"datastores\": [...]}",
+       "print {\"policies\": [...], \"datastores\": [...]}; --version N: kept version N",
        StoreUse::kRead,
        {},
        "karstctl export > catalogue.json",
@@ -441,6 +442,27 @@ const std::vector<CommandEntry>& CommandTable() {
        {},
        "karstctl hash --output json",
        Hash},
+      {{"history", "depth"},
+       {"K"},
+       "keep the last K versions from now on (default 10; 0 keeps none)",
+       StoreUse::kWrite,
+       {},
+       "karstctl history depth 20",
+       SetHistoryDepth},
+      {{"history"},
+       {},
+       "list the kept versions, newest first, with their counts and hash digests",
+       StoreUse::kRead,
+       {},
+       "karstctl history --output lines",
+       ListHistory},
+      {{"rollback"},
+       {"N"},
+       "make kept version N current again, in one transaction (a new version)",
+       StoreUse::kWrite,
+       {},
+       "karstctl rollback 41",
+       RollBack},
       {{"watch"},
        {},
        "hash's digests now and at each change, until interrupted",

@@ -53,6 +53,7 @@ std::string HelpText() {
   out += line("--require", "blob commands: exit 3 when the look-up finds no blob");
   out += line("--help", "print this help, or with a COMMAND that command's options");
   out += line("--version", "print the version");
+  out += line("--version N", "with a command that reads: read kept version N (see history)");
   out += line("--", "ends the options: later words starting with - are operands");
   out +=
       "\n"

@@ -2,6 +2,7 @@
 
 #include <sqlite3.h>
 
+#include "HistoryCommands.h"
 #include "Io.h"
 #include "Json.h"
 #include "Output.h"
@@ -31,15 +32,14 @@ Json SqliteFormat(const std::string& path) {
   return format;
 }
 
-// The history's depth and newest version, once the store keeps one; null
-// until then. This is the one place status learns of it.
-Json HistoryStatus() { return nullptr; }
-
 std::string Text(const Json& status) {
   std::string out;
   for (const auto& [key, value] : status.items()) {
     std::string shown = value.is_string() ? value.get<std::string>() : value.dump();
     if (value.is_null()) shown = key == "history" ? "not kept" : "not recorded";
+    if (key == "history" && value.is_object()) {
+      shown = "the last " + value["depth"].dump() + " versions, newest " + value["newest"].dump();
+    }
     std::string label = key;
     for (char& c : label) c = c == '_' ? ' ' : c;
     out += label + ": " + shown + "\n";

@@ -117,6 +117,8 @@ const Names& StoreNames() {
       {kErrorTlsName, "TLS name mismatch"},
       {kErrorTlsClientCertificate, "TLS client certificate"},
       {kErrorTlsProtocol, "TLS or plain text"},
+      {kErrorNoHistory, "no history"},
+      {kErrorNoSuchVersion, "version not kept"},
   };
   return names;
 }

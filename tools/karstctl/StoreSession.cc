@@ -8,8 +8,10 @@
 #include <stdexcept>
 
 #include "Errors.h"
+#include "HistoryCommands.h"
 #include "StoreErrors.h"
 #include "TavoConfigStore/ConfigStore.h"
+#include "TavoConfigStore/StoreHistory.h"
 
 namespace karstctl {
 
@@ -28,6 +30,13 @@ std::string DefaultChosenBy() {
 
 StoreSession::StoreSession(const Invocation& invocation)
     : use_(invocation.command->store), waitMs_(invocation.waitMs) {
+  if (invocation.kept) {
+    if (use_ != StoreUse::kRead) {
+      throw UsageError("--version N reads a kept version; '" + invocation.command->words[0] +
+                       "' does not read the catalogue");
+    }
+    version_ = ParseVersionNumber(*invocation.kept, "--version");
+  }
   if (use_ == StoreUse::kNone) return;
   locator_ = invocation.store ? *invocation.store : TavoConfigStore::DefaultStorePath();
   chosenBy_ = invocation.store ? "--store" : DefaultChosenBy();
@@ -46,6 +55,13 @@ StoreSession::StoreSession(const Invocation& invocation)
 }
 
 void StoreSession::Open() {
+  OpenCurrent();
+  if (version_ == 0) return;
+  TavoConfigStore::SetGlobalStore(TavoConfigStore::OpenVersion(
+      TavoConfigStore::ConfigStore::GetStore(TavoConfigStore::sGlobalNamespace), version_));
+}
+
+void StoreSession::OpenCurrent() {
   if (etcd_) {
     TavoConfigStore::SetGlobalStore(TavoConfigStore::NewEtcdStore(*etcd_));
     return;

@@ -1,6 +1,7 @@
 #ifndef KARSTCTL_STORE_SESSION_H_
 #define KARSTCTL_STORE_SESSION_H_
 
+#include <cstdint>
 #include <optional>
 #include <string>
 
@@ -18,8 +19,9 @@ namespace karstctl {
 // this object lives, with --wait as the lock timeout of a file or the
 // request timeout of etcd. For a read, a file path with nothing there fails
 // with "no store at PATH" (std::runtime_error) instead of reading as an
-// empty catalogue; on etcd an empty catalogue is simply empty. Store
-// failures throw ConfigStoreException.
+// empty catalogue; on etcd an empty catalogue is simply empty. With
+// --version N (reading commands only) the store installed is kept version N
+// of the store, read-only. Store failures throw ConfigStoreException.
 class StoreSession {
  public:
   explicit StoreSession(const Invocation& invocation);
@@ -28,6 +30,8 @@ class StoreSession {
   StoreSession& operator=(const StoreSession&) = delete;
 
   void Open();
+  // Whether the command was given --version N.
+  bool ReadsVersion() const { return version_ != 0; }
 
   // The locator in use, and what chose it: "--store", the environment
   // variable that named it or that the default is derived from.
@@ -36,11 +40,14 @@ class StoreSession {
   bool IsEtcd() const { return etcd_.has_value(); }
 
  private:
+  void OpenCurrent();
+
   StoreUse use_;
   std::string locator_;
   std::string chosenBy_;
   std::optional<TavoConfigStore::EtcdStoreOptions> etcd_;
   std::optional<int> waitMs_;
+  std::uint64_t version_ = 0;  // 0: the current catalogue
 };
 
 }  // namespace karstctl

@@ -50,6 +50,8 @@ enum StoreErrorCode : std::int32_t {
   kErrorTlsClientCertificate = 1017,  // a member that asks for a client certificate, or
                                       // refuses the one given
   kErrorTlsProtocol = 1018,           // plain text to a member that speaks TLS, or the reverse
+  kErrorNoHistory = 1019,             // a history function on a store that keeps none
+  kErrorNoSuchVersion = 1020,         // a version the store does not keep (any longer)
   // etcd's own failures: this plus the gRPC status code, so 1104 is a
   // request that ran out of time (DEADLINE_EXCEEDED), 1114 a cluster that
   // cannot be reached (UNAVAILABLE: every member refused the connection, or

@@ -2,6 +2,7 @@
 
 #include <vector>
 
+#include "History.h"
 #include "TavoConfigStore/ConfigStoreException.h"
 
 namespace TavoConfigStore {
@@ -21,14 +22,18 @@ void CreateFormat2Tables(Connection& conn, const char* what) {
   conn.Exec("CREATE TABLE sequence(next INTEGER NOT NULL)", what);
 }
 
+void SetFormat(Connection& conn, const char* what) {
+  conn.Exec("PRAGMA user_version = " + std::to_string(kFormat), what);
+}
+
+}  // namespace
+
 std::string TableOf(sqlite3_int64 collection) { return "c" + std::to_string(collection); }
 
 std::string CreateTableSql(sqlite3_int64 collection) {
   return "CREATE TABLE " + TableOf(collection) +
          "(seq INTEGER NOT NULL, instance BLOB NOT NULL UNIQUE, body BLOB NOT NULL)";
 }
-
-}  // namespace
 
 Found Inspect(Connection& conn) {
   // The first read of the file: a non-database fails here (SQLITE_NOTADB).
@@ -45,16 +50,22 @@ Found Inspect(Connection& conn) {
     }
     return Found::kFormat1;
   }
-  if (version != kFormat) {
-    throw ConfigStoreException(
-        conn.Where() + ": unknown schema version " + std::to_string(version) +
-            " (this library reads versions 1 and " + std::to_string(kFormat) + ")",
-        kErrorNotAStore);
+  if (version != 2 && version != kFormat) {
+    throw ConfigStoreException(conn.Where() + ": unknown schema version " +
+                                   std::to_string(version) + " (this library reads versions 1 to " +
+                                   std::to_string(kFormat) + ")",
+                               kErrorNotAStore);
   }
   if (conn.Int("SELECT count(*) FROM sqlite_master WHERE type = 'table' AND name IN "
                "('collections', 'sequence')",
                what) != 2) {
     NotAStore(conn, "no collections or sequence table");
+  }
+  if (version == 2) return Found::kFormat2;
+  if (conn.Int("SELECT count(*) FROM sqlite_master WHERE type = 'table' AND name IN "
+               "('history', 'versions', 'version_tables')",
+               what) != 3) {
+    NotAStore(conn, "no history tables");
   }
   return Found::kCurrent;
 }
@@ -63,13 +74,15 @@ void CreateSchema(Connection& conn) {
   const char* what = "creating the schema";
   CreateFormat2Tables(conn, what);
   conn.Exec("INSERT INTO sequence VALUES(1)", what);
+  CreateHistoryTables(conn, what);
   conn.Exec("PRAGMA application_id = " + std::to_string(kApplicationId), what);
-  conn.Exec("PRAGMA user_version = " + std::to_string(kFormat), what);
+  SetFormat(conn, what);
 }
 
 // Each collection's objects move to a table of their own with their seq,
 // so write order and the next seq carry over; a crash or an error anywhere
-// leaves the transaction, and with it the file, as it was.
+// leaves the transaction, and with it the file, as it was. The file then
+// goes on to format 3 in the same transaction.
 void UpgradeFormat1(Connection& conn) {
   const char* what = "upgrading the store from format 1";
   CreateFormat2Tables(conn, what);
@@ -97,7 +110,16 @@ void UpgradeFormat1(Connection& conn) {
               what);
   }
   conn.Exec("DROP TABLE objects", what);
-  conn.Exec("PRAGMA user_version = " + std::to_string(kFormat), what);
+  UpgradeFormat2(conn);
+}
+
+// The catalogue found becomes version 1, so that the first write after the
+// upgrade can be taken back as any later one can.
+void UpgradeFormat2(Connection& conn) {
+  const char* what = "upgrading the store from format 2";
+  CreateHistoryTables(conn, what);
+  History(conn).Record();
+  SetFormat(conn, what);
 }
 
 sqlite3_stmt* Collections::Statement(Collection* c, Op op) {

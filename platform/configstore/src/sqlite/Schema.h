@@ -1,4 +1,4 @@
-// The tables of the SQLite store, format 2, and which of them holds which
+// The tables of the SQLite store, format 3, and which of them holds which
 // collection:
 //
 //   collections(id INTEGER PRIMARY KEY, key BLOB, grp BLOB, component BLOB),
@@ -17,8 +17,9 @@
 // pages in half as for inserts in the middle, which made a replace write
 // about ten times the pages.
 //
+// Format 3 adds the history of versions (History.h); format 2 had none.
 // Format 1 kept every object in one table, objects(seq, key, grp, component,
-// instance, body); a writer upgrades such a file in place, in one
+// instance, body). A writer upgrades a file of either in place, in one
 // transaction.
 //
 // Internal to the library.
@@ -39,9 +40,9 @@ namespace TavoConfigStore {
 namespace sqlite {
 
 constexpr int kApplicationId = 0x5441564f;  // "TAVO"
-constexpr int kFormat = 2;
+constexpr int kFormat = 3;
 
-enum class Found { kEmpty, kFormat1, kCurrent };
+enum class Found { kEmpty, kFormat1, kFormat2, kCurrent };
 
 // What the file holds; throws ConfigStoreException (kErrorNotAStore, or the
 // SQLite error) for anything not a store of a known format. Call inside a
@@ -51,6 +52,11 @@ Found Inspect(Connection& conn);
 // Call inside a write transaction.
 void CreateSchema(Connection& conn);
 void UpgradeFormat1(Connection& conn);
+void UpgradeFormat2(Connection& conn);
+
+// The table that holds a collection now, and the statement that makes it.
+std::string TableOf(sqlite3_int64 collection);
+std::string CreateTableSql(sqlite3_int64 collection);
 
 // Which table holds which collection, and each table's statements, prepared
 // on first use. A collection, once made, is never dropped, so what is known

@@ -1,7 +1,8 @@
 // The SQLite backend: a table per collection, each object a row of its
 // instance id and its body (object/Format.h) in one BLOB. Schema.h has the
-// tables, which of them holds which collection, and the upgrade from format 1;
-// StoreFile.h how the file is made and watched.
+// tables, which of them holds which collection, and the upgrades from formats
+// 1 and 2; History.h the versions the store keeps of itself; StoreFile.h how
+// the file is made and watched.
 //
 // Write order: every object written gets the next "seq" of the whole store,
 // so a rewritten object moves to the end and objects of several collections
@@ -33,9 +34,11 @@
 #include <vector>
 
 #include "../Backend.h"
+#include "../HistorySource.h"
 #include "../TransactionLevels.h"
 #include "../object/Objects.h"
 #include "Connection.h"
+#include "History.h"
 #include "Schema.h"
 #include "StoreFile.h"
 #include "TavoConfigStore/ConfigStore.h"
@@ -72,7 +75,7 @@ void InWriteOrder(const std::vector<sqlite3_int64>& seqs, std::vector<ObjectPtr>
   objects->swap(sorted);
 }
 
-class SqliteStore final : public Backend {
+class SqliteStore final : public Backend, public HistorySource {
  public:
   // Every message names the store, never with a password that a URL-like
   // path may hold.
@@ -114,8 +117,10 @@ class SqliteStore final : public Backend {
     OpenForWriting();
     // A write may touch several tables and the sequence.
     InTransaction("BEGIN IMMEDIATE", "starting a write", "committing a write", [&] {
-      sqlite3_stmt* s =
-          collections_.Statement(collections_.Find(object.Id(), true), Collections::kPut);
+      Collections::Collection* c = collections_.Find(object.Id(), true);
+      history_.BeforeChange(c->id, true);
+      changed_ = true;
+      sqlite3_stmt* s = collections_.Statement(c, Collections::kPut);
       Resetter reset(s);
       if (sqlite3_bind_int64(s, 1, NextSeq()) != SQLITE_OK) conn_.Fail("binding a value");
       conn_.Bind(s, 2, object.Id().InstanceId());
@@ -130,6 +135,10 @@ class SqliteStore final : public Backend {
     InTransaction("BEGIN IMMEDIATE", "starting a write", "committing a write", [&] {
       const std::string& instance = filter.Id().InstanceId();
       for (Collections::Collection* c : collections_.Matching(filter.Id())) {
+        changed_ = true;
+        // A table a kept version holds is left to it; a clear then has
+        // nothing more to do.
+        if (history_.BeforeChange(c->id, !instance.empty())) continue;
         // Without an instance id, the whole table: SQLite then frees its
         // pages at once instead of deleting row by row.
         sqlite3_stmt* s =
@@ -183,8 +192,9 @@ class SqliteStore final : public Backend {
       // IMMEDIATE takes the write lock now, so a writer waits here (busy
       // timeout) instead of failing on its first write with a stale snapshot.
       conn_.Run("BEGIN IMMEDIATE", "starting a transaction");
+      changed_ = false;
     }
-    levels_.Begin();
+    levels_.Begin(changed_);
   }
 
   void CommitTransaction() override {
@@ -206,6 +216,7 @@ class SqliteStore final : public Backend {
     }
     FlushSequence();
     try {
+      RecordVersion();
       conn_.Run("COMMIT", "committing");
     } catch (...) {
       // A failed COMMIT may leave the transaction open (then Abort ends it).
@@ -224,9 +235,10 @@ class SqliteStore final : public Backend {
     // Collections made inside what is undone are gone again.
     if (levels_.Nested()) {
       collections_.Forget();
+      history_.Forget();
       conn_.Run("ROLLBACK TO nested", "undoing a nested transaction");
       conn_.Run("RELEASE nested", "undoing a nested transaction");
-      levels_.Abort();
+      changed_ = levels_.Abort();
       return;
     }
     Forget();
@@ -237,6 +249,74 @@ class SqliteStore final : public Backend {
       throw;
     }
     levels_.Clear();
+  }
+
+  // ---- HistorySource ------------------------------------------------------
+
+  std::string HistoryWhere() const override { return Where(); }
+
+  std::vector<StoreVersion> Versions() override {
+    std::lock_guard<std::mutex> lock(mu_);
+    std::vector<StoreVersion> out;
+    if (!Open(false)) return out;
+    InTransaction("BEGIN", "starting a read", "ending a read", [&] { out = history_.Versions(); });
+    return out;
+  }
+
+  unsigned Depth() override {
+    std::lock_guard<std::mutex> lock(mu_);
+    unsigned depth = sqlite::kDefaultDepth;
+    if (!Open(false)) return depth;
+    InTransaction("BEGIN", "starting a read", "ending a read", [&] { depth = history_.Depth(); });
+    return depth;
+  }
+
+  void SetDepth(unsigned depth) override {
+    std::lock_guard<std::mutex> lock(mu_);
+    OpenForWriting();
+    InTransaction("BEGIN IMMEDIATE", "starting a write", "committing a write",
+                  [&] { history_.SetDepth(depth); });
+  }
+
+  std::uint64_t Newest() override {
+    std::lock_guard<std::mutex> lock(mu_);
+    std::uint64_t newest = 0;
+    if (!Open(false)) return newest;
+    InTransaction("BEGIN", "starting a read", "ending a read", [&] { newest = history_.Newest(); });
+    return newest;
+  }
+
+  std::vector<ObjectPtr> ListVersion(std::uint64_t number,
+                                     const FilterSpecObject& filter) override {
+    std::lock_guard<std::mutex> lock(mu_);
+    if (!Open(false)) {
+      throw ConfigStoreException(NotKeptMessage(Where(), number), kErrorNoSuchVersion);
+    }
+    std::vector<ObjectPtr> out;
+    InTransaction("BEGIN", "starting a read", "ending a read", [&] {
+      const std::string& instance = filter.Id().InstanceId();
+      const auto tables = history_.TablesOf(number, filter.Id());
+      std::vector<sqlite3_int64> seqs;
+      objectmodel::Arena arena;
+      for (const auto& t : tables) {
+        std::unique_ptr<sqlite3_stmt, int (*)(sqlite3_stmt*)> s(
+            conn_.Prepare("SELECT seq, instance, body FROM " + t.name +
+                              (instance.empty() ? " ORDER BY rowid" : " WHERE instance = ?1"),
+                          "reading a version"),
+            sqlite3_finalize);
+        if (!instance.empty()) conn_.Bind(s.get(), 1, instance);
+        int rc;
+        while ((rc = sqlite3_step(s.get())) == SQLITE_ROW) {
+          seqs.push_back(sqlite3_column_int64(s.get(), 0));
+          out.push_back(Decode(ConfigStoreObjectId(t.key, t.group, t.component,
+                                                   std::string(Connection::Column(s.get(), 1))),
+                               s.get(), &arena));
+        }
+        if (rc != SQLITE_DONE) conn_.Fail("reading a version");
+      }
+      if (tables.size() > 1) InWriteOrder(seqs, &out);
+    });
+    return out;
   }
 
   // Any commit by another connection since this one connected or last
@@ -311,6 +391,7 @@ class SqliteStore final : public Backend {
         found = sqlite::Inspect(conn_);
         if (found == sqlite::Found::kEmpty) sqlite::CreateSchema(conn_);
         if (found == sqlite::Found::kFormat1) sqlite::UpgradeFormat1(conn_);
+        if (found == sqlite::Found::kFormat2) sqlite::UpgradeFormat2(conn_);
       });
     }
     // Only now, once the file is known to be ours: switching to WAL rewrites
@@ -362,6 +443,7 @@ class SqliteStore final : public Backend {
     try {
       body();
       FlushSequence();
+      RecordVersion();
       conn_.Run("COMMIT", ending);
     } catch (...) {
       conn_.RollbackQuietly();
@@ -394,7 +476,17 @@ class SqliteStore final : public Backend {
 
   void Forget() {
     collections_.Forget();
-    seqLoaded_ = seqDirty_ = false;
+    history_.Forget();
+    seqLoaded_ = seqDirty_ = changed_ = false;
+  }
+
+  // ---- History ------------------------------------------------------------
+
+  // Before the outermost commit: what it commits becomes a version.
+  void RecordVersion() {
+    if (!changed_) return;
+    history_.Record();
+    changed_ = false;
   }
 
   // ---- Write order --------------------------------------------------------
@@ -453,7 +545,11 @@ class SqliteStore final : public Backend {
   Connection conn_;
   Collections collections_{conn_};
   SqliteStoreOptions options_;
-  TransactionLevels<> levels_;
+  sqlite::History history_{conn_};
+  // Each level keeps whether the transaction had changed anything when the
+  // level began, which an abort of the level brings back.
+  TransactionLevels<bool> levels_;
+  bool changed_ = false;    // the open write changed something: a new version
   bool seqLoaded_ = false;  // nextSeq_ was read within the open write
   bool seqDirty_ = false;   // and has been used since
   sqlite3_int64 nextSeq_ = 0;

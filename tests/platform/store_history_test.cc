@@ -1,0 +1,148 @@
+// The versions a SQLite store keeps of itself: each kept version reads as
+// the store did right after its commit, whatever shape of write came after
+// it; no more than the depth are kept, in versions or in tables; a rollback
+// brings a kept version back as a new one, and one not kept changes nothing.
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include <functional>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "Files.h"
+#include "RawSqlite.h"
+#include "StoreObjects.h"
+#include "TavoConfigStore/StoreHistory.h"
+
+namespace TavoConfigStore {
+namespace {
+
+using karst_test::CodeOf;
+using karst_test::Filter;
+using karst_test::Set;
+using karst_test::Valued;
+using karst_test::ValuesOf;
+
+// Both collections, "k" first.
+std::vector<std::string> Everything(ConfigStore& store) {
+  auto all = ValuesOf(store, Filter("k"));
+  for (const std::string& v : ValuesOf(store, Filter("k2"))) all.push_back("k2:" + v);
+  return all;
+}
+
+void Replace(ConfigStore& store, const std::string& key, const std::vector<std::string>& values) {
+  store.BeginTransaction();
+  store.DeleteObjects(Filter(key));
+  for (const std::string& v : values) Set(store, Valued(v, v, key));
+  store.CommitTransaction();
+}
+
+class StoreHistoryTest : public ::testing::Test {
+ protected:
+  std::string Path() const { return dir_.File("store.db"); }
+  long long Tables() {
+    return std::stoll(karst_test::RawDb(Path()).QueryText(
+        "SELECT count(*) FROM sqlite_master WHERE type = 'table'"));
+  }
+  // Runs "change", then checks that it made one new version and that every
+  // version kept reads as the store read after its own commit.
+  void Change(ConfigStore& store, const std::function<void()>& change) {
+    change();
+    const std::uint64_t newest = ListVersions(store).front().number;
+    EXPECT_EQ(newest, states_.size() + 1) << "one version per committed change";
+    states_.push_back(Everything(store));
+    for (const StoreVersion& v : ListVersions(store)) {
+      EXPECT_EQ(Everything(*OpenVersion(store_, v.number)), states_[v.number - 1])
+          << "version " << v.number << " after change " << newest;
+    }
+  }
+
+  karst_test::ScratchDir dir_;
+  std::shared_ptr<ConfigStore> store_ = NewSqliteStore(Path());
+  std::vector<std::vector<std::string>> states_;  // [n - 1]: after version n
+};
+
+TEST_F(StoreHistoryTest, KeptVersionsReadAsCommittedUnderEveryKindOfWrite) {
+  ConfigStore& store = *store_;
+  SetHistoryDepth(store, 4);
+  Change(store, [&] { Replace(store, "k", {"a", "b"}); });
+  Change(store, [&] { Replace(store, "k2", {"x"}); });
+  Change(store, [&] { Set(store, Valued("c", "c1")); });  // a single write, no clear
+  Change(store, [&] { Set(store, Valued("a", "a2")); });  // an object rewritten
+  Change(store, [&] { store.DeleteObjects(Filter("k", "g", "c", "b")); });
+  Change(store, [&] {
+    store.BeginTransaction();
+    Set(store, Valued("d", "d"));
+    store.BeginTransaction();  // undone: the clear must not reach any version
+    store.DeleteObjects(Filter());
+    store.AbortTransaction();
+    store.CommitTransaction();
+  });
+  Change(store, [&] { Replace(store, "k", {}); });
+
+  // Neither a read in a transaction nor an aborted write is a change.
+  store.BeginTransaction();
+  Everything(store);
+  store.CommitTransaction();
+  store.BeginTransaction();
+  Set(store, Valued("e"));
+  store.AbortTransaction();
+  EXPECT_EQ(ListVersions(store).front().number, states_.size());
+
+  // A loop of replaces keeps the depth, in versions and in tables: the
+  // current ones and those of the versions kept, besides the five of the
+  // schema.
+  for (int i = 0; i < 12; ++i) {
+    Change(store, [&] { Replace(store, i % 3 ? "k" : "k2", {std::to_string(i)}); });
+    ASSERT_EQ(ListVersions(store).size(), 4u);
+    EXPECT_LE(Tables(), 5 + 2 * 4);
+  }
+  EXPECT_EQ(CodeOf([&] { OpenVersion(store_, 1); }), kErrorNoSuchVersion);
+
+  // Another connection sees the same history, and a smaller depth at once.
+  auto other = NewSqliteStore(Path());
+  EXPECT_EQ(HistoryDepth(*other), 4u);
+  SetHistoryDepth(*other, 0);
+  EXPECT_TRUE(ListVersions(store).empty());
+  EXPECT_EQ(Tables(), 5 + 2);
+  const std::uint64_t newest = NewestVersion(store);
+  Replace(store, "k", {"z"});
+  EXPECT_TRUE(ListVersions(store).empty());
+  EXPECT_EQ(NewestVersion(store), newest + 1) << "numbers go on when none is kept";
+}
+
+TEST_F(StoreHistoryTest, RollbackMakesAKeptVersionCurrentAsANewOne) {
+  ConfigStore& store = *store_;
+  Change(store, [&] { Replace(store, "k", {"a", "b", "c"}); });
+  Change(store, [&] { Replace(store, "k2", {"x", "y"}); });
+  Change(store, [&] { Replace(store, "k", {"d"}); });
+  Change(store, [&] { Set(store, Valued("a", "a2")); });
+
+  Change(store, [&] { EXPECT_EQ(Rollback(store, 2), 5u); });
+  EXPECT_EQ(NewestVersion(store), 5u);
+  EXPECT_EQ(Everything(store), states_[1]) << "objects and their order as version 2 had them";
+
+  // A version not kept: nothing changes, not even the version count.
+  for (const std::uint64_t unkept : {0ull, 6ull, 99ull}) {
+    EXPECT_EQ(CodeOf([&] { Rollback(store, unkept); }), kErrorNoSuchVersion) << unkept;
+    EXPECT_EQ(Everything(store), states_[1]);
+    EXPECT_EQ(ListVersions(store).front().number, 5u);
+  }
+  // A kept version is read, never written.
+  auto version = OpenVersion(store_, 3);
+  EXPECT_EQ(CodeOf([&] { Set(*version, Valued("q")); }), SQLITE_READONLY);
+  EXPECT_EQ(CodeOf([&] { version->DeleteObjects(Filter()); }), SQLITE_READONLY);
+  EXPECT_EQ(Everything(*version), states_[2]);
+}
+
+TEST(StoreHistoryOtherStores, KeepNoHistory) {
+  auto memory = NewMemoryStore();
+  EXPECT_EQ(CodeOf([&] { ListVersions(*memory); }), kErrorNoHistory);
+  EXPECT_EQ(CodeOf([&] { Rollback(*memory, 1); }), kErrorNoHistory);
+}
+
+}  // namespace
+}  // namespace TavoConfigStore
