@@ -111,8 +111,10 @@ void History::Record() {
     Resetter reset(s);
     BindInt(conn_, s, 1, number, what);
     BindInt(conn_, s, 2, NowMs(), what);
-    conn_.Bind(s, 3, HostName());
-    conn_.Bind(s, 4, UserName());
+    // Bound without a copy: the strings must outlive the step.
+    const std::string host = HostName(), user = UserName();
+    conn_.Bind(s, 3, host);
+    conn_.Bind(s, 4, user);
     Step(conn_, s, what);
   }
   s = conn_.Cached(
