@@ -53,6 +53,19 @@ std::map<std::string, std::string> EtcdKeys::List(const std::string& prefix) con
   return out;
 }
 
+std::vector<std::string> EtcdKeys::Keys(const std::string& prefix) const {
+  etcdserverpb::RangeRequest request;
+  request.set_key(prefix);
+  request.set_range_end(PrefixEnd(prefix));
+  request.set_keys_only(true);
+  etcdserverpb::RangeResponse response;
+  grpc::ClientContext context;
+  Check(stubs_->kv->Range(&context, request, &response), "range");
+  std::vector<std::string> out;
+  for (const auto& kv : response.kvs()) out.push_back(kv.key());
+  return out;
+}
+
 void EtcdKeys::Put(const std::string& key, const std::string& value, std::int64_t lease) const {
   etcdserverpb::PutRequest request;
   request.set_key(key);

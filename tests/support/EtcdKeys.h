@@ -9,6 +9,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <vector>
 
 namespace karst_test {
 
@@ -21,6 +22,8 @@ class EtcdKeys {
 
   // Every key starting with "prefix", with its value.
   std::map<std::string, std::string> List(const std::string& prefix) const;
+  // Every key starting with "prefix", without the values.
+  std::vector<std::string> Keys(const std::string& prefix) const;
   void Put(const std::string& key, const std::string& value, std::int64_t lease = 0) const;
   std::int64_t GrantLease(std::int64_t ttlSeconds) const;
   void RevokeLease(std::int64_t lease) const;
