@@ -478,6 +478,9 @@ TEST(EtcdFailover, LeaderKillsDeadWritersAndAClusterDown) {
       usleep(10000);
     });
     std::this_thread::sleep_until(pausedAt + std::chrono::milliseconds(kTimeoutMs + 2000));
+    // A slow build's import may have used up most of that: the member stays
+    // stopped until the reader has listed too.
+    WaitUntil([&] { return pausedListings > 0; }, std::chrono::seconds(20));
   }
   etcd.Resume(follower);
   EXPECT_EQ(pausedErrors.Text(), "none");
