@@ -276,6 +276,13 @@ TEST_P(StoreConformance, ObjectsHandedOutAreCopies) {
   store_->DeleteObjects(Filter());
   long long n = 0;
   EXPECT_TRUE(sub->GetValue("n", &n) && n == 3);
+  // A sub-object changed through what a read handed out is written back changed.
+  Set(*store_, written);
+  auto again = store_->GetObjects(Filter()).at(0);
+  again->GetSubObject(SubObjectId("arr", "4"))->SetValue("n", 4LL);
+  Set(*store_, again);
+  again = store_->GetObjects(Filter()).at(0);
+  EXPECT_TRUE(again->GetSubObject(SubObjectId("arr", "4"))->GetValue("n", &n) && n == 4);
 }
 
 INSTANTIATE_TEST_SUITE_P(Backends, StoreConformance, ::testing::Values("memory", "sqlite", "etcd"),

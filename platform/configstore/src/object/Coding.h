@@ -39,8 +39,14 @@ inline char* EncodeVarint(char* out, std::uint64_t value) {
   return out;
 }
 
-void PutVarint(std::string* out, std::uint64_t value);
-void PutLengthPrefixed(std::string* out, std::string_view bytes);
+inline void PutVarint(std::string* out, std::uint64_t value) {
+  char buffer[kMaxVarintLength];
+  out->append(buffer, static_cast<std::size_t>(EncodeVarint(buffer, value) - buffer));
+}
+inline void PutLengthPrefixed(std::string* out, std::string_view bytes) {
+  PutVarint(out, bytes.size());
+  out->append(bytes);
+}
 
 // Read from the front of "*in" and drop what they read. False when the bytes
 // end first, or a varint is too long or overflows 64 bits; "*in" is then

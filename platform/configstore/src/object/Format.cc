@@ -94,23 +94,15 @@ void PutValue(std::string* out, std::string_view name, const std::string* bytes,
 Parts Split(std::string_view body) {
   if (body.empty() || body.front() != kFormat) Corrupt("unknown format");
   std::string_view in = body.substr(1);
-  Parts parts;
   const char* values = in.data();
   SkipValues(&in);
-  parts.values = std::string_view(values, static_cast<std::size_t>(in.data() - values));
-  parts.subs = in;
-  std::size_t count = 0;
-  if (!GetCount(&in, &count)) Corrupt("truncated sub-object count");
-  std::string_view array;
-  std::string_view key;
-  for (std::size_t i = 0; i < count; ++i) {
-    if (!coding::GetLengthPrefixed(&in, &array) || !coding::GetLengthPrefixed(&in, &key)) {
-      Corrupt("damaged sub-object identifier");
-    }
-    SkipValues(&in);
+  if (in.empty()) Corrupt("truncated sub-object count");
+  SubReader reader(in);
+  Sub sub;
+  while (reader.Next(&sub)) {
   }
-  if (!in.empty()) Corrupt("trailing bytes");
-  return parts;
+  if (!reader.Rest().empty()) Corrupt("trailing bytes");
+  return Parts{std::string_view(values, static_cast<std::size_t>(in.data() - values)), in};
 }
 
 bool FindValue(std::string_view values, std::string_view name, Value* out) {
@@ -161,31 +153,25 @@ void SetValue(std::string* values, std::string_view name, const std::string* byt
       return;
     }
   }
-  // A new name goes at the end, written in place: the count is rewritten,
-  // and moves the rest only when it grows a byte.
+  // A new name goes at the end, after the count is rewritten.
   char newCount[coding::kMaxVarintLength];
-  const std::size_t newCountSize =
-      static_cast<std::size_t>(coding::EncodeVarint(newCount, count + 1) - newCount);
-  // Room for a few more names and short values besides: most objects are
-  // set value after value.
-  const std::size_t needed =
-      values->size() + newCountSize - countSize + ValueSize(name, bytes, integer);
-  if (values->capacity() < needed) values->reserve(needed + 64);
-  if (newCountSize != countSize) values->insert(0, newCountSize - countSize, '\0');
-  std::memcpy(&(*values)[0], newCount, newCountSize);
+  values->replace(0, countSize, newCount,
+                  static_cast<std::size_t>(coding::EncodeVarint(newCount, count + 1) - newCount));
   PutValue(values, name, bytes, integer);
 }
 
 SubReader::SubReader(std::string_view subs) : rest_(subs) {
-  if (!rest_.empty()) GetCount(&rest_, &count_);
+  if (!rest_.empty() && !GetCount(&rest_, &count_)) Corrupt("truncated sub-object count");
   left_ = count_;
 }
 
 bool SubReader::Next(Sub* out) {
   if (left_ == 0) return false;
   --left_;
-  coding::GetLengthPrefixed(&rest_, &out->array);
-  coding::GetLengthPrefixed(&rest_, &out->key);
+  if (!coding::GetLengthPrefixed(&rest_, &out->array) ||
+      !coding::GetLengthPrefixed(&rest_, &out->key)) {
+    Corrupt("damaged sub-object identifier");
+  }
   const char* values = rest_.data();
   SkipValues(&rest_);
   out->values = std::string_view(values, static_cast<std::size_t>(rest_.data() - values));

@@ -64,14 +64,18 @@ std::vector<StoreValue> DecodeValues(std::string_view values);
 void SetValue(std::string* values, std::string_view name, const std::string* bytes,
               std::int64_t integer);
 
-// ---- Checked "subs" sections ----------------------------------------------
+// ---- "subs" sections ------------------------------------------------------
 
+// Reads the sub-objects of a "subs" section one by one, checking each:
+// damage throws as Split does.
 class SubReader {
  public:
   explicit SubReader(std::string_view subs);
   std::size_t Count() const { return count_; }
   // The next sub-object; false after the last.
   bool Next(Sub* out);
+  // What follows the last sub-object read.
+  std::string_view Rest() const { return rest_; }
 
  private:
   std::string_view rest_;

@@ -1,7 +1,6 @@
 #include "Objects.h"
 
 #include <cstring>
-#include <new>
 #include <string_view>
 #include <utility>
 
@@ -29,65 +28,16 @@ bool SubMatches(const FilterSpecObject* filter, std::string_view array, std::str
 }  // namespace
 
 // The sub-objects of a read object: an object over each one's values in the
-// body, which the index keeps. The entries follow the index in the same
-// allocation (WithEntries).
-struct SubIndex {
+// body, which the index keeps.
+struct SubIndex : std::enable_shared_from_this<SubIndex> {
   struct Entry {
     std::string_view array;
     std::string_view key;
     StoreObject object;
   };
-  SubIndex(std::size_t n, Entry* room) : count(n), entries(room) {}
-  SubIndex(const SubIndex&) = delete;
-  SubIndex& operator=(const SubIndex&) = delete;
-  ~SubIndex() {
-    for (std::size_t i = 0; i < count; ++i) entries[i].~Entry();
-  }
-  const Entry* begin() const { return entries; }
-  const Entry* end() const { return entries + count; }
-
-  std::weak_ptr<SubIndex> self;
   std::shared_ptr<const void> body;
-  std::size_t count;
-  Entry* entries;
+  std::vector<Entry> entries;
 };
-
-namespace {
-
-// An allocator for allocate_shared that takes room for "count" entries
-// after what it allocates and says where: the index, its entries and the
-// shared count are then one allocation.
-template <typename T>
-struct WithEntries {
-  using value_type = T;
-  std::size_t count;
-  SubIndex::Entry** room;
-
-  WithEntries(std::size_t n, SubIndex::Entry** r) : count(n), room(r) {}
-  template <typename U>
-  WithEntries(const WithEntries<U>& other) : count(other.count), room(other.room) {}
-
-  static std::size_t Head(std::size_t n) {
-    constexpr std::size_t kAlign = alignof(SubIndex::Entry);
-    return (n * sizeof(T) + kAlign - 1) / kAlign * kAlign;
-  }
-  T* allocate(std::size_t n) {
-    char* p = static_cast<char*>(::operator new(Head(n) + count * sizeof(SubIndex::Entry)));
-    *room = reinterpret_cast<SubIndex::Entry*>(p + Head(n));
-    return reinterpret_cast<T*>(p);
-  }
-  void deallocate(T* p, std::size_t) { ::operator delete(p); }
-  template <typename U>
-  bool operator==(const WithEntries<U>& other) const {
-    return count == other.count && room == other.room;
-  }
-  template <typename U>
-  bool operator!=(const WithEntries<U>& other) const {
-    return !(*this == other);
-  }
-};
-
-}  // namespace
 
 // The one friend of the object classes: the object model's own code reaches
 // their representation through it.
@@ -116,35 +66,60 @@ class Access {
   }
 
   static std::shared_ptr<SubIndex> NewIndex(const ConfigStoreObject& object) {
-    format::SubReader reader(EncodedSubs(object));
-    SubIndex::Entry* room = nullptr;
-    auto index = std::allocate_shared<SubIndex>(WithEntries<SubIndex>(reader.Count(), &room),
-                                                std::size_t{0}, room);
-    index->entries = room;
-    index->self = index;
+    format::SubReader reader(std::string_view(object.encodedSubs_, object.encodedSubsSize_));
+    auto index = std::make_shared<SubIndex>();
     index->body = object.body_;
+    // Room for all first: an entry's object never moves once handed out.
+    index->entries.reserve(reader.Count());
     format::Sub sub;
     while (reader.Next(&sub)) {
-      SubIndex::Entry* entry = new (room + index->count) SubIndex::Entry();
-      ++index->count;
-      entry->array = sub.array;
-      entry->key = sub.key;
-      View(entry->object, sub.values, nullptr);
+      SubIndex::Entry& entry = index->entries.emplace_back();
+      entry.array = sub.array;
+      entry.key = sub.key;
+      View(entry.object, sub.values, nullptr);
     }
     return index;
   }
 
-  // One of the index's objects, which keeps the index.
-  static std::shared_ptr<StoreObject> Share(const SubIndex& index, const SubIndex::Entry& entry) {
-    return std::shared_ptr<StoreObject>(index.self.lock(), const_cast<StoreObject*>(&entry.object));
+  // Calls "visit(array, key, share)" for each sub-object of "object" in
+  // order until it returns true; "share()" gives the sub-object. A read
+  // object's come from its index.
+  template <typename Visit>
+  static void ForEachSub(const ConfigStoreObject& object, Visit visit) {
+    if (object.encodedSubs_ == nullptr) {
+      for (const SubObjectEntry& e : object.subs_) {
+        if (visit(e.id.Array(), e.id.Key(), [&e] { return e.object; })) return;
+      }
+      return;
+    }
+    SubIndex& index = const_cast<SubIndex&>(object.Index());
+    for (SubIndex::Entry& e : index.entries) {
+      auto share = [&] {
+        return std::shared_ptr<StoreObject>(index.shared_from_this(), &e.object);
+      };
+      if (visit(e.array, e.key, share)) return;
+    }
   }
 
-  static bool Encoded(const ConfigStoreObject& object) { return object.encodedSubs_ != nullptr; }
-  static std::string_view EncodedSubs(const ConfigStoreObject& object) {
-    return std::string_view(object.encodedSubs_, object.encodedSubsSize_);
-  }
-  static const std::vector<SubObjectEntry>& Subs(const ConfigStoreObject& object) {
-    return object.subs_;
+  static void Encode(const ConfigStoreObject& object, std::string* out) {
+    const std::string_view values = Values(object);
+    out->reserve(out->size() + 1 + values.size() + object.encodedSubsSize_);
+    out->push_back(format::kFormat);
+    out->append(values);
+    // A read object's sub-objects go back as they were read unless one was
+    // handed out, which may have changed since.
+    if (object.encodedSubs_ != nullptr && object.index_.load() == nullptr) {
+      out->append(object.encodedSubs_, object.encodedSubsSize_);
+      return;
+    }
+    const std::size_t count =
+        object.encodedSubs_ ? object.Index().entries.size() : object.subs_.size();
+    coding::PutVarint(out, count);
+    ForEachSub(object, [out](std::string_view array, std::string_view key, auto share) {
+      format::PutSubHeader(out, array, key);
+      out->append(Values(*share()));
+      return false;
+    });
   }
 
   // An object over "body", whose sections "parts" are: over a copy in
@@ -170,32 +145,7 @@ class Access {
 };
 
 void EncodeObject(const ConfigStoreObject& object, std::string* out) {
-  // Sized first and written in one go: no regrowing of "out".
-  const std::string_view values = Access::Values(object);
-  std::size_t size = 1 + values.size();
-  const std::vector<SubObjectEntry>& subs = Access::Subs(object);
-  if (Access::Encoded(object)) {
-    size += Access::EncodedSubs(object).size();
-  } else {
-    size += coding::VarintLength(subs.size());
-    for (const SubObjectEntry& e : subs) {
-      size += coding::VarintLength(e.id.Array().size()) + e.id.Array().size() +
-              coding::VarintLength(e.id.Key().size()) + e.id.Key().size() +
-              Access::Values(*e.object).size();
-    }
-  }
-  out->reserve(out->size() + size);
-  out->push_back(format::kFormat);
-  out->append(values);
-  if (Access::Encoded(object)) {
-    out->append(Access::EncodedSubs(object));
-    return;
-  }
-  coding::PutVarint(out, subs.size());
-  for (const SubObjectEntry& e : subs) {
-    format::PutSubHeader(out, e.id.Array(), e.id.Key());
-    out->append(Access::Values(*e.object));
-  }
+  Access::Encode(object, out);
 }
 
 std::shared_ptr<ConfigStoreObject> DecodeObject(ConfigStoreObjectId id, std::string_view body,
@@ -293,7 +243,7 @@ ConfigStoreObject::ConfigStoreObject(const ConfigStoreObject& other)
       encodedSubs_(other.encodedSubs_),
       encodedSubsSize_(other.encodedSubsSize_),
       index_(other.index_.load(std::memory_order_acquire)) {
-  if (index_ != nullptr) indexOwner_ = index_.load()->self.lock();
+  if (index_ != nullptr) indexOwner_ = index_.load()->shared_from_this();
 }
 
 ConfigStoreObject& ConfigStoreObject::operator=(const ConfigStoreObject& other) {
@@ -327,14 +277,11 @@ const objectmodel::SubIndex& ConfigStoreObject::Index() const {
 }
 
 std::vector<SubObjectEntry> ConfigStoreObject::SubObjects() const {
-  if (encodedSubs_ == nullptr) return subs_;
-  const objectmodel::SubIndex& index = Index();
   std::vector<SubObjectEntry> out;
-  out.reserve(index.count);
-  for (const auto& e : index) {
-    out.push_back(SubObjectEntry{SubObjectId(std::string(e.array), std::string(e.key)),
-                                 Access::Share(index, e)});
-  }
+  Access::ForEachSub(*this, [&out](std::string_view array, std::string_view key, auto share) {
+    out.push_back(SubObjectEntry{SubObjectId(std::string(array), std::string(key)), share()});
+    return false;
+  });
   return out;
 }
 
@@ -359,36 +306,22 @@ std::shared_ptr<StoreObject> ConfigStoreObject::CreateSubObject(const SubObjectI
 }
 
 std::shared_ptr<StoreObject> ConfigStoreObject::GetSubObject(const SubObjectId& id) const {
-  if (encodedSubs_ != nullptr) {
-    const objectmodel::SubIndex& index = Index();
-    for (const auto& e : index) {
-      if (e.array == id.Array() && e.key == id.Key()) return Access::Share(index, e);
-    }
-    return nullptr;
-  }
-  for (const SubObjectEntry& e : subs_) {
-    if (e.id.Array() == id.Array() && e.id.Key() == id.Key()) return e.object;
-  }
-  return nullptr;
+  std::shared_ptr<StoreObject> found;
+  Access::ForEachSub(*this, [&](std::string_view array, std::string_view key, auto share) {
+    if (array != id.Array() || key != id.Key()) return false;
+    found = share();
+    return true;
+  });
+  return found;
 }
 
 std::vector<std::shared_ptr<StoreObject>> ConfigStoreObject::GetSubObjectInstances(
     const std::shared_ptr<FilterSpecObject>& filter) const {
   std::vector<std::shared_ptr<StoreObject>> out;
-  if (encodedSubs_ != nullptr) {
-    const objectmodel::SubIndex& index = Index();
-    out.reserve(index.count);
-    for (const auto& e : index) {
-      if (objectmodel::SubMatches(filter.get(), e.array, e.key)) {
-        out.push_back(Access::Share(index, e));
-      }
-    }
-    return out;
-  }
-  out.reserve(subs_.size());
-  for (const SubObjectEntry& e : subs_) {
-    if (filter == nullptr || filter->Matches(e.id)) out.push_back(e.object);
-  }
+  Access::ForEachSub(*this, [&](std::string_view array, std::string_view key, auto share) {
+    if (objectmodel::SubMatches(filter.get(), array, key)) out.push_back(share());
+    return false;
+  });
   return out;
 }
 
