@@ -44,10 +44,6 @@ bool SkipPayload(std::string_view* in) {
   return kind == kKindBytes && coding::GetLengthPrefixed(in, &bytes);
 }
 
-bool GetValue(std::string_view* in, Value* out) {
-  return coding::GetLengthPrefixed(in, &out->name) && GetPayload(in, out);
-}
-
 // A count of items that each take at least one byte: more than are left
 // means damage, and checking it keeps reserve() from exploding.
 bool GetCount(std::string_view* in, std::size_t* count) {
@@ -67,25 +63,14 @@ void SkipValues(std::string_view* in) {
   }
 }
 
-std::size_t ValueSize(std::string_view name, const std::string* bytes, std::int64_t integer) {
-  return coding::VarintLength(name.size()) + name.size() + 1 +
-         (bytes ? coding::VarintLength(bytes->size()) + bytes->size()
-                : coding::VarintLength(coding::ZigZag(integer)));
-}
-
-// Appends one value, written in place after one resize.
 void PutValue(std::string* out, std::string_view name, const std::string* bytes,
               std::int64_t integer) {
-  const std::size_t at = out->size();
-  out->resize(at + ValueSize(name, bytes, integer));
-  char* p = coding::EncodeVarint(&(*out)[at], name.size());
-  p = std::copy(name.begin(), name.end(), p);
+  coding::PutLengthPrefixed(out, name);
+  out->push_back(bytes != nullptr ? kKindBytes : kKindInteger);
   if (bytes != nullptr) {
-    *p++ = kKindBytes;
-    std::copy(bytes->begin(), bytes->end(), coding::EncodeVarint(p, bytes->size()));
+    coding::PutLengthPrefixed(out, *bytes);
   } else {
-    *p++ = kKindInteger;
-    coding::EncodeVarint(p, coding::ZigZag(integer));
+    coding::PutVarint(out, coding::ZigZag(integer));
   }
 }
 
@@ -122,7 +107,9 @@ std::vector<StoreValue> DecodeValues(std::string_view values) {
   if (values.empty() || !GetCount(&values, &count)) return out;
   out.reserve(count);
   Value value;
-  for (std::size_t i = 0; i < count && GetValue(&values, &value); ++i) {
+  for (std::size_t i = 0;
+       i < count && coding::GetLengthPrefixed(&values, &value.name) && GetPayload(&values, &value);
+       ++i) {
     StoreValue& v = out.emplace_back();
     v.name.assign(value.name);
     if (value.isInteger) {
