@@ -918,7 +918,7 @@ TEST_F(Karstctl, StatusNamesTheStoreAndWhyItIsInUse) {
   ASSERT_EQ(Run({"import", "-"}, kStored).status, 0);
   EXPECT_EQ(Ok({"status"}), "store: " + store_ +
                                 "\nchosen by: --store\nkind: sqlite\nformat: 3\n"
-                                "history: the last 10 versions, newest 1\npolicies: 3\n"
+                                "history: the last 10 versions kept, newest 1\npolicies: 3\n"
                                 "datastores: 2\n");
   const ToolResult env = RunTool({"status", "--output", "json"});
   EXPECT_EQ(env.status, 0) << env.err;

@@ -38,7 +38,11 @@ std::string Text(const Json& status) {
     std::string shown = value.is_string() ? value.get<std::string>() : value.dump();
     if (value.is_null()) shown = key == "history" ? "not kept" : "not recorded";
     if (key == "history" && value.is_object()) {
-      shown = "the last " + value["depth"].dump() + " versions, newest " + value["newest"].dump();
+      const std::string kept = value["depth"] == 0 ? "none kept"
+                               : value["depth"] == 1
+                                   ? "the last version kept"
+                                   : "the last " + value["depth"].dump() + " versions kept";
+      shown = kept + ", newest " + value["newest"].dump();
     }
     std::string label = key;
     for (char& c : label) c = c == '_' ? ' ' : c;
