@@ -233,5 +233,27 @@ std::vector<History::Table> History::TablesOf(std::uint64_t number,
   return out;
 }
 
+std::vector<ObjectPtr> History::Objects(std::uint64_t number, const ConfigStoreObjectId& filter) {
+  const char* what = "reading a version";
+  const std::string& instance = filter.InstanceId();
+  const std::vector<Table> tables = TablesOf(number, filter);
+  std::vector<ObjectPtr> out;
+  std::vector<sqlite3_int64> seqs;
+  objectmodel::Arena arena;
+  for (const Table& t : tables) {
+    // Prepared for this read alone: a kept table's name changes as versions
+    // come and go.
+    std::unique_ptr<sqlite3_stmt, int (*)(sqlite3_stmt*)> s(
+        conn_.Prepare("SELECT seq, instance, body FROM " + t.name +
+                          (instance.empty() ? " ORDER BY rowid" : " WHERE instance = ?1"),
+                      what),
+        sqlite3_finalize);
+    if (!instance.empty()) conn_.Bind(s.get(), 1, instance);
+    ReadObjects(conn_, s.get(), t.key, t.group, t.component, &out, &seqs, &arena, what);
+  }
+  if (tables.size() > 1) InWriteOrder(seqs, &out);
+  return out;
+}
+
 }  // namespace sqlite
 }  // namespace TavoConfigStore
