@@ -153,7 +153,17 @@ void History::ForgetUpTo(long long last) {
     while ((rc = sqlite3_step(s)) == SQLITE_ROW) unused.emplace_back(Connection::Column(s, 0));
     if (rc != SQLITE_DONE) conn_.Fail(what);
   }
-  for (const std::string& table : unused) conn_.Exec("DROP TABLE " + table, what);
+  for (const std::string& table : unused) {
+    // Emptied first, by a DELETE without a condition, which frees the pages
+    // in one step that cannot fail halfway. DROP TABLE also changes the
+    // schema, so SQLite would keep the original of every page it writes in
+    // a statement journal (a temporary file) to undo a failure halfway; and
+    // where SQLite is built to zero freed pages (secure_delete, as Debian
+    // builds it) that is every page of the table: 14.9 MiB written and read
+    // again per replace of 10,000 policies, a third of its writes.
+    conn_.Exec("DELETE FROM " + table, what);
+    conn_.Exec("DROP TABLE " + table, what);
+  }
 }
 
 std::vector<StoreVersion> History::Versions() {
