@@ -153,7 +153,17 @@ void History::ForgetUpTo(long long last) {
     while ((rc = sqlite3_step(s)) == SQLITE_ROW) unused.emplace_back(Connection::Column(s, 0));
     if (rc != SQLITE_DONE) conn_.Fail(what);
   }
-  for (const std::string& table : unused) conn_.Exec("DROP TABLE " + table, what);
+  for (const std::string& table : unused) {
+    // Emptied first, by a DELETE without a condition, which frees the pages
+    // in one step that cannot fail halfway. DROP TABLE also changes the
+    // schema, so SQLite would keep the original of every page it writes in
+    // a statement journal (a temporary file) to undo a failure halfway; and
+    // where SQLite is built to zero freed pages (secure_delete, as Debian
+    // builds it) that is every page of the table: 14.9 MiB written and read
+    // again per replace of 10,000 policies, a third of its writes.
+    conn_.Exec("DELETE FROM " + table, what);
+    conn_.Exec("DROP TABLE " + table, what);
+  }
 }
 
 std::vector<StoreVersion> History::Versions() {
@@ -230,6 +240,28 @@ std::vector<History::Table> History::TablesOf(std::uint64_t number,
                    std::string(Connection::Column(s, 2)), std::string(Connection::Column(s, 3))});
   }
   if (rc != SQLITE_DONE) conn_.Fail(what);
+  return out;
+}
+
+std::vector<ObjectPtr> History::Objects(std::uint64_t number, const ConfigStoreObjectId& filter) {
+  const char* what = "reading a version";
+  const std::string& instance = filter.InstanceId();
+  const std::vector<Table> tables = TablesOf(number, filter);
+  std::vector<ObjectPtr> out;
+  std::vector<sqlite3_int64> seqs;
+  objectmodel::Arena arena;
+  for (const Table& t : tables) {
+    // Prepared for this read alone: a kept table's name changes as versions
+    // come and go.
+    std::unique_ptr<sqlite3_stmt, int (*)(sqlite3_stmt*)> s(
+        conn_.Prepare("SELECT seq, instance, body FROM " + t.name +
+                          (instance.empty() ? " ORDER BY rowid" : " WHERE instance = ?1"),
+                      what),
+        sqlite3_finalize);
+    if (!instance.empty()) conn_.Bind(s.get(), 1, instance);
+    ReadObjects(conn_, s.get(), t.key, t.group, t.component, &out, &seqs, &arena, what);
+  }
+  if (tables.size() > 1) InWriteOrder(seqs, &out);
   return out;
 }
 

@@ -30,6 +30,7 @@
 #include "Connection.h"
 #include "TavoConfigStore/ConfigStoreObjectId.h"
 #include "TavoConfigStore/StoreHistory.h"
+#include "WriteOrder.h"
 
 namespace TavoConfigStore {
 namespace sqlite {
@@ -64,15 +65,18 @@ class History {
   void SetDepth(unsigned depth);
   std::uint64_t Newest();
 
-  // The table of each collection in version "number" that "filter" matches
-  // (an empty part matches any), in the order the collections were made.
-  // Throws kErrorNoSuchVersion for a version not kept.
+  // The objects of version "number" that "filter" matches (an empty part,
+  // the instance id included, matches any), in write order. Throws
+  // kErrorNoSuchVersion for a version not kept.
+  std::vector<ObjectPtr> Objects(std::uint64_t number, const ConfigStoreObjectId& filter);
+
+ private:
+  // The table of each collection in version "number" that "filter" matches,
+  // in the order the collections were made.
   struct Table {
     std::string key, group, component, name;
   };
   std::vector<Table> TablesOf(std::uint64_t number, const ConfigStoreObjectId& filter);
-
- private:
   // Forgets the versions up to "last", and drops the tables only they held.
   void ForgetUpTo(long long last);
 

@@ -2,11 +2,7 @@
 // instance id and its body (object/Format.h) in one BLOB. Schema.h has the
 // tables, which of them holds which collection, and the upgrades from formats
 // 1 and 2; History.h the versions the store keeps of itself; StoreFile.h how
-// the file is made and watched.
-//
-// Write order: every object written gets the next "seq" of the whole store,
-// so a rewritten object moves to the end and objects of several collections
-// list in the order they were written.
+// the file is made and watched; WriteOrder.h the order objects list in.
 //
 // Durability: WAL with synchronous=FULL, which fsyncs the log at every
 // commit. synchronous=NORMAL would already keep a committed transaction
@@ -28,7 +24,6 @@
 #include <algorithm>
 #include <chrono>
 #include <mutex>
-#include <numeric>
 #include <string>
 #include <thread>
 #include <vector>
@@ -42,14 +37,15 @@
 #include "Schema.h"
 #include "StoreFile.h"
 #include "TavoConfigStore/ConfigStore.h"
+#include "WriteOrder.h"
 
 namespace TavoConfigStore {
 namespace {
 
 using sqlite::Collections;
 using sqlite::Connection;
+using sqlite::ObjectPtr;
 using sqlite::Resetter;
-using ObjectPtr = std::shared_ptr<ConfigStoreObject>;
 
 // Pages of 16 KiB for new stores: an object with a few 256-byte blobs takes
 // well over 1 KiB, so a 4 KiB page holds only two or three of them and leaves
@@ -62,18 +58,6 @@ constexpr int kPageSize = 16384;
 // read of the shared-memory index, so a watcher costs next to nothing and
 // still answers within a twentieth of a second.
 constexpr std::chrono::milliseconds kChangePoll(50);
-
-// Objects of several collections, merged into write order by their seq.
-void InWriteOrder(const std::vector<sqlite3_int64>& seqs, std::vector<ObjectPtr>* objects) {
-  std::vector<std::size_t> order(seqs.size());
-  std::iota(order.begin(), order.end(), 0);
-  std::sort(order.begin(), order.end(),
-            [&seqs](std::size_t a, std::size_t b) { return seqs[a] < seqs[b]; });
-  std::vector<ObjectPtr> sorted;
-  sorted.reserve(order.size());
-  for (std::size_t i : order) sorted.push_back(std::move((*objects)[i]));
-  objects->swap(sorted);
-}
 
 class SqliteStore final : public Backend, public HistorySource {
  public:
@@ -104,7 +88,7 @@ class SqliteStore final : public Backend, public HistorySource {
     const int rc = sqlite3_step(s);
     if (rc == SQLITE_DONE) return nullptr;
     if (rc != SQLITE_ROW) conn_.Fail("reading an object");
-    return Decode(ConfigStoreObjectId(id), s, nullptr);
+    return sqlite::DecodeRow(conn_, ConfigStoreObjectId(id), s, nullptr);
   }
 
   void Set(const ConfigStoreObject& object) override {
@@ -122,7 +106,7 @@ class SqliteStore final : public Backend, public HistorySource {
       changed_ = true;
       sqlite3_stmt* s = collections_.Statement(c, Collections::kPut);
       Resetter reset(s);
-      if (sqlite3_bind_int64(s, 1, NextSeq()) != SQLITE_OK) conn_.Fail("binding a value");
+      if (sqlite3_bind_int64(s, 1, sequence_.Next()) != SQLITE_OK) conn_.Fail("binding a value");
       conn_.Bind(s, 2, object.Id().InstanceId());
       conn_.Bind(s, 3, body);
       if (sqlite3_step(s) != SQLITE_DONE) conn_.Fail("writing an object");
@@ -160,22 +144,15 @@ class SqliteStore final : public Backend, public HistorySource {
       const std::string& instance = filter.Id().InstanceId();
       const std::vector<Collections::Collection*> matching = collections_.Matching(filter.Id());
       std::vector<sqlite3_int64> seqs;
-      std::string id;  // keeps its capacity from one object to the next
       objectmodel::Arena arena;
       for (Collections::Collection* c : matching) {
         sqlite3_stmt* s = collections_.Statement(
             c, instance.empty() ? Collections::kList : Collections::kListOne);
-        Resetter reset(s);
         if (!instance.empty()) conn_.Bind(s, 1, instance);
-        int rc;
-        while ((rc = sqlite3_step(s)) == SQLITE_ROW) {
-          if (matching.size() > 1) seqs.push_back(sqlite3_column_int64(s, 0));
-          id.assign(Connection::Column(s, 1));
-          out.push_back(Decode(ConfigStoreObjectId(c->key, c->group, c->component, id), s, &arena));
-        }
-        if (rc != SQLITE_DONE) conn_.Fail("listing objects");
+        sqlite::ReadObjects(conn_, s, c->key, c->group, c->component, &out,
+                            matching.size() > 1 ? &seqs : nullptr, &arena, "listing objects");
       }
-      if (matching.size() > 1) InWriteOrder(seqs, &out);
+      if (matching.size() > 1) sqlite::InWriteOrder(seqs, &out);
     });
     return out;
   }
@@ -214,7 +191,7 @@ class SqliteStore final : public Backend, public HistorySource {
       levels_.Commit();
       return;
     }
-    FlushSequence();
+    sequence_.Flush();
     try {
       RecordVersion();
       conn_.Run("COMMIT", "committing");
@@ -224,7 +201,7 @@ class SqliteStore final : public Backend, public HistorySource {
       throw;
     }
     levels_.Commit();
-    seqLoaded_ = false;  // others may write before our next transaction
+    sequence_.Forget();
   }
 
   void AbortTransaction() override {
@@ -293,29 +270,8 @@ class SqliteStore final : public Backend, public HistorySource {
       throw ConfigStoreException(NotKeptMessage(Where(), number), kErrorNoSuchVersion);
     }
     std::vector<ObjectPtr> out;
-    InTransaction("BEGIN", "starting a read", "ending a read", [&] {
-      const std::string& instance = filter.Id().InstanceId();
-      const auto tables = history_.TablesOf(number, filter.Id());
-      std::vector<sqlite3_int64> seqs;
-      objectmodel::Arena arena;
-      for (const auto& t : tables) {
-        std::unique_ptr<sqlite3_stmt, int (*)(sqlite3_stmt*)> s(
-            conn_.Prepare("SELECT seq, instance, body FROM " + t.name +
-                              (instance.empty() ? " ORDER BY rowid" : " WHERE instance = ?1"),
-                          "reading a version"),
-            sqlite3_finalize);
-        if (!instance.empty()) conn_.Bind(s.get(), 1, instance);
-        int rc;
-        while ((rc = sqlite3_step(s.get())) == SQLITE_ROW) {
-          seqs.push_back(sqlite3_column_int64(s.get(), 0));
-          out.push_back(Decode(ConfigStoreObjectId(t.key, t.group, t.component,
-                                                   std::string(Connection::Column(s.get(), 1))),
-                               s.get(), &arena));
-        }
-        if (rc != SQLITE_DONE) conn_.Fail("reading a version");
-      }
-      if (tables.size() > 1) InWriteOrder(seqs, &out);
-    });
+    InTransaction("BEGIN", "starting a read", "ending a read",
+                  [&] { out = history_.Objects(number, filter.Id()); });
     return out;
   }
 
@@ -438,11 +394,11 @@ class SqliteStore final : public Backend, public HistorySource {
   void InTransaction(std::string_view begin, const char* starting, const char* ending,
                      Body&& body) {
     if (!conn_.Idle()) return body();
-    seqLoaded_ = seqDirty_ = false;  // counted in a transaction that is over
+    sequence_.Forget();  // counted in a transaction that is over
     conn_.Run(begin, starting);
     try {
       body();
-      FlushSequence();
+      sequence_.Flush();
       RecordVersion();
       conn_.Run("COMMIT", ending);
     } catch (...) {
@@ -450,7 +406,7 @@ class SqliteStore final : public Backend, public HistorySource {
       Forget();
       throw;
     }
-    seqLoaded_ = false;  // others may write before our next transaction
+    sequence_.Forget();
   }
 
   // Once SQLite has rolled the caller's transaction back by itself (full
@@ -477,7 +433,8 @@ class SqliteStore final : public Backend, public HistorySource {
   void Forget() {
     collections_.Forget();
     history_.Forget();
-    seqLoaded_ = seqDirty_ = changed_ = false;
+    sequence_.Forget();
+    changed_ = false;
   }
 
   // ---- History ------------------------------------------------------------
@@ -487,29 +444,6 @@ class SqliteStore final : public Backend, public HistorySource {
     if (!changed_) return;
     history_.Record();
     changed_ = false;
-  }
-
-  // ---- Write order --------------------------------------------------------
-
-  // The seq of the next object written: read once per write transaction,
-  // counted here and stored back before its commit.
-  sqlite3_int64 NextSeq() {
-    if (!seqLoaded_) {
-      nextSeq_ = conn_.Int("SELECT next FROM sequence", "reading the write sequence");
-      seqLoaded_ = true;
-    }
-    seqDirty_ = true;
-    return nextSeq_++;
-  }
-
-  void FlushSequence() {
-    if (!seqDirty_) return;
-    sqlite3_stmt* s = conn_.Cached("UPDATE sequence SET next = ?1", "storing the write sequence");
-    Resetter reset(s);
-    if (sqlite3_bind_int64(s, 1, nextSeq_) != SQLITE_OK || sqlite3_step(s) != SQLITE_DONE) {
-      conn_.Fail("storing the write sequence");
-    }
-    seqDirty_ = false;
   }
 
   // ---- Changes by others --------------------------------------------------
@@ -534,10 +468,6 @@ class SqliteStore final : public Backend, public HistorySource {
   // Moves only when another connection commits, not on this one's writes.
   sqlite3_int64 DataVersion() { return conn_.Int("PRAGMA data_version", "looking for changes"); }
 
-  ObjectPtr Decode(ConfigStoreObjectId id, sqlite3_stmt* s, objectmodel::Arena* arena) const {
-    return objectmodel::DecodeOrDamaged(std::move(id), Connection::Column(s, 2), arena, Where());
-  }
-
   // NOMUTEX turns off SQLite's own locking; this keeps a store that is shared
   // between threads anyway (SetGlobalStore) from corrupting the connection.
   std::mutex mu_;
@@ -546,13 +476,11 @@ class SqliteStore final : public Backend, public HistorySource {
   Collections collections_{conn_};
   SqliteStoreOptions options_;
   sqlite::History history_{conn_};
+  sqlite::WriteSequence sequence_{conn_};
   // Each level keeps whether the transaction had changed anything when the
   // level began, which an abort of the level brings back.
   TransactionLevels<bool> levels_;
-  bool changed_ = false;    // the open write changed something: a new version
-  bool seqLoaded_ = false;  // nextSeq_ was read within the open write
-  bool seqDirty_ = false;   // and has been used since
-  sqlite3_int64 nextSeq_ = 0;
+  bool changed_ = false;           // the open write changed something: a new version
   sqlite3_int64 seenVersion_ = 0;  // data_version when WaitForChange last looked
 };
 
