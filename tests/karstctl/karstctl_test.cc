@@ -398,6 +398,30 @@ TEST_F(Karstctl, HistoryExportAtAVersionAndRollback) {
   EXPECT_EQ(ReadFile(store_), before);
 }
 
+// On etcd as on a file: history, export and diff at a kept version, a
+// rollback that brings back its digests, and status naming the newest.
+TEST_F(Karstctl, HistoryDiffRollbackAndStatusOnEtcd) {
+  store_ = karst_test::SharedEtcdCluster().Locator("karstctl-history");
+  Ok({"import", "-"}, kCatalogue);
+  const std::string hash = Ok({"hash"});
+  Ok({"import", "-"}, R"({"policies": [{"name": "a"}, {"name": "b"}], "datastores": []})");
+
+  const Json history = Json::parse(Ok({"history"}));
+  ASSERT_EQ(history.size(), 2u);
+  EXPECT_EQ(history[1]["hash"], Json::parse(hash));
+  EXPECT_EQ(history[0]["policies"], 2);
+  EXPECT_EQ(Ok({"export", "--version", "1"}), kCatalogue);
+  EXPECT_EQ(Run({"diff", "--version", "1", "-"}, kCatalogue).status, 0);
+  EXPECT_EQ(Run({"diff", "-"}, kCatalogue).status, 1);
+
+  Ok({"rollback", "1"});
+  EXPECT_EQ(Ok({"hash"}), hash);
+  EXPECT_EQ(Ok({"export"}), kCatalogue);
+  EXPECT_THAT(Ok({"status"}), HasSubstr("history: the last 10 versions, newest 3\n"));
+  ExpectFailure(Run({"rollback", "99"}), 1, "version 99 is not kept (version not kept, 1020)");
+  EXPECT_EQ(Json::parse(Ok({"history"})).size(), 3u);
+}
+
 // Store failures exit 1 in the store's words with the code's name; a read
 // where there is no store says just that and creates nothing.
 TEST_F(Karstctl, StoreErrorsExitOneInWordsAndBadInputIsFoundFirst) {

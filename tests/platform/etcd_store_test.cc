@@ -29,6 +29,7 @@
 #include "StoreObjects.h"
 #include "TavoConfigStore/ConfigStore.h"
 #include "TavoConfigStore/EtcdStore.h"
+#include "TavoConfigStore/StoreHistory.h"
 #include "TavoKarst/KarstLib.h"
 
 namespace TavoConfigStore {
@@ -109,7 +110,8 @@ TEST(EtcdStoreTest, LargeReplacesAreAllOrNothingForReaders) {
   reader.join();
   EXPECT_EQ(torn, 0) << "of " << listings << " listings";
   EXPECT_EQ(TavoKarst::KarstLib::ListPolicyInfo(), Catalogue(10000, 4));
-  EXPECT_EQ(RawKeys(etcd, "large", "r/").size(), 1u);  // one live generation
+  // One generation for each of the four versions kept.
+  EXPECT_EQ(RawKeys(etcd, "large", "r/").size(), 4u);
   EXPECT_THAT(RawKeys(etcd, "large", "w/"), ::testing::IsEmpty());
   SetGlobalStore(nullptr);
 }
@@ -196,6 +198,29 @@ TEST(EtcdStoreTest, RacingWritersConflictOnlyWhenWhatTheyReadChanged) {
   Set(*other, Valued("c", "other"));  // lands between, and is replaced
   mine->CommitTransaction();
   EXPECT_EQ(ValuesOf(*other), std::vector<std::string>{"b=mine"});
+
+  // Every commit is a version, so a commit to another collection that lands
+  // between a commit's read and its switch moves the history on under it;
+  // the collections it writes are unchanged, so it goes through, written
+  // into new generations (versions kept) or in place (none kept).
+  for (const unsigned depth : {10u, 0u}) {
+    SetHistoryDepth(*mine, depth);
+    const std::uint64_t newest = NewestVersion(*mine);
+    std::thread racer([&] {
+      for (int i = 0; i < 20; ++i) Set(*other, Valued("x", std::to_string(i), "k2"));
+    });
+    for (int i = 0; i < 20; ++i) {
+      mine->BeginTransaction();
+      ValuesOf(*mine, Filter("k"));
+      Set(*mine, Valued("b", std::to_string(i)));
+      EXPECT_NO_THROW(mine->CommitTransaction()) << "depth " << depth;
+      mine->AbortTransaction();  // after a failed commit; nothing after a good one
+    }
+    racer.join();
+    EXPECT_EQ(NewestVersion(*other), newest + 40);
+    EXPECT_EQ(ValuesOf(*other, Filter("k")), std::vector<std::string>{"b=19"});
+    EXPECT_EQ(ValuesOf(*other, Filter("k2")), std::vector<std::string>{"x=19"});
+  }
 }
 
 // "instance=value" of each object of collection "k", or "instance!why" for
@@ -370,6 +395,7 @@ TEST(EtcdStoreTest, ADeadWritersGenerationGoesWithItsLeaseAndAWriterKeepsOne) {
   };
   for (const std::string& id : leases()) etcd.Etcdctl({"lease", "revoke", id});
   auto store = OpenStore(etcd.Locator("dead"));
+  SetHistoryDepth(*store, 1);  // no generation but the current one kept
   Set(*store, Valued("kept", "old"));
   // What a writer leaves when it dies after its first batch.
   const EtcdKeys raw(etcd.Endpoint(0));

@@ -18,7 +18,7 @@ HistorySource& SourceOf(ConfigStore& store) {
   auto* source = dynamic_cast<HistorySource*>(&store);
   if (source == nullptr) {
     throw ConfigStoreException(
-        "configuration store: this kind of store keeps no history (a SQLite store does)",
+        "configuration store: this kind of store keeps no history (SQLite and etcd stores do)",
         kErrorNoHistory);
   }
   return *source;

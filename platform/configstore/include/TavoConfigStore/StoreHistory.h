@@ -18,8 +18,8 @@ namespace TavoConfigStore {
 // "depth" versions (the current state is the newest of them) and forgets
 // older ones as new ones come; depth 0 keeps none.
 //
-// Only stores returned by NewSqliteStore and OpenStore (for a path) keep a
-// history. Every function below throws ConfigStoreException with
+// Only stores returned by NewSqliteStore, NewEtcdStore and OpenStore (for a
+// path or an etcd locator) keep a history. Every function below throws ConfigStoreException with
 // kErrorNoHistory for any other store, kErrorNoSuchVersion for a version the
 // store does not keep (any longer), or the store's own error.
 

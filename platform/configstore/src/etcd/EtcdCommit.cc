@@ -2,11 +2,11 @@
 
 #include <algorithm>
 #include <cstdio>
-#include <deque>
-#include <future>
 #include <mutex>
 #include <random>
 #include <utility>
+
+#include "EtcdTxn.h"
 
 namespace TavoConfigStore {
 namespace {
@@ -19,6 +19,10 @@ using etcdserverpb::TxnRequest;
 
 constexpr std::int64_t kLeaseSeconds = 60;
 constexpr int kCommitAttempts = 5;
+// Every commit rewrites the history's head, so a switch also loses to
+// commits that changed only other collections; it is then sent again on
+// the new state, at most this many times.
+constexpr int kSwitchAttempts = 50;
 
 std::string NewId() {
   static std::mutex mu;
@@ -29,30 +33,25 @@ std::string NewId() {
   return text;
 }
 
-void AddPut(TxnRequest* txn, std::string key, std::string value, std::int64_t lease = 0) {
-  auto* put = txn->add_success()->mutable_request_put();
-  put->set_key(std::move(key));
-  put->set_value(std::move(value));
-  put->set_lease(lease);
-}
-
-void AddDelete(TxnRequest* txn, std::string key, std::string rangeEnd = {}) {
-  auto* del = txn->add_success()->mutable_request_delete_range();
-  del->set_key(std::move(key));
-  del->set_range_end(std::move(rangeEnd));
-}
-
-void AddDeletePrefix(TxnRequest* txn, const std::string& prefix) {
-  AddDelete(txn, prefix, etcdlayout::PrefixEnd(prefix));
-}
-
 // The collection's pointer is as "current" has it (absent when it is null).
 void AddCompareVersion(TxnRequest* txn, const std::string& pointer, const Current* current) {
-  Compare* compare = txn->add_compare();
-  compare->set_key(pointer);
-  compare->set_result(Compare::EQUAL);
-  compare->set_target(current ? Compare::MOD : Compare::VERSION);
-  if (current) compare->set_mod_revision(current->version);
+  AddCompareRevision(txn, pointer, current ? current->version : 0);
+}
+
+Generations GenerationsOf(const Pointers& pointers) {
+  Generations gens;
+  for (const auto& [name, current] : pointers.byCollection) gens.emplace(name, current.gen);
+  return gens;
+}
+
+// Records the catalogue after a switch as the next version: "after" is each
+// collection's generation then, "dropped" the generations the switch stops
+// pointing at, deleted unless a kept version names them.
+void AddVersion(TxnRequest* txn, const Keys& keys, const HistoryState& history,
+                const Generations& after, std::set<std::string> dropped) {
+  const VersionRecord record = NewVersion(history.newest + 1, after);
+  AddHistoryChange(txn, keys, history, record.about.number, history.depth, &record, after,
+                   std::move(dropped));
 }
 
 // The writer of generation "gen" is alive: its lease has not run out, and
@@ -80,92 +79,6 @@ const Pending& PendingFor(const PendingCollections& pending, const std::string& 
   return it == pending.end() ? kUntouched : it->second;
 }
 
-// Writes operations in transactions of at most kBatchOps and kBatchBytes.
-// The first batch (which registers a new generation) is written alone; after
-// it up to kInFlight are on their way at once while the next is built. Their
-// order does not matter (no reader looks at a generation before the switch,
-// and deletions of what nothing points at can go in any order), and etcd
-// syncs batches that arrive together to disk together.
-class Batches {
- public:
-  static constexpr std::size_t kInFlight = 4;
-
-  explicit Batches(EtcdClient& client) : client_(client) {}
-  // Waits for every batch still on its way: what is abandoned after a
-  // failure must not be written afterwards by a batch of its own.
-  ~Batches() {
-    for (std::future<void>& batch : inFlight_) batch.wait();
-  }
-  Batches(const Batches&) = delete;
-  Batches& operator=(const Batches&) = delete;
-
-  // A put that takes about "size" bytes of a request.
-  void Put(std::string key, std::string value, std::size_t size, std::int64_t lease = 0) {
-    if (bytes_ + size > etcdlayout::kBatchBytes) Send();
-    AddPut(&txn_, std::move(key), std::move(value), lease);
-    Added(size);
-  }
-  void Delete(std::string key, std::string rangeEnd = {}) {
-    AddDelete(&txn_, std::move(key), std::move(rangeEnd));
-    Added(0);
-  }
-
-  // Sends what is left and waits for every batch; throws the first failure.
-  void Finish() {
-    Send();
-    while (!inFlight_.empty()) Collect();
-  }
-
- private:
-  void Added(std::size_t size) {
-    bytes_ += size;
-    if (static_cast<std::size_t>(txn_.success_size()) >= etcdlayout::kBatchOps ||
-        bytes_ >= etcdlayout::kBatchBytes) {
-      Send();
-    }
-  }
-
-  void Send() {
-    if (txn_.success_size() == 0) return;
-    TxnRequest txn = std::exchange(txn_, TxnRequest());
-    bytes_ = 0;
-    if (!started_) {
-      started_ = true;
-      client_.Txn(txn);
-      return;
-    }
-    if (inFlight_.size() >= kInFlight) Collect();
-    inFlight_.push_back(
-        std::async(std::launch::async, [this, txn = std::move(txn)] { client_.Txn(txn); }));
-  }
-
-  void Collect() {
-    std::future<void> oldest = std::move(inFlight_.front());
-    inFlight_.pop_front();
-    oldest.get();
-  }
-
-  EtcdClient& client_;
-  TxnRequest txn_;
-  std::size_t bytes_ = 0;
-  bool started_ = false;
-  std::deque<std::future<void>> inFlight_;
-};
-
-void WriteObject(const Keys& keys, const std::string& gen, const std::string& instance,
-                 Header header, std::string_view body, Batches* batches) {
-  const std::string object = keys.Object(gen, instance);
-  header.parts =
-      std::max<std::size_t>(1, (body.size() + etcdlayout::kPartBytes - 1) / etcdlayout::kPartBytes);
-  for (std::size_t part = 0; part < header.parts; ++part) {
-    const std::string_view piece =
-        body.substr(part * etcdlayout::kPartBytes, etcdlayout::kPartBytes);
-    batches->Put(object + Keys::PartSuffix(part),
-                 part == 0 ? etcdlayout::FirstPart(header, piece) : std::string(piece),
-                 piece.size() + object.size() + 32);
-  }
-}
-
 }  // namespace
 
 void EtcdCommit::Conflict(const std::string& collection) const {
@@ -182,26 +95,40 @@ void EtcdCommit::Apply(const PendingCollections& pending, const ObservedVersions
     if (changes.Touched()) changed.push_back(name);
   }
   if (changed.empty()) return;
-  for (int attempt = 1;; ++attempt) {
-    // The pointers, and the generations a dead writer left, in one read. A
-    // catalogue an earlier version wrote moves under the store's own root
-    // with the first write, every collection of it in this commit's switch.
+  Pointers lostTo;  // as read before the last attempt, which lost its switch
+  int lost = 0;
+  int passed = 0;
+  for (bool retry = false;; retry = true) {
+    // The pointers, the history, and the generations a dead writer left, in
+    // one read. A catalogue an earlier version wrote moves under the
+    // store's own root with the first write, every collection of it in
+    // this commit's switch.
     const Pointers base = reader_.ReadPointers(std::string(), true);
     const bool move = base.keys != &reader_.OwnKeys();
     bool readAny = false;
+    bool overtaken = false;  // another writer changed a collection this one writes
     Touched touched;
     for (const std::string& name : changed) {
       const Current* current = base.Find(name);
+      const std::int64_t version = current ? current->version : 0;
       auto seen = observed.find(name);
       if (seen != observed.end()) {
         readAny = true;
-        if (seen->second != (current ? current->version : 0)) Conflict(name);
+        if (seen->second != version) Conflict(name);
       }
+      const Current* before = lostTo.Find(name);
+      overtaken = overtaken || version != (before ? before->version : 0);
       // Clearing or deleting from a collection that does not exist
       // changes nothing.
       if (current || !pending.at(name).puts.empty()) touched.push_back(name);
     }
     if (touched.empty()) return;
+    // Only a transaction that read none of what it writes can simply be
+    // applied to what another writer made of it; one that lost only to
+    // writers of other collections is sent again as it is.
+    if (retry && (overtaken ? readAny || ++lost == kCommitAttempts : ++passed == kSwitchAttempts)) {
+      Conflict(touched.front());
+    }
     if (move) {
       for (const auto& entry : base.byCollection) touched.push_back(entry.first);
       std::sort(touched.begin(), touched.end());
@@ -213,9 +140,7 @@ void EtcdCommit::Apply(const PendingCollections& pending, const ObservedVersions
             : CommitGenerations(pending, touched, base, token)) {
       return;
     }
-    // Another writer got in between: only a transaction that read none of
-    // what it writes can simply be applied to what is there now.
-    if (readAny || attempt == kCommitAttempts) Conflict(touched.front());
+    lostTo = base;
   }
 }
 
@@ -225,8 +150,11 @@ bool EtcdCommit::FitsInPlace(const PendingCollections& pending, const Touched& t
   std::size_t bytes = 0;
   for (const std::string& name : touched) {
     const Pending& changes = pending.at(name);
-    const bool exists = now.Find(name) != nullptr;
-    if (changes.cleared && exists) return false;
+    const Current* current = now.Find(name);
+    const bool exists = current != nullptr;
+    // A generation a kept version names is never changed: such a
+    // collection gets a new one.
+    if (exists && (changes.cleared || now.history.Names(current->gen))) return false;
     ops += 2 + (exists ? 0 : 2) + changes.deleted.size() + changes.puts.size() * 2;
     for (const auto& [key, put] : changes.puts) {
       if (put.body.size() > etcdlayout::kPartBytes) return false;
@@ -240,11 +168,13 @@ bool EtcdCommit::CommitInPlace(const PendingCollections& pending, const Touched&
                                const Pointers& now, const std::string& token) {
   const Keys& keys = reader_.OwnKeys();
   TxnRequest txn;
+  Generations after = GenerationsOf(now);
   for (const std::string& name : touched) {
     const Pending& changes = pending.at(name);
     const Current* current = now.Find(name);
     AddCompareVersion(&txn, keys.Pointer(name), current);
     const std::string gen = current ? current->gen : NewId();
+    after[name] = gen;
     AddPut(&txn, keys.Pointer(name), etcdlayout::PointerValue(gen, token));
     if (!current) {
       AddPut(&txn, keys.Generation(gen), name);
@@ -265,6 +195,7 @@ bool EtcdCommit::CommitInPlace(const PendingCollections& pending, const Touched&
       if (current) AddDelete(&txn, object + Keys::PartSuffix(1), etcdlayout::PrefixEnd(object));
     }
   }
+  AddVersion(&txn, keys, now.history, after, {});
   return Switch(txn, touched.front(), token);
 }
 
@@ -330,35 +261,65 @@ bool EtcdCommit::CommitGenerations(const PendingCollections& pending, const Touc
     throw;
   }
 
-  TxnRequest txn;
+  // The switch, on the state "now": the same as "base" for the collections
+  // it writes, which their compares hold to.
   std::string anyWritten;
-  for (const std::string& name : touched) {
-    const Current* current = base.Find(name);
-    const std::string& gen = fresh[name];
-    AddCompareVersion(&txn, base.keys->Pointer(name), current);
-    if (move) AddCompareVersion(&txn, keys.Pointer(name), nullptr);
-    AddWriterAlive(&txn, keys, gen);
-    if (empty[name]) {
-      AddDelete(&txn, keys.Pointer(name));
-      AddDeletePrefix(&txn, keys.Generation(gen));
-      AddDelete(&txn, keys.Registered() + gen);
-    } else {
-      AddPut(&txn, keys.Pointer(name), etcdlayout::PointerValue(gen, token));
-      AddPut(&txn, keys.Generation(gen), name);
-      anyWritten = name;
+  const auto switchOn = [&](const Pointers& now) {
+    TxnRequest txn;
+    Generations after = move ? Generations() : GenerationsOf(now);
+    std::set<std::string> dropped;
+    for (const std::string& name : touched) {
+      const Current* current = base.Find(name);
+      const std::string& gen = fresh[name];
+      AddCompareVersion(&txn, base.keys->Pointer(name), current);
+      if (move) AddCompareVersion(&txn, keys.Pointer(name), nullptr);
+      AddWriterAlive(&txn, keys, gen);
+      if (empty[name]) {
+        AddDelete(&txn, keys.Pointer(name));
+        AddDeletePrefix(&txn, keys.Generation(gen));
+        AddDelete(&txn, keys.Registered() + gen);
+        after.erase(name);
+      } else {
+        AddPut(&txn, keys.Pointer(name), etcdlayout::PointerValue(gen, token));
+        AddPut(&txn, keys.Generation(gen), name);
+        anyWritten = name;
+        after[name] = gen;
+      }
+      if (move) {
+        // Its generations go after the switch, key by key (RemoveLegacy).
+        AddDelete(&txn, base.keys->Pointer(name));
+      } else if (current) {
+        dropped.insert(current->gen);
+      }
+      AddDelete(&txn, keys.Writers() + gen);
     }
-    if (move) {
-      // Its generations go after the switch, key by key (RemoveLegacy).
-      AddDelete(&txn, base.keys->Pointer(name));
-    } else if (current) {
-      AddDeletePrefix(&txn, keys.Generation(current->gen));
-      AddDelete(&txn, keys.Registered() + current->gen);
+    AddVersion(&txn, keys, now.history, after, std::move(dropped));
+    return txn;
+  };
+  Pointers now = base;
+  for (int attempt = 1; !Switch(switchOn(now), anyWritten, token, lease); ++attempt) {
+    // Another writer got in first. When it left the collections this
+    // commit writes alone, the generations written stand, and only the
+    // switch is sent again, on the new state.
+    Pointers again;
+    bool unchanged = !move && attempt < kSwitchAttempts;
+    try {
+      if (unchanged) again = reader_.ReadPointers(std::string(), true);
+    } catch (const ConfigStoreException&) {
+      unchanged = false;
     }
-    AddDelete(&txn, keys.Writers() + gen);
-  }
-  if (!Switch(txn, anyWritten, token, lease)) {
-    // Another writer got in first, unless an earlier copy of the switch
-    // takes effect late: once the lease is gone, the pointer tells.
+    for (const std::string& name : touched) {
+      if (!unchanged) break;
+      const Current* was = base.Find(name);
+      const Current* is = again.Find(name);
+      unchanged = (was ? was->version : 0) == (is ? is->version : 0);
+    }
+    if (unchanged) {
+      now = std::move(again);
+      continue;
+    }
+    // Unless an earlier copy of the switch takes effect late: once the
+    // lease is gone, the pointer tells.
     GiveUp(lease);
     return Holds(anyWritten, token);
   }
@@ -367,7 +328,7 @@ bool EtcdCommit::CommitGenerations(const PendingCollections& pending, const Touc
   lease_ = lease;
   if (move) reader_.Moved();
   try {
-    RemoveOrphans(base.orphans);
+    RemoveOrphans(now.orphans);
     if (move) RemoveLegacy(base);
   } catch (const ConfigStoreException&) {
     // Tidying only: the commit stands, and a later writer tidies up.

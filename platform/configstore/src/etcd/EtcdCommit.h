@@ -13,6 +13,9 @@
 // depend on what it read. A transaction that only wrote a collection (a
 // replace: clear, then write) is applied again to the new state instead,
 // since its outcome does not depend on what was there.
+// Either way the commit records the catalogue after it as a new version
+// (EtcdVersions.h); a switch that lost only to a commit of other
+// collections is sent again on the new state.
 
 #ifndef TAVOCONFIGSTORE_SRC_ETCD_ETCD_COMMIT_H_
 #define TAVOCONFIGSTORE_SRC_ETCD_ETCD_COMMIT_H_

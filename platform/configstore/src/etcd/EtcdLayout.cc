@@ -120,6 +120,12 @@ std::string Keys::PartSuffix(std::size_t part) {
   return text;
 }
 
+std::string Keys::Version(std::uint64_t number) const {
+  char text[17];
+  std::snprintf(text, sizeof text, "%016llx", static_cast<unsigned long long>(number));
+  return Versions() + text;
+}
+
 std::string PrefixEnd(std::string prefix) {
   while (!prefix.empty()) {
     if (static_cast<unsigned char>(prefix.back()) != 0xff) {

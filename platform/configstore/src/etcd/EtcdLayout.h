@@ -13,6 +13,10 @@
 //                            larger than one etcd request may carry
 //   r/<gen>                  every generation that has objects, current or not
 //   w/<gen>                  a generation being written, on its writer's lease
+//   h/head                   the history's head: the newest version's number
+//                            and how many versions to keep (EtcdVersions.h)
+//   h/v/<number>             one kept version: who made it, when, and each
+//                            collection's generation then
 //
 // <collection> is key \0 group \0 component and <instance> the instance id,
 // each escaped so that it holds no \0 (\0 -> \1\1, \1 -> \1\2): keys then
@@ -103,6 +107,11 @@ class Keys {
   static std::string PartSuffix(std::size_t part);
   std::string Registered() const { return root_ + "r/"; }
   std::string Writers() const { return root_ + "w/"; }
+  std::string History() const { return root_ + "h/"; }
+  std::string HistoryHead() const { return History() + "head"; }
+  std::string Versions() const { return History() + "v/"; }
+  // Sixteen hexadecimal digits, so that the keys sort as the numbers do.
+  std::string Version(std::uint64_t number) const;
   // What a key of "area" (Pointers(), Registered(), Writers()) names.
   static std::string_view NameIn(const std::string& area, std::string_view key) {
     return key.substr(area.size());

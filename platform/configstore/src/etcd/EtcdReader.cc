@@ -134,6 +134,7 @@ Pointers EtcdReader::ReadPointers(const std::string& collection, bool orphans) {
            legacy || collection.empty());
   if (legacy) AddRange(&txn, legacyKeys_.Pointers(), true);
   if (orphans) {
+    AddRange(&txn, keys_.History(), true);
     AddRange(&txn, keys_.Registered(), true)->set_keys_only(true);
     AddRange(&txn, keys_.Writers(), true)->set_keys_only(true);
   }
@@ -156,6 +157,10 @@ Pointers EtcdReader::ReadPointers(const std::string& collection, bool orphans) {
       live.insert(Keys::NameIn(writers, kv.key));
     }
     for (const auto& [name, current] : pointers.byCollection) live.insert(current.gen);
+    pointers.history = ParseHistory(keys_, reply.ranges[reply.ranges.size() - 3]);
+    for (const auto& [number, kept] : pointers.history.kept) {
+      for (const auto& entry : kept.gens) live.insert(entry.second);
+    }
     for (const etcdwire::KeyValue& kv : reply.ranges[reply.ranges.size() - 2].kvs) {
       const std::string_view gen = Keys::NameIn(registered, kv.key);
       if (!live.count(gen)) pointers.orphans.emplace_back(gen);
@@ -173,7 +178,10 @@ Pointers EtcdReader::ReadPointers(const std::string& collection, bool orphans) {
   });
   const bool moved = !pointers.byCollection.empty() || old.byCollection.empty();
   layout_ = moved ? Layout::kCurrent : Layout::kLegacy;
-  if (!moved) old.orphans = std::move(pointers.orphans);
+  if (!moved) {
+    old.orphans = std::move(pointers.orphans);
+    old.history = std::move(pointers.history);
+  }
   Pointers& visible = moved ? pointers : old;
   if (!collection.empty()) {
     KeepOnly(&visible, [&](const auto& entry) { return entry.first == collection; });

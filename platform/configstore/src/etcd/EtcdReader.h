@@ -32,6 +32,7 @@
 #include "EtcdLayout.h"
 #include "EtcdListing.h"
 #include "EtcdListingCache.h"
+#include "EtcdVersions.h"
 #include "EtcdWire.h"
 
 namespace TavoConfigStore {
@@ -52,8 +53,11 @@ struct Pointers {
   const etcdlayout::Keys* keys = nullptr;
   // When asked for: generations under the store's own root whose writer
   // died before making them current (registered, no live writer, no
-  // pointer). Nothing can make such a generation current any more.
+  // pointer, no kept version naming them). Nothing can make such a
+  // generation current any more.
   std::vector<std::string> orphans;
+  // With the orphans: the history, from the same read.
+  HistoryState history;
 
   const Current* Find(const std::string& collection) const {
     auto it = byCollection.find(collection);
@@ -70,8 +74,8 @@ class EtcdReader {
   const etcdlayout::Keys& OwnKeys() const { return keys_; }
 
   // The pointer of "collection", or of every collection when it is "", as
-  // readers see them; with "orphans", also the generations a dead writer
-  // left under the store's own root.
+  // readers see them; with "orphans", also the history and the generations
+  // a dead writer left under the store's own root.
   Pointers ReadPointers(const std::string& collection, bool orphans = false);
   // The pointer of one collection and, when it has one, the objects of its
   // generation (or its one object "instance"), at one revision, in

@@ -17,10 +17,12 @@
 #include <vector>
 
 #include "../Backend.h"
+#include "../HistorySource.h"
 #include "../TransactionLevels.h"
 #include "../object/Objects.h"
 #include "EtcdClient.h"
 #include "EtcdCommit.h"
+#include "EtcdHistory.h"
 #include "EtcdLayout.h"
 #include "EtcdListingCache.h"
 #include "EtcdReader.h"
@@ -53,12 +55,13 @@ std::shared_ptr<ConfigStoreObject> DecodePut(const ConfigStoreObjectId& id, cons
   return objectmodel::DecodeObject(id, put.body, nullptr);
 }
 
-class EtcdStore final : public Backend {
+class EtcdStore final : public Backend, public HistorySource {
  public:
   explicit EtcdStore(const EtcdStoreOptions& options)
       : client_(options),
         reader_(client_, options.prefix, ListingCache::For(options)),
-        commit_(client_, reader_) {}
+        commit_(client_, reader_),
+        history_(client_, reader_) {}
 
   ~EtcdStore() override { feed_.reset(); }
 
@@ -169,7 +172,34 @@ class EtcdStore final : public Backend {
     return feed_->Wait(timeoutMs);
   }
 
+  std::string HistoryWhere() const override { return client_.Where(); }
+  std::vector<StoreVersion> Versions() override {
+    return OnHistory([&] { return history_.Versions(); });
+  }
+  unsigned Depth() override {
+    return OnHistory([&] { return history_.Depth(); });
+  }
+  void SetDepth(unsigned depth) override {
+    OnHistory([&] { history_.SetDepth(depth); });
+  }
+  std::uint64_t Newest() override {
+    return OnHistory([&] { return history_.Newest(); });
+  }
+  std::vector<std::shared_ptr<ConfigStoreObject>> ListVersion(
+      std::uint64_t number, const FilterSpecObject& filter) override {
+    return OnHistory([&] { return history_.ListVersion(number, filter); });
+  }
+
  private:
+  // Inside an open transaction, its requests' wait is the transaction's.
+  template <typename Read>
+  auto OnHistory(const Read& read) -> decltype(read()) {
+    std::lock_guard<std::mutex> lock(mu_);
+    std::optional<EtcdClient::Call> call;
+    if (!levels_.Open()) call.emplace(client_);
+    return read();
+  }
+
   // An object of "listing", kept by it when the store keeps the listing,
   // else copied into "arena" (null: memory of its own).
   std::shared_ptr<ConfigStoreObject> Decode(const ConfigStoreObjectId& collection,
@@ -289,6 +319,7 @@ class EtcdStore final : public Backend {
   EtcdClient client_;
   EtcdReader reader_;
   EtcdCommit commit_;
+  EtcdHistory history_;
   TransactionLevels<TxnState> levels_;
   TxnState txn_;
   ObservedVersions observed_;
