@@ -417,7 +417,7 @@ TEST_F(Karstctl, HistoryDiffRollbackAndStatusOnEtcd) {
   Ok({"rollback", "1"});
   EXPECT_EQ(Ok({"hash"}), hash);
   EXPECT_EQ(Ok({"export"}), kCatalogue);
-  EXPECT_THAT(Ok({"status"}), HasSubstr("history: the last 10 versions, newest 3\n"));
+  EXPECT_THAT(Ok({"status"}), HasSubstr("history: the last 10 versions kept, newest 3\n"));
   ExpectFailure(Run({"rollback", "99"}), 1, "version 99 is not kept (version not kept, 1020)");
   EXPECT_EQ(Json::parse(Ok({"history"})).size(), 3u);
 }
