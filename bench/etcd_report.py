@@ -1,6 +1,7 @@
 #!/usr/bin/env python3
 """Turns etcd_store_bench's JSON output into a table of the library on the
-etcd store against raw etcd, each row a ratio with its target.
+etcd store against raw etcd, each row a ratio with its target, and one of
+the store's replace keeping 10 versions against keeping none.
 
 Each figure is the median over all repetitions found, pooled over the files
 given (several runs of bench/run --etcd), with the lowest and highest
@@ -30,6 +31,12 @@ STORE_OPERATIONS = (
     ("GetDbHash", "BM_StoreGetDbHash", "BM_RawListBoth", "two Ranges"),
 )
 STORE_SIZES = (1000, 10000)
+# The store keeping its last 10 versions against keeping none: (operation,
+# benchmark with history, benchmark without).
+HISTORY_TARGET = 1.10
+HISTORY_OPERATIONS = (
+    ("replace: K = 10 / K = 0", "BM_StoreReplace", "BM_StoreReplaceNoHistory"),
+)
 
 
 def load(paths):
@@ -100,6 +107,28 @@ def store_table(runs):
     return headers, rows, notes
 
 
+def history_table(runs):
+    """Rows of the store keeping versions against keeping none."""
+    headers = ("operation", "N", "K = 10 ms: median (min-max)", "K = 0 ms: median (min-max)",
+               "ratio", "etcd CPU ms K = 10 / K = 0", f"target <= {HISTORY_TARGET}x")
+    rows = []
+    for what, kept, none in HISTORY_OPERATIONS:
+        for n in STORE_SIZES:
+            with_history = values(runs, f"{kept}/{n}", "real_time")
+            without = values(runs, f"{none}/{n}", "real_time")
+            if not with_history or not without:
+                continue
+            d = digits_for(without)
+            mk, kept_text = spread(with_history, d)
+            mn, none_text = spread(without, d)
+            etcd = [values(runs, f"{x}/{n}", "etcd_cpu_ms") for x in (kept, none)]
+            etcd_text = (f"{statistics.median(etcd[0]):.{d}f} / {statistics.median(etcd[1]):.{d}f}"
+                         if etcd[0] and etcd[1] else "")
+            rows.append((what, f"{n:,}", kept_text, none_text, f"{mk / mn:.2f}", etcd_text,
+                         "MET" if mk / mn <= HISTORY_TARGET else "MISSED"))
+    return headers, rows, []
+
+
 def main():
     args = sys.argv[1:]
     markdown = bool(args) and args[-1] == "markdown"
@@ -108,6 +137,10 @@ def main():
     context, runs = load(args)
     headers, rows, notes = store_table(runs)
     print_table(headers, rows, notes, context, ("etcd", "grpc", "num_cpus", "load_avg"), markdown)
+    headers, rows, notes = history_table(runs)
+    if rows:
+        print()
+        print_table(headers, rows, notes, context, (), markdown)
 
 
 if __name__ == "__main__":

@@ -23,6 +23,8 @@
 
 #include "BenchData.h"
 #include "EtcdBench.h"
+#include "TavoConfigStore/ConfigStore.h"
+#include "TavoConfigStore/StoreHistory.h"
 #include "TavoKarst/KarstLib.h"
 #include "frame/FixedNames.h"
 
@@ -42,10 +44,12 @@ std::string Root(const char* kind, std::size_t n) {
   return "/" + std::string(kind) + "-" + std::to_string(n) + "/" + std::string(1, '\0');
 }
 
-// Makes the library's default store the etcd store with the root's prefix.
-void UseEtcdStore(const std::string& root) {
+// Makes the library's default store the etcd store with the root's prefix;
+// returns its locator.
+std::string UseEtcdStore(const std::string& root) {
   const std::string locator = "etcd://" + EtcdEndpoint() + root.substr(0, root.size() - 2);
   setenv("TAVO_CONFIGSTORE_PATH", locator.c_str(), 1);
+  return locator;
 }
 
 Records Rerooted(const Records& records, const std::string& from, const std::string& to) {
@@ -163,13 +167,22 @@ std::string DefaultBlobOf(const TavoKarst::KarstDatastoreInfo& datastore, std::s
 // the same N in one transaction. The raw side puts the keys and values the
 // store wrote for them, in transactions of up to 100 puts, over themselves.
 
-void BM_StoreReplace(benchmark::State& state) {
+// The store keeps its last "depth" versions (10 unless set); each replace
+// then keeps the generation it replaces instead of deleting it, and deletes
+// the one the version it pushes out named.
+void StoreReplace(benchmark::State& state, const char* kind, unsigned depth) {
   Guarded(state, [&] {
     const auto& policies = Policies(N(state));
-    const std::string root = Root("kb-add--", N(state));
+    const std::string root = Root(kind, N(state));
     EtcdAdmin().DeletePrefix(root);
-    UseEtcdStore(root);
-    KarstLib::AddPolicyInfo(policies);
+    // Kept in the store: any connection to it sets it.
+    TavoConfigStore::SetHistoryDepth(*TavoConfigStore::OpenStore(UseEtcdStore(root)), depth);
+    // Enough versions that every replace timed pushes the oldest out, the
+    // same number at every depth; then etcd tidies them (and the deletion
+    // above) away before the timing, as it took the K = 10 row twice as
+    // long as K = 0's to do so after such a start.
+    for (int i = 0; i <= 10; ++i) KarstLib::AddPolicyInfo(policies);
+    EtcdAdmin().CompactAll();
     {
       EtcdCpu etcd(state);
       for (auto _ : state) KarstLib::AddPolicyInfo(policies);
@@ -178,6 +191,9 @@ void BM_StoreReplace(benchmark::State& state) {
     EtcdAdmin().CompactAll();
   });
 }
+
+void BM_StoreReplace(benchmark::State& state) { StoreReplace(state, "kb-add--", 10); }
+void BM_StoreReplaceNoHistory(benchmark::State& state) { StoreReplace(state, "kb-add0-", 0); }
 
 void BM_RawReplace(benchmark::State& state) {
   Guarded(state, [&] {
@@ -334,6 +350,7 @@ void Register() {
           ->Repetitions(10);
     };
     add("BM_StoreReplace", BM_StoreReplace, benchmark::kMillisecond);
+    add("BM_StoreReplaceNoHistory", BM_StoreReplaceNoHistory, benchmark::kMillisecond);
     add("BM_RawReplace", BM_RawReplace, benchmark::kMillisecond);
     add("BM_StoreList", BM_StoreList, benchmark::kMillisecond);
     add("BM_RawList", BM_RawList, benchmark::kMillisecond);

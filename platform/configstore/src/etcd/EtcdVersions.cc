@@ -142,9 +142,9 @@ void AddHistoryChange(etcdserverpb::TxnRequest* txn, const etcdlayout::Keys& key
   AddPut(txn, keys.HistoryHead(), std::move(head));
   std::set<std::string> named;
   for (const auto& entry : current) named.insert(entry.second);
-  // The newest "depth" numbers stay, the current state's among them.
-  const std::uint64_t firstKept =
-      depth == 0 || newest < depth ? (depth == 0 ? newest + 1 : 1) : newest - depth + 1;
+  // The newest "depth" numbers stay (none with depth 0), the current
+  // state's among them.
+  const std::uint64_t firstKept = newest >= depth ? newest - depth + 1 : 1;
   bool forgets = false;
   for (const auto& [number, kept] : history.kept) {
     const bool stays = number >= firstKept;
