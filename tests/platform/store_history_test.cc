@@ -143,6 +143,14 @@ TEST_P(StoreHistoryTest, KeptVersionsReadAsCommittedUnderEveryKindOfWrite) {
   Replace(store, "k", {"z"});
   EXPECT_TRUE(ListVersions(store).empty());
   EXPECT_EQ(NewestVersion(store), newest + 1) << "numbers go on when none is kept";
+
+  // A deep history forgets at once too, however many copies that frees (on
+  // etcd, more than one transaction may hold).
+  SetHistoryDepth(store, 100);
+  for (int i = 0; i < 100; ++i) Replace(store, i % 2 ? "k" : "k2", {std::to_string(i)});
+  SetHistoryDepth(store, 0);
+  EXPECT_TRUE(ListVersions(store).empty());
+  EXPECT_EQ(Copies(), 2);
 }
 
 TEST_P(StoreHistoryTest, RollbackMakesAKeptVersionCurrentAsANewOne) {

@@ -34,6 +34,10 @@ class HistorySource {
       std::uint64_t number, const FilterSpecObject& filter) = 0;
 };
 
+// A new version numbered "number", made now by this host (its name) and the
+// effective user (the name, or the number when it has none).
+StoreVersion NewVersionBy(std::uint64_t number);
+
 // The message of kErrorNoSuchVersion.
 std::string NotKeptMessage(const std::string& where, std::uint64_t number);
 

@@ -3,9 +3,12 @@
 
 #include "TavoConfigStore/StoreHistory.h"
 
+#include <pwd.h>
 #include <sqlite3.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <chrono>
 
 #include "Backend.h"
 #include "HistorySource.h"
@@ -78,6 +81,22 @@ class VersionView final : public Backend {
 };
 
 }  // namespace
+
+StoreVersion NewVersionBy(std::uint64_t number) {
+  StoreVersion version;
+  version.number = number;
+  version.unixTimeMs = std::chrono::duration_cast<std::chrono::milliseconds>(
+                           std::chrono::system_clock::now().time_since_epoch())
+                           .count();
+  char host[256] = {};
+  if (gethostname(host, sizeof(host) - 1) == 0) version.host = host;
+  passwd entry{}, *found = nullptr;
+  char buffer[1024];
+  const bool named =
+      getpwuid_r(geteuid(), &entry, buffer, sizeof(buffer), &found) == 0 && found != nullptr;
+  version.user = named ? found->pw_name : std::to_string(geteuid());
+  return version;
+}
 
 std::string NotKeptMessage(const std::string& where, std::uint64_t number) {
   return where + ": version " + std::to_string(number) + " is not kept";

@@ -328,7 +328,7 @@ bool EtcdCommit::CommitGenerations(const PendingCollections& pending, const Touc
   lease_ = lease;
   if (move) reader_.Moved();
   try {
-    RemoveOrphans(now.orphans);
+    DeleteGenerations(client_, reader_.OwnKeys(), now.orphans);
     if (move) RemoveLegacy(base);
   } catch (const ConfigStoreException&) {
     // Tidying only: the commit stands, and a later writer tidies up.
@@ -401,16 +401,6 @@ std::int64_t EtcdCommit::TakeLease() {
     }
   }
   return client_.LeaseGrant(kLeaseSeconds);
-}
-
-void EtcdCommit::RemoveOrphans(const std::vector<std::string>& orphans) {
-  const Keys& keys = reader_.OwnKeys();
-  Batches batches(client_);
-  for (const std::string& gen : orphans) {
-    batches.Delete(keys.Generation(gen), etcdlayout::PrefixEnd(keys.Generation(gen)));
-    batches.Delete(keys.Registered() + gen);
-  }
-  batches.Finish();
 }
 
 // Deletes the generations of a catalogue a commit moved, which nothing

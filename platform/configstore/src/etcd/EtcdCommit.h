@@ -73,7 +73,6 @@ class EtcdCommit {
   bool Holds(const std::string& witness, const std::string& token);
   void GiveUp(std::int64_t lease);
   std::int64_t TakeLease();
-  void RemoveOrphans(const std::vector<std::string>& orphans);
   void RemoveLegacy(const Pointers& moved);
 
   EtcdClient& client_;

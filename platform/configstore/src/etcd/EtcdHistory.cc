@@ -56,7 +56,15 @@ void EtcdHistory::SetDepth(unsigned depth) {
     }
     etcdserverpb::TxnRequest txn;
     AddHistoryChange(&txn, keys, now.history, now.history.newest, depth, nullptr, current, {});
-    if (client_.Txn(txn)) return;
+    if (client_.Txn(txn)) {
+      // What the switch left of the forgotten versions' generations. Tidying
+      // only: the depth is set, and a later commit collects what is left.
+      try {
+        DeleteGenerations(client_, keys, reader_.ReadPointers(std::string(), true).orphans);
+      } catch (const ConfigStoreException&) {
+      }
+      return;
+    }
     if (attempt == kDepthAttempts) {
       throw ConfigStoreException(
           client_.Where() + ": the history depth could not be set: other writers kept committing",

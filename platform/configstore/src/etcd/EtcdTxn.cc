@@ -96,4 +96,14 @@ void WriteObject(const etcdlayout::Keys& keys, const std::string& gen, const std
   }
 }
 
+void DeleteGenerations(EtcdClient& client, const etcdlayout::Keys& keys,
+                       const std::vector<std::string>& gens) {
+  Batches batches(client);
+  for (const std::string& gen : gens) {
+    batches.Delete(keys.Generation(gen), etcdlayout::PrefixEnd(keys.Generation(gen)));
+    batches.Delete(keys.Registered() + gen);
+  }
+  batches.Finish();
+}
+
 }  // namespace TavoConfigStore

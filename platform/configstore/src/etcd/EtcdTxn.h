@@ -8,6 +8,7 @@
 #include <deque>
 #include <future>
 #include <string>
+#include <vector>
 
 #include "EtcdClient.h"
 #include "EtcdLayout.h"
@@ -56,6 +57,10 @@ class Batches {
   bool started_ = false;
   std::deque<std::future<void>> inFlight_;
 };
+
+// Deletes generations "gens" whole, registration included, in batches.
+void DeleteGenerations(EtcdClient& client, const etcdlayout::Keys& keys,
+                       const std::vector<std::string>& gens);
 
 // Puts an object into generation "gen", in as many parts as its body needs.
 void WriteObject(const etcdlayout::Keys& keys, const std::string& gen, const std::string& instance,

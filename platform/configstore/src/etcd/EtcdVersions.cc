@@ -1,10 +1,6 @@
 #include "EtcdVersions.h"
 
-#include <pwd.h>
-#include <unistd.h>
-
-#include <chrono>
-
+#include "../HistorySource.h"
 #include "../object/Coding.h"
 #include "EtcdTxn.h"
 
@@ -12,22 +8,7 @@ namespace TavoConfigStore {
 namespace {
 
 constexpr char kRecordFormat = 1;
-
-std::string HostName() {
-  char name[256] = {};
-  if (gethostname(name, sizeof(name) - 1) != 0) return "";
-  return name;
-}
-
-// The name of the effective user, or its number when it has none.
-std::string UserName() {
-  passwd entry{}, *found = nullptr;
-  char buffer[1024];
-  if (getpwuid_r(geteuid(), &entry, buffer, sizeof(buffer), &found) == 0 && found != nullptr) {
-    return found->pw_name;
-  }
-  return std::to_string(geteuid());
-}
+constexpr std::size_t kGenerationsInSwitch = 16;
 
 bool GetString(std::string_view* in, std::string* out) {
   std::uint64_t size = 0;
@@ -121,12 +102,7 @@ HistoryState ParseHistory(const etcdlayout::Keys& keys, const etcdwire::Range& r
 
 VersionRecord NewVersion(std::uint64_t number, Generations gens) {
   VersionRecord record;
-  record.about.number = number;
-  record.about.unixTimeMs = std::chrono::duration_cast<std::chrono::milliseconds>(
-                                std::chrono::system_clock::now().time_since_epoch())
-                                .count();
-  record.about.host = HostName();
-  record.about.user = UserName();
+  record.about = NewVersionBy(number);
   record.gens = std::move(gens);
   return record;
 }
@@ -156,8 +132,15 @@ void AddHistoryChange(etcdserverpb::TxnRequest* txn, const etcdlayout::Keys& key
   if (record != nullptr && depth > 0) {
     AddPut(txn, keys.Version(record->about.number), EncodeVersion(*record));
   }
+  // Only so many generations go in the switch itself: a much smaller depth
+  // forgets many versions at once, and all of theirs would pass etcd's
+  // limit of operations in one transaction (128 by default). The rest are
+  // then registered generations nothing names, which the collection of
+  // orphans after a commit deletes in batches.
+  std::size_t deleted = 0;
   for (const std::string& gen : candidates) {
     if (named.count(gen)) continue;
+    if (deleted++ == kGenerationsInSwitch) break;
     AddDeletePrefix(txn, keys.Generation(gen));
     AddDelete(txn, keys.Registered() + gen);
   }

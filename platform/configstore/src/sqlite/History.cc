@@ -1,10 +1,5 @@
 #include "History.h"
 
-#include <pwd.h>
-#include <unistd.h>
-
-#include <chrono>
-
 #include "../HistorySource.h"
 #include "Schema.h"
 #include "TavoConfigStore/ConfigStoreException.h"
@@ -12,28 +7,6 @@
 namespace TavoConfigStore {
 namespace sqlite {
 namespace {
-
-std::string HostName() {
-  char name[256] = {};
-  if (gethostname(name, sizeof(name) - 1) != 0) return "";
-  return name;
-}
-
-// The name of the effective user, or its number when it has none.
-std::string UserName() {
-  passwd entry{}, *found = nullptr;
-  char buffer[1024];
-  if (getpwuid_r(geteuid(), &entry, buffer, sizeof(buffer), &found) == 0 && found != nullptr) {
-    return found->pw_name;
-  }
-  return std::to_string(geteuid());
-}
-
-long long NowMs() {
-  return std::chrono::duration_cast<std::chrono::milliseconds>(
-             std::chrono::system_clock::now().time_since_epoch())
-      .count();
-}
 
 void Step(Connection& conn, sqlite3_stmt* s, const char* what) {
   if (sqlite3_step(s) != SQLITE_DONE) conn.Fail(what);
@@ -109,12 +82,12 @@ void History::Record() {
   sqlite3_stmt* s = conn_.Cached("INSERT INTO versions VALUES(?1, ?2, ?3, ?4)", what);
   {
     Resetter reset(s);
-    BindInt(conn_, s, 1, number, what);
-    BindInt(conn_, s, 2, NowMs(), what);
     // Bound without a copy: the strings must outlive the step.
-    const std::string host = HostName(), user = UserName();
-    conn_.Bind(s, 3, host);
-    conn_.Bind(s, 4, user);
+    const StoreVersion made = NewVersionBy(static_cast<std::uint64_t>(number));
+    BindInt(conn_, s, 1, number, what);
+    BindInt(conn_, s, 2, made.unixTimeMs, what);
+    conn_.Bind(s, 3, made.host);
+    conn_.Bind(s, 4, made.user);
     Step(conn_, s, what);
   }
   s = conn_.Cached(
