@@ -1,6 +1,5 @@
 #include "EtcdHistory.h"
 
-#include <algorithm>
 
 #include "../HistorySource.h"
 #include "../object/DamagedObject.h"
@@ -88,10 +87,6 @@ std::vector<std::shared_ptr<ConfigStoreObject>> EtcdHistory::ListVersion(
     }
     // Every generation at the revision the version was read at: one
     // snapshot, and the version's generations still there.
-    struct Listed {
-      Order order;
-      std::shared_ptr<ConfigStoreObject> object;
-    };
     std::vector<Listed> listed;
     const std::string& instance = filter.Id().InstanceId();
     for (const auto& [name, gen] : record.gens) {
@@ -113,12 +108,7 @@ std::vector<std::shared_ptr<ConfigStoreObject>> EtcdHistory::ListVersion(
                                             kErrorCorruptObject))});
       }
     }
-    std::stable_sort(listed.begin(), listed.end(),
-                     [](const Listed& a, const Listed& b) { return a.order < b.order; });
-    std::vector<std::shared_ptr<ConfigStoreObject>> out;
-    out.reserve(listed.size());
-    for (Listed& l : listed) out.push_back(std::move(l.object));
-    return out;
+    return InWriteOrder(std::move(listed));
   });
 }
 

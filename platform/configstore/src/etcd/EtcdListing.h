@@ -4,12 +4,15 @@
 #ifndef TAVOCONFIGSTORE_SRC_ETCD_ETCD_LISTING_H_
 #define TAVOCONFIGSTORE_SRC_ETCD_ETCD_LISTING_H_
 
+#include <algorithm>
 #include <cstdint>
+#include <memory>
 #include <string>
 #include <string_view>
 #include <vector>
 
 #include "EtcdWire.h"
+#include "TavoConfigStore/StoreObject.h"
 
 namespace TavoConfigStore {
 
@@ -21,6 +24,23 @@ struct Order {
     return revision != other.revision ? revision < other.revision : index < other.index;
   }
 };
+
+// An object read from one of several collections, with its place in write
+// order.
+struct Listed {
+  Order order;
+  std::shared_ptr<ConfigStoreObject> object;
+};
+
+// The objects of "listed" in write order, across their collections.
+inline std::vector<std::shared_ptr<ConfigStoreObject>> InWriteOrder(std::vector<Listed> listed) {
+  std::stable_sort(listed.begin(), listed.end(),
+                   [](const Listed& a, const Listed& b) { return a.order < b.order; });
+  std::vector<std::shared_ptr<ConfigStoreObject>> out;
+  out.reserve(listed.size());
+  for (Listed& l : listed) out.push_back(std::move(l.object));
+  return out;
+}
 
 // One stored object of a generation, its bytes still in the reply.
 struct Entry {

@@ -7,7 +7,6 @@
 // a listing the store keeps for later reads view their bodies there; others
 // get copies, so that the replies they came in can go.
 
-#include <algorithm>
 #include <cstdint>
 #include <memory>
 #include <mutex>
@@ -252,10 +251,6 @@ class EtcdStore final : public Backend, public HistorySource {
     std::shared_ptr<const Listing> listing;
     const Pointers pointers = exact.empty() ? reader_.ReadPointers(exact)
                                             : reader_.ReadCollection(exact, instance, &listing);
-    struct Listed {
-      Order order;
-      std::shared_ptr<ConfigStoreObject> object;
-    };
     std::vector<Listed> listed;
     objectmodel::Arena arena;
     for (const std::string& name : Matching(filter, pointers)) {
@@ -281,12 +276,7 @@ class EtcdStore final : public Backend, public HistorySource {
         listed.push_back({Order{INT64_MAX, put.seq}, DecodePut(collection, put)});
       }
     }
-    std::stable_sort(listed.begin(), listed.end(),
-                     [](const Listed& a, const Listed& b) { return a.order < b.order; });
-    std::vector<std::shared_ptr<ConfigStoreObject>> out;
-    out.reserve(listed.size());
-    for (Listed& l : listed) out.push_back(std::move(l.object));
-    return out;
+    return InWriteOrder(std::move(listed));
   }
 
   // Runs "change" in the open transaction, or in one of its own.
