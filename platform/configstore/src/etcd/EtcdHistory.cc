@@ -1,6 +1,5 @@
 #include "EtcdHistory.h"
 
-
 #include "../HistorySource.h"
 #include "../object/DamagedObject.h"
 #include "../object/Objects.h"
