@@ -366,7 +366,8 @@ bool EtcdCommit::Switch(const TxnRequest& txn, const std::string& witness, const
 
 bool EtcdCommit::Holds(const std::string& witness, const std::string& token) {
   if (witness.empty()) return false;
-  const Current* current = reader_.ReadPointers(witness).Find(witness);
+  const Pointers pointers = reader_.ReadPointers(witness);
+  const Current* current = pointers.Find(witness);
   return current != nullptr && current->token == token;
 }
 
