@@ -463,6 +463,30 @@ TEST(EtcdStoreTest, AClusterThatRefusesFailsEveryOperationAtOnce) {
   SetGlobalStore(nullptr);
 }
 
+// A member that is down is said to refuse, at once, however long it has
+// been down (gRPC waits longer and longer before it connects again). Once it
+// is back, the next call reaches it, from that store and from one opened
+// since alike (gRPC would share one connection between them).
+TEST(EtcdStoreTest, EveryCallConnectsAfreshToAMemberThatFailed) {
+  EtcdCluster etcd;
+  auto before = OpenStore(etcd.Locator("back"));
+  Set(*before, Valued("a"));
+  etcd.Kill(0);
+  for (const auto end = Clock::now() + std::chrono::milliseconds(1500); Clock::now() < end;
+       usleep(10000)) {
+    const auto start = Clock::now();
+    ASSERT_THAT(ErrorOf([&] { ValuesOf(*before); }).what(), ::testing::HasSubstr("refused"));
+    ASSERT_LT(Clock::now() - start, std::chrono::milliseconds(500));
+  }
+  etcd.Restart(0);
+  const auto since = OpenStore(etcd.Locator("back"));
+  for (const auto& store : {since, before}) {
+    const auto start = Clock::now();
+    EXPECT_EQ(ValuesOf(*store), std::vector<std::string>{"a="});
+    EXPECT_LT(Clock::now() - start, std::chrono::milliseconds(500));
+  }
+}
+
 // A loopback port that accepts connections (the kernel does, up to its
 // backlog) and never answers, as a hung member would.
 class SilentMember {

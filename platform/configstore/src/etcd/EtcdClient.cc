@@ -258,6 +258,7 @@ grpc::Status EtcdClient::Invoke(const char* what, const Send& send, std::size_t*
       const Clock::time_point attemptEnd =
           members_.Size() == 1 ? deadline
                                : std::min(deadline, start + first * (1 << std::min(round, 4)));
+      members_[i].Reconnect(attemptEnd);
       grpc::Status status;
       while (true) {
         grpc::ClientContext context;

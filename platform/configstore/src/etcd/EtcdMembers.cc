@@ -15,6 +15,10 @@ namespace {
 constexpr int kInitialReconnectMs = 100;
 constexpr int kMaxReconnectMs = 1000;
 constexpr int kConnectTimeoutMs = 1000;
+// How long a connection tried again has to show its outcome before a
+// request is sent: a refusal from a member on the network comes back well
+// within it.
+constexpr std::chrono::steady_clock::duration kConnectOutcomeWait = std::chrono::milliseconds(50);
 // A stream held on a member that stops answering (a watch) breaks within
 // about 15 s. etcd refuses pings more often than every 5 s.
 constexpr int kKeepaliveMs = 10000;
@@ -55,6 +59,18 @@ EtcdMember::EtcdMember(const std::string& endpoint, const EtcdStoreOptions& opti
       calls(channel),
       lease(etcdserverpb::Lease::NewStub(channel)),
       watch(etcdserverpb::Watch::NewStub(channel)) {}
+
+void EtcdMember::Reconnect(std::chrono::steady_clock::time_point until) {
+  if (channel->GetState(false) != GRPC_CHANNEL_TRANSIENT_FAILURE) return;
+  grpc::experimental::ChannelResetConnectionBackoff(channel.get());
+  // The new attempt's outcome is only seen while some thread waits on gRPC:
+  // without this wait, a refusal would go unseen and the attempt end at its
+  // timeout, as if the member had accepted the connection and said nothing.
+  // A member that is back returns the wait early, ready.
+  const auto wait = std::min(until - std::chrono::steady_clock::now(), kConnectOutcomeWait);
+  channel->WaitForStateChange(GRPC_CHANNEL_TRANSIENT_FAILURE,
+                              std::chrono::system_clock::now() + wait);
+}
 
 EtcdMembers::EtcdMembers(const EtcdStoreOptions& options, const TlsMaterial& material)
     : stalled_(options.endpoints.size(), false) {

@@ -24,6 +24,12 @@ struct EtcdMember {
   EtcdMember(const std::string& endpoint, const EtcdStoreOptions& options,
              const TlsMaterial& material);
 
+  // When the last connection to the member failed, connects again at once
+  // (rather than after a backoff of up to a second) and gives the attempt a
+  // moment, until "until" at most, so that a request is told what the member
+  // does now rather than how an earlier attempt ended.
+  void Reconnect(std::chrono::steady_clock::time_point until);
+
   std::string endpoint;  // HOST:PORT
   std::shared_ptr<grpc::Channel> channel;
   // Unary calls by name, their replies kept as received; the generated
