@@ -1,8 +1,6 @@
 #include "EtcdHistory.h"
 
 #include "../HistorySource.h"
-#include "../object/DamagedObject.h"
-#include "../object/Objects.h"
 #include "EtcdTxn.h"
 
 namespace TavoConfigStore {
@@ -97,14 +95,7 @@ std::vector<std::shared_ptr<ConfigStoreObject>> EtcdHistory::ListVersion(
                              &objects, &entries);
       for (const Entry& entry : entries) {
         id.SetInstanceId(entry.instance);
-        listed.push_back(
-            {entry.order,
-             entry.damage.empty()
-                 ? objectmodel::DecodeOrDamaged(id, entry.body, nullptr, client_.Where())
-                 : std::make_shared<DamagedObject>(
-                       ConfigStoreObjectId(id),
-                       ConfigStoreException(client_.Where() + ": " + entry.damage,
-                                            kErrorCorruptObject))});
+        listed.push_back({entry.order, ObjectOf(id, entry, nullptr, nullptr, client_.Where())});
       }
     }
     return InWriteOrder(std::move(listed));

@@ -5,6 +5,9 @@
 #include <tuple>
 #include <utility>
 
+#include "../object/DamagedObject.h"
+#include "../object/Objects.h"
+
 namespace TavoConfigStore {
 namespace {
 
@@ -120,6 +123,17 @@ void KeepOnly(Pointers* pointers, const Keep& keep) {
 }
 
 }  // namespace
+
+std::shared_ptr<ConfigStoreObject> ObjectOf(ConfigStoreObjectId id, const Entry& entry,
+                                            const std::shared_ptr<const void>& owner,
+                                            objectmodel::Arena* arena, const std::string& where) {
+  if (!entry.damage.empty()) {
+    return std::make_shared<DamagedObject>(
+        std::move(id), ConfigStoreException(where + ": " + entry.damage, kErrorCorruptObject));
+  }
+  if (owner != nullptr) return objectmodel::ViewOrDamaged(std::move(id), entry.body, owner, where);
+  return objectmodel::DecodeOrDamaged(std::move(id), entry.body, arena, where);
+}
 
 EtcdReader::EtcdReader(EtcdClient& client, std::string_view prefix,
                        std::shared_ptr<ListingCache> cache)

@@ -28,6 +28,7 @@
 #include <string_view>
 #include <vector>
 
+#include "../object/Arena.h"
 #include "EtcdClient.h"
 #include "EtcdLayout.h"
 #include "EtcdListing.h"
@@ -64,6 +65,14 @@ struct Pointers {
     return it == byCollection.end() ? nullptr : &it->second;
   }
 };
+
+// The object "entry" holds, with identifier "id": a damaged one when its
+// parts are (the message after "where"); otherwise read in place, kept by
+// "owner", or with "owner" null copied into "arena" (null: memory of its
+// own).
+std::shared_ptr<ConfigStoreObject> ObjectOf(ConfigStoreObjectId id, const Entry& entry,
+                                            const std::shared_ptr<const void>& owner,
+                                            objectmodel::Arena* arena, const std::string& where);
 
 class EtcdReader {
  public:

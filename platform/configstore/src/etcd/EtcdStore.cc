@@ -207,15 +207,8 @@ class EtcdStore final : public Backend, public HistorySource {
                                             objectmodel::Arena* arena) const {
     ConfigStoreObjectId id(collection.Key(), collection.Group(), collection.Component());
     id.SetInstanceId(entry.instance);
-    if (!entry.damage.empty()) {
-      return std::make_shared<DamagedObject>(
-          std::move(id),
-          ConfigStoreException(client_.Where() + ": " + entry.damage, kErrorCorruptObject));
-    }
-    if (listing->kept) {
-      return objectmodel::ViewOrDamaged(std::move(id), entry.body, listing, client_.Where());
-    }
-    return objectmodel::DecodeOrDamaged(std::move(id), entry.body, arena, client_.Where());
+    return ObjectOf(std::move(id), entry, listing->kept ? listing : nullptr, arena,
+                    client_.Where());
   }
 
   // What the open transaction did to a collection, if anything (outside a
