@@ -466,7 +466,7 @@ TEST(EtcdStoreTest, AClusterThatRefusesFailsEveryOperationAtOnce) {
 // A member that is down is said to refuse, at once, however long it has
 // been down (gRPC waits longer and longer before it connects again). Once it
 // is back, the next call reaches it, from that store and from one opened
-// since alike (gRPC would share one connection between them).
+// since alike.
 TEST(EtcdStoreTest, EveryCallConnectsAfreshToAMemberThatFailed) {
   EtcdCluster etcd;
   auto before = OpenStore(etcd.Locator("back"));

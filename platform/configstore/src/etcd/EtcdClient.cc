@@ -19,8 +19,10 @@ constexpr milliseconds kFirstAttempt{1000};
 // After a round in which every member said "not now" (an election under
 // way), the next starts after this pause.
 constexpr milliseconds kBetweenRounds{50};
-// A handshake of the client's own, to tell why TLS failed.
+// A connection of the client's own, to tell why TLS failed, or whether a
+// member said to refuse does.
 constexpr milliseconds kProbeLimit{1000};
+constexpr char kRefused[] = "connection refused";
 // What a call may wait beyond its timeout to settle a failed write.
 constexpr milliseconds kSettling{1000};
 
@@ -179,7 +181,7 @@ grpc::Status EtcdClient::Token(EtcdMember& member, Clock::time_point deadline, s
 TlsFinding EtcdClient::Diagnose(std::size_t i, const std::string& lastError,
                                 Clock::time_point deadline) {
   const std::string& endpoint = members_[i].endpoint;
-  if (Contains(lastError, "Connection refused")) return {0, "connection refused"};
+  if (Contains(lastError, "Connection refused")) return {0, kRefused};
   if (Contains(lastError, "Peer name ")) {
     return {kErrorTlsName, "its certificate does not name " + HostOf(endpoint)};
   }
@@ -312,6 +314,16 @@ grpc::Status EtcdClient::Invoke(const char* what, const Send& send, std::size_t*
               (told.empty() ? " (this call has waited that long for members already)"
                             : " (" + told + ")"),
           EtcdCode(grpc::StatusCode::DEADLINE_EXCEEDED));
+    }
+    // gRPC may answer with how its last connection attempt ended while a new
+    // one is under way: a member refused a moment ago that accepts a
+    // connection now is back, and is given the next round.
+    for (std::size_t i = 0; i < story.size() && !reached; ++i) {
+      reached =
+          story[i] == kRefused &&
+          AcceptsConnections(
+              members_[i].endpoint,
+              std::min(kProbeLimit, std::chrono::duration_cast<milliseconds>(deadline - now)));
     }
     if (!reached) {
       throw ConfigStoreException(

@@ -94,6 +94,15 @@ class Socket {
   int fd_ = -1;
 };
 
+}  // namespace
+
+bool AcceptsConnections(const std::string& endpoint, std::chrono::milliseconds limit) {
+  Socket socket;
+  return socket.Connect(endpoint, Clock::now() + limit);
+}
+
+namespace {
+
 // Whether the member answers an HTTP/2 client in plain text.
 bool SpeaksPlainHttp2(const std::string& endpoint, Clock::time_point deadline) {
   Socket socket;

@@ -26,6 +26,9 @@ struct TlsFinding {
 TlsFinding ProbeTls(const std::string& endpoint, const EtcdStoreOptions& options,
                     const TlsMaterial& material, std::chrono::milliseconds limit);
 
+// Whether "endpoint" (HOST:PORT) accepts a TCP connection within "limit".
+bool AcceptsConnections(const std::string& endpoint, std::chrono::milliseconds limit);
+
 // HOST of "HOST:PORT" or "[HOST]:PORT".
 std::string HostOf(const std::string& endpoint);
 
