@@ -350,9 +350,13 @@ TEST_F(Karstctl, BadCommandLinesAndInputsExitTwoAndLeaveTheStoreAlone) {
       {imp, R"({"policies": [], "datastores": [{"url": "u", "policy": "p"}]})",
        "datastores[0]: unknown key \"policy\""},
       {{"rollback", "x"}, "", "rollback needs a version number"},
+      {{"rollback", "-1"},
+       "",
+       "rollback needs a version number (1 or more, as history lists them), not '-1'"},
       {{"export", "--version", "0"}, "", "--version needs a version number"},
+      {{"export", "--version", "-2"}, "", "--version needs a version number"},
       {{"import", "--version", "1", "-"}, "{}", "'import' does not read the catalogue"},
-      {{"history", "depth", "-1"}, "", "unknown option '-1'"},
+      {{"history", "depth", "-1"}, "", "history depth needs a number of versions"},
       {{"history", "depth", "many"}, "", "history depth needs a number of versions"},
   };
   for (const Case& c : cases) {

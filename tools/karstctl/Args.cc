@@ -52,6 +52,14 @@ std::optional<std::string> OptionValue(const std::vector<std::string>& args, std
 }
 
 // The group word ("blob") of commands named by two words.
+// A whole number, negative ones included: an operand, such as a version
+// given as "-1", that the command itself then names as wrong, rather than
+// an unknown option.
+bool IsNumber(const std::string& arg) {
+  const std::size_t digits = arg.compare(0, 1, "-") == 0 ? 1 : 0;
+  return arg.size() > digits && arg.find_first_not_of("0123456789", digits) == std::string::npos;
+}
+
 bool IsGroup(const std::string& word) {
   for (const auto& entry : CommandTable()) {
     if (entry.words.size() > 1 && entry.words[0] == word) return true;
@@ -133,7 +141,7 @@ Invocation ParseArgs(const std::vector<std::string>& args) {
   std::vector<std::string> commandOptions;  // those only some commands take
   for (std::size_t at = 0; at < args.size(); ++at) {
     const std::string& arg = args[at];
-    if (optionsEnded || arg == "-" || arg.compare(0, 1, "-") != 0) {
+    if (optionsEnded || arg == "-" || arg.compare(0, 1, "-") != 0 || IsNumber(arg)) {
       words.push_back(arg);
     } else if (arg == "--") {
       optionsEnded = true;
@@ -143,9 +151,7 @@ Invocation ParseArgs(const std::vector<std::string>& args) {
       invocation.kept = arg.substr(10);
     } else if (arg == "--version") {
       // Followed by a number, a kept version to read; alone, this tool's.
-      const bool number = at + 1 < args.size() && !args[at + 1].empty() &&
-                          args[at + 1].find_first_not_of("0123456789") == std::string::npos;
-      if (number) {
+      if (at + 1 < args.size() && IsNumber(args[at + 1])) {
         invocation.kept = args[++at];
       } else {
         version = true;
