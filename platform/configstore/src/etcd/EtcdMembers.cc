@@ -36,10 +36,6 @@ std::shared_ptr<grpc::Channel> ChannelTo(const std::string& endpoint,
   arguments.SetInt(GRPC_ARG_KEEPALIVE_TIME_MS, kKeepaliveMs);
   arguments.SetInt(GRPC_ARG_KEEPALIVE_TIMEOUT_MS, kKeepaliveTimeoutMs);
   arguments.SetInt(GRPC_ARG_HTTP2_MAX_PINGS_WITHOUT_DATA, 0);
-  // gRPC shares a connection among a process's channels to one address:
-  // a store opened after a member came back would be answered with how
-  // another store's last attempt ended. Each store connects for itself.
-  arguments.SetInt(GRPC_ARG_USE_LOCAL_SUBCHANNEL_POOL, 1);
   std::shared_ptr<grpc::ChannelCredentials> credentials = grpc::InsecureChannelCredentials();
   if (options.tls) {
     grpc::SslCredentialsOptions ssl;
