@@ -132,6 +132,7 @@ TEST_F(EtcdLocatorTest, ReadsEveryPartAndTakesWhatItLeavesOutFromTheEnvironment)
       {"etcd://h:1/p?cache=999999", kNone, "h:1 /p plain : || 5000 999999"},
       // The environment is taken literally; its files only for etcds.
       {"etcd://h:1/p", kAll, "h:1 /p plain eu:e%pw || 5000 64"},
+      {"etcds://h:1/p", kAll, "h:1 /p tls eu:e%pw /e/ca|/e/c|/e/k 5000 64"},
       {"etcds://h:1/p?cacert=/mine", kAll, "h:1 /p tls eu:e%pw /mine|/e/c|/e/k 5000 64"},
       {"etcd://me@h:1/p", {"eu", "epw"}, "h:1 /p plain me:epw || 5000 64"},
       {"etcd://me:mine@h:1/p", {"eu", "epw"}, "h:1 /p plain me:mine || 5000 64"},
