@@ -474,6 +474,15 @@ TEST_F(SqliteStoreTest, WaitForChangeSeesOtherConnectionsCommits) {
   watcher->AbortTransaction();
 }
 
+// A store that cannot see other writers (the memory store, a host's own)
+// waits the whole time and says "read again", so that a caller watching it
+// polls rather than spins.
+TEST(MemoryStoreTest, WaitForChangeWaitsAndSaysReadAgain) {
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_TRUE(NewMemoryStore()->WaitForChange(100));
+  EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(100));
+}
+
 // The watcher follows the path, not the file: a store moved over it (as a
 // deploy does) or removed and made again is a change, and reads then see
 // the file that is there, never pages the old file left in the log.
