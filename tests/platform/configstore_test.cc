@@ -329,7 +329,16 @@ TEST_F(SqliteStoreTest, ConnectionsSeeOnlyCommittedWrites) {
   Set(*reader, Sample("r1"));
   Set(*reader, Sample("r2"));
   inTransaction("w2");
-  EXPECT_THAT(List(*reader), ElementsAre("y", "from reader", "w1", "r1", "r2", "w2"));
+  // The same after a write in a transaction of its own, whose count a
+  // later transaction must not reuse.
+  Set(*writer, Sample("w3"));
+  Set(*reader, Obj("other", "g", "c", "r3"));
+  Set(*reader, Obj("other", "g", "c", "r4"));
+  writer->BeginTransaction();
+  Set(*writer, Sample("w4"));
+  writer->CommitTransaction();
+  EXPECT_THAT(List(*reader),
+              ElementsAre("y", "from reader", "w1", "r1", "r2", "w2", "w3", "r3", "r4", "w4"));
 }
 
 // The catalogue is private whatever the umask: directories the store makes
