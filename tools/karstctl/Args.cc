@@ -51,7 +51,6 @@ std::optional<std::string> OptionValue(const std::vector<std::string>& args, std
   return args[at];
 }
 
-// The group word ("blob") of commands named by two words.
 // A whole number, negative ones included: an operand, such as a version
 // given as "-1", that the command itself then names as wrong, rather than
 // an unknown option.
@@ -60,6 +59,7 @@ bool IsNumber(const std::string& arg) {
   return arg.size() > digits && arg.find_first_not_of("0123456789", digits) == std::string::npos;
 }
 
+// The group word ("blob") of commands named by two words.
 bool IsGroup(const std::string& word) {
   for (const auto& entry : CommandTable()) {
     if (entry.words.size() > 1 && entry.words[0] == word) return true;

@@ -94,15 +94,6 @@ class Socket {
   int fd_ = -1;
 };
 
-}  // namespace
-
-bool AcceptsConnections(const std::string& endpoint, std::chrono::milliseconds limit) {
-  Socket socket;
-  return socket.Connect(endpoint, Clock::now() + limit);
-}
-
-namespace {
-
 // Whether the member answers an HTTP/2 client in plain text.
 bool SpeaksPlainHttp2(const std::string& endpoint, Clock::time_point deadline) {
   Socket socket;
@@ -289,6 +280,11 @@ std::string HostOf(const std::string& endpoint) {
   std::string host = endpoint.substr(0, endpoint.rfind(':'));
   if (host.size() > 1 && host.front() == '[') host = host.substr(1, host.size() - 2);
   return host;
+}
+
+bool AcceptsConnections(const std::string& endpoint, std::chrono::milliseconds limit) {
+  Socket socket;
+  return socket.Connect(endpoint, Clock::now() + limit);
 }
 
 TlsFinding ProbeTls(const std::string& endpoint, const EtcdStoreOptions& options,
